@@ -1,0 +1,105 @@
+#include "platform/queue/SerialQueue.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <future>
+
+namespace ek {
+namespace {
+
+TEST(SerialQueue, RunsAsyncBlocksInSubmissionOrder) {
+  QueuePool pool(4);
+  auto queue = SerialQueue::make("order", pool.context());
+  std::vector<int> seen;
+  std::promise<void> finished;
+  for (int i = 0; i < 1000; ++i) {
+    queue->async([&, i] {
+      seen.push_back(i);
+      if (i == 999) finished.set_value();
+    });
+  }
+  finished.get_future().wait();
+  ASSERT_EQ(seen.size(), 1000u);
+  for (int i = 0; i < 1000; ++i) EXPECT_EQ(seen[i], i);
+}
+
+TEST(SerialQueue, NeverRunsTwoBlocksAtOnce) {
+  QueuePool pool(4);
+  auto queue = SerialQueue::make("exclusive", pool.context());
+  std::atomic<int> inside{0};
+  std::atomic<bool> overlapped{false};
+  std::atomic<int> done{0};
+  auto body = [&] {
+    if (inside.fetch_add(1) != 0) overlapped = true;
+    std::this_thread::yield();
+    inside.fetch_sub(1);
+    done.fetch_add(1);
+  };
+  std::vector<std::thread> producers;
+  for (int t = 0; t < 4; ++t) {
+    producers.emplace_back([&] {
+      for (int i = 0; i < 500; ++i) {
+        if (i % 5 == 0) {
+          queue->sync(body);
+        } else {
+          queue->async(body);
+        }
+      }
+    });
+  }
+  for (auto& t : producers) t.join();
+  std::promise<void> flushed;
+  queue->async([&] { flushed.set_value(); });
+  flushed.get_future().wait();
+  EXPECT_FALSE(overlapped);
+  EXPECT_EQ(done.load(), 2000);
+}
+
+TEST(SerialQueue, SyncRunsOnTheCallerAfterEarlierBlocks) {
+  QueuePool pool(2);
+  auto queue = SerialQueue::make("sync", pool.context());
+  std::vector<int> seen;
+  queue->async([&] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    seen.push_back(1);
+  });
+  std::thread::id ranOn;
+  queue->sync([&] {
+    seen.push_back(2);
+    ranOn = std::this_thread::get_id();
+    EXPECT_TRUE(queue->isCurrent());
+  });
+  EXPECT_EQ(ranOn, std::this_thread::get_id());
+  EXPECT_EQ(seen, (std::vector<int>{1, 2}));
+  EXPECT_FALSE(queue->isCurrent());
+}
+
+TEST(SerialQueue, KnowsWhichQueueIsCurrentAcrossNesting) {
+  QueuePool pool(2);
+  auto outer = SerialQueue::make("outer", pool.context());
+  auto inner = SerialQueue::make("inner", pool.context());
+  std::promise<std::tuple<bool, bool, std::string>> result;
+  outer->async([&] {
+    inner->sync([&] {
+      result.set_value({outer->isCurrent(), inner->isCurrent(), SerialQueue::currentLabel()});
+    });
+  });
+  auto [outerCurrent, innerCurrent, label] = result.get_future().get();
+  EXPECT_TRUE(outerCurrent);
+  EXPECT_TRUE(innerCurrent);
+  EXPECT_EQ(label, "inner");
+}
+
+TEST(SerialQueueDeathTest, SyncIntoTheCurrentQueueAborts) {
+  EXPECT_DEATH(
+      {
+        QueuePool pool(1);
+        auto queue = SerialQueue::make("self", pool.context());
+        queue->sync([&] { queue->sync([] {}); });
+      },
+      "re-entered queue \"self\"");
+}
+
+}  // namespace
+}  // namespace ek
