@@ -1,0 +1,30 @@
+#pragma once
+
+#include <cstdint>
+#include <span>
+#include <vector>
+
+#include "platform/value/Result.h"
+#include "platform/value/Value.h"
+
+namespace ek::cbor {
+
+inline constexpr size_t kMaxDepth = 512;
+
+// Appends the CBOR encoding of value (definite lengths, shortest forms) to out. A double or a
+// date's seconds take the shortest of half, single and double float that holds the number
+// exactly; every NaN becomes the half-precision NaN f97e00. Strings are written as they are:
+// one that is not UTF-8 will not decode.
+void encode(const Value& value, std::vector<uint8_t>& out);
+std::vector<uint8_t> encode(const Value& value);
+
+// Decodes exactly one CBOR data item spanning all of bytes into the value model. Refuses,
+// with a Format error, anything the value model cannot carry, a map key that is not text,
+// nesting deeper than kMaxDepth, a declared length larger than the bytes that remain, and
+// trailing bytes. Never allocates more than a small multiple of the input's size.
+// Indefinite-length strings, arrays and maps are accepted under the same bounds; half and
+// single floats become doubles; tag 1 may wrap an integer or a float. Null, undefined, other
+// simple values, other tags, duplicate map keys and text that is not UTF-8 are refused.
+Result<Value> decode(std::span<const uint8_t> bytes);
+
+}  // namespace ek::cbor
