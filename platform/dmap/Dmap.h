@@ -1,0 +1,64 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+#include <string_view>
+
+#include "platform/value/Result.h"
+#include "platform/value/Value.h"
+
+// dmap: the structured-dictionary file format. A UTF-8 XML document whose root element
+// <dmap version="1.0"> holds exactly one value:
+//
+//   <dict>      <key>text</key> followed by one value, repeated; keys unique
+//   <array>     values
+//   <string>    text (only the predefined entities and numeric character references)
+//   <integer>   decimal; signed 64-bit, or unsigned 64-bit above the signed range
+//   <real>      decimal floating point, read as a double
+//   <true/> <false/>
+//   <date>      YYYY-MM-DDTHH:MM:SSZ (UTC), read as seconds since 1970
+//   <data>      base64, whitespace allowed anywhere inside
+//
+// The reader never fetches anything from outside the document: a DOCTYPE is accepted only in
+// its bare form (<!DOCTYPE dmap>, no external identifier, no internal subset) and any entity
+// declaration is refused.
+namespace ek::dmap {
+
+// Dictionaries and arrays nest at most this deep (the root container is level 1).
+inline constexpr size_t kMaxDepth = 512;
+// Files larger than this are refused before they are read; parse() and write() hold
+// documents to the same bound, so everything written can be read back.
+inline constexpr size_t kMaxFileSize = 64 * 1024 * 1024;
+
+// Parses a dmap document. Errors are Format errors whose message names the line
+// ("line 12: duplicate key \"x\"").
+Result<Value> parse(std::string_view bytes);
+
+// Reads and parses a file. A missing file is the POSIX error ENOENT; other system failures
+// carry their errno. A file that is not a regular file is a Format error, a file larger than
+// kMaxFileSize the POSIX error EFBIG; neither is read. Content errors are Format errors naming
+// the file and line ("<path>: line 12: ...").
+Result<Value> readFile(const std::string& path);
+
+// Writes the value as a dmap document, indented with tabs. Values the format cannot carry are
+// refused with a Format error: strings or keys that are not valid UTF-8 or hold characters
+// XML 1.0 forbids (C0 controls other than tab, line feed and carriage return; U+FFFE, U+FFFF),
+// non-finite doubles or dates, dates outside the years 0000-9999, nesting deeper than
+// kMaxDepth and documents larger than kMaxFileSize.
+// Lossy on purpose: a UUID is written as its canonical string (and reads back as a string);
+// a date is written to the whole second, rounded down.
+Result<std::string> write(const Value& value);
+
+// Replaces path atomically and durably: a temporary file in the same directory, fchmod to
+// mode (exactly, the umask does not apply), fsync, rename, fsync of the directory. On failure
+// the temporary file is removed, the target is left as it was and the POSIX error returned
+// (only a failure to sync the directory comes after the rename: the new file is then in
+// place). A symbolic link at path is replaced, not followed. A value write() refuses is its
+// Format error, and nothing is touched.
+Result<void> writeFileAtomically(const std::string& path, const Value& value, mode_t mode = 0644);
+// The same for raw bytes.
+Result<void> writeBytesAtomically(const std::string& path, std::string_view bytes,
+                                  mode_t mode = 0644);
+
+}  // namespace ek::dmap
