@@ -1,0 +1,115 @@
+#include "platform/process/Process.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <string>
+#include <string_view>
+
+namespace ek {
+
+UniqueFd& UniqueFd::operator=(UniqueFd&& other) noexcept {
+  if (this != &other) reset(other.release());
+  return *this;
+}
+
+UniqueFd::~UniqueFd() {
+  reset();
+}
+
+int UniqueFd::release() {
+  int fd = fd_;
+  fd_ = -1;
+  return fd;
+}
+
+void UniqueFd::reset(int fd) {
+  if (fd_ >= 0) ::close(fd_);
+  fd_ = fd;
+}
+
+namespace {
+
+std::shared_ptr<UniqueFd> openPidfd(pid_t pid) {
+#ifdef SYS_pidfd_open
+  int fd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+  if (fd >= 0) {
+    // pidfd_open sets close-on-exec itself; the pidfd must never leak into a child.
+    return std::make_shared<UniqueFd>(fd);
+  }
+#else
+  (void)pid;
+#endif
+  return nullptr;
+}
+
+}  // namespace
+
+std::optional<AuditToken> AuditToken::forSocket(int fd) {
+  struct ucred credentials {};
+  socklen_t length = sizeof credentials;
+  if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0) return std::nullopt;
+  if (length != sizeof credentials || credentials.pid <= 0) {
+    errno = EINVAL;
+    return std::nullopt;
+  }
+  AuditToken token;
+  token.pid = credentials.pid;
+  token.uid = credentials.uid;
+  token.gid = credentials.gid;
+  // A peer that exited before we asked has no pidfd (ESRCH); its token still says who it was,
+  // and alive() answers false through kill().
+  token.pidfd = openPidfd(credentials.pid);
+  return token;
+}
+
+AuditToken AuditToken::self() {
+  AuditToken token;
+  token.pid = getpid();
+  token.uid = geteuid();
+  token.gid = getegid();
+  token.pidfd = openPidfd(token.pid);
+  return token;
+}
+
+bool AuditToken::alive() const {
+  if (pidfd && pidfd->valid()) {
+    struct pollfd p {
+      pidfd->get(), POLLIN, 0
+    };
+    int r;
+    do {
+      r = poll(&p, 1, 0);
+    } while (r < 0 && errno == EINTR);
+    if (r >= 0) return r == 0;  // readable means the process has exited
+  }
+  if (pid <= 0) return false;
+  // Without a pidfd the pid may have been reused; this is the best the kernel offers then.
+  return kill(pid, 0) == 0 || errno == EPERM;
+}
+
+std::optional<std::string> executablePathForPid(pid_t pid) {
+  if (pid <= 0) return std::nullopt;
+  constexpr size_t kMaxPath = 2048;
+  char buffer[kMaxPath];
+  std::string link = "/proc/" + std::to_string(pid) + "/exe";
+  ssize_t n = readlink(link.c_str(), buffer, sizeof buffer);
+  // A result that fills the buffer may have been cut short: no answer rather than a wrong one.
+  if (n <= 0 || static_cast<size_t>(n) >= sizeof buffer) return std::nullopt;
+  std::string path(buffer, static_cast<size_t>(n));
+  // The kernel marks a replaced or removed executable with this suffix. The name is still the
+  // one the program was started from, which is what callers match against; whether the file
+  // at that path is the same program is for them to judge (code signing reads the file anew).
+  constexpr std::string_view kDeleted = " (deleted)";
+  if (path.size() > kDeleted.size() && path.ends_with(kDeleted)) {
+    path.resize(path.size() - kDeleted.size());
+  }
+  return path;
+}
+
+}  // namespace ek
