@@ -1,0 +1,198 @@
+#pragma once
+
+#include <asio/any_io_executor.hpp>
+#include <asio/io_context.hpp>
+#include <asio/local/stream_protocol.hpp>
+#include <asio/strand.hpp>
+
+#include <atomic>
+#include <cstdint>
+#include <deque>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/process/Process.h"
+#include "platform/queue/SerialQueue.h"
+#include "platform/value/Result.h"
+#include "platform/value/Value.h"
+
+// Wyre: message IPC over Unix stream sockets. Each message travels in one frame: a 16-byte
+// big-endian header (body length, flags, message id) and one CBOR data item.
+namespace ek::wyre {
+
+inline constexpr size_t kHeaderSize = 16;
+inline constexpr uint32_t kMaxBodySize = 64u << 20;
+inline constexpr uint32_t kFlagWantsReply = 1u << 0;
+inline constexpr uint32_t kFlagReply = 1u << 1;
+// Replies a peer has not read yet beyond this close its connection.
+inline constexpr size_t kMaxQueuedOutput = 8u << 20;
+// A connection stops reading while this many of its requests are unanswered.
+inline constexpr size_t kMaxUnansweredRequests = 256;
+
+inline constexpr std::string_view kErrorDomain = "Wyre";
+inline constexpr int32_t kConnectionInvalid = 1;
+inline constexpr int32_t kTerminationImminent = 2;
+EkError connectionInvalidError();
+EkError terminationImminentError();
+
+struct FrameHeader {
+  uint32_t length = 0;
+  uint32_t flags = 0;
+  uint64_t id = 0;
+};
+void encodeHeader(const FrameHeader& header, uint8_t* out);
+FrameHeader decodeHeader(const uint8_t* in);
+// Appends one whole frame carrying body to out.
+void appendFrame(std::vector<uint8_t>& out, const Value& body, uint32_t flags, uint64_t id);
+
+// A service name must be usable as one file name in the runtime directory.
+bool isValidServiceName(std::string_view name);
+
+struct Message {
+  Value body;
+  uint64_t id = 0;
+  uint32_t flags = 0;
+  bool wantsReply() const { return flags & kFlagWantsReply; }
+};
+
+enum class EventType { Message, Error };
+
+// What a connection delivers to its handler: a message, or an error (connection-invalid when
+// the peer closed or the connection failed; termination-imminent is never raised by sockets).
+struct Event {
+  EventType type = EventType::Message;
+  Message message;
+  EkError error;
+
+  bool isConnectionInvalid() const {
+    return type == EventType::Error && error.code == kConnectionInvalid;
+  }
+};
+
+class Connection : public std::enable_shared_from_this<Connection> {
+ public:
+  using EventHandler = std::function<void(const Event&)>;
+  // Receives the reply, or connection-invalid when the connection ends first.
+  using ReplyHandler = std::function<void(Result<Value>)>;
+
+  // Connects to the service named name. Events and replies are delivered on deliveryQueue
+  // when one is given, else on the connection's own event queue.
+  static Result<std::shared_ptr<Connection>> connect(
+      std::string_view serviceName, std::shared_ptr<SerialQueue> deliveryQueue = nullptr,
+      asio::io_context& context = QueuePool::shared().context());
+  // Adopts an accepted socket (the listener's side).
+  static std::shared_ptr<Connection> adopt(asio::local::stream_protocol::socket socket,
+                                           AuditToken token);
+  ~Connection();
+
+  // Set before resume; events arrive in order, one at a time.
+  void setEventHandler(EventHandler handler);
+  void resume();
+  // Closes the connection; the handler then receives connection-invalid once.
+  void cancel();
+
+  // Thread-safe sends. The body is encoded on the caller's thread.
+  void send(const Value& message);
+  void sendWithReply(const Value& message, ReplyHandler handler);
+  // Answers a request received on this connection. A request that wanted no reply, or a
+  // connection that has ended, makes this a no-op.
+  void reply(const Message& request, const Value& reply);
+  // The receiver will never answer this request: frees its place among the unanswered.
+  void dropRequest(const Message& request);
+
+  const AuditToken& auditToken() const { return token_; }
+  pid_t pid() const { return token_.pid; }
+  // Kept alive until the connection itself is freed (its finalizer drops it).
+  void setContext(std::shared_ptr<void> context) { context_ = std::move(context); }
+  std::string description() const;
+  bool isValid() const { return !closed_.load(); }
+
+  // Bytes of encoded output not yet written to the socket.
+  size_t queuedOutputBytes() const { return queuedBytes_.load(); }
+
+ private:
+  Connection(asio::local::stream_protocol::socket socket, AuditToken token,
+             std::shared_ptr<SerialQueue> deliveryQueue);
+
+  void readMore();
+  void parseInput();
+  void enqueueOutput(std::vector<uint8_t> frame, bool answersRequest);
+  void writeMore();
+  void fail();
+  void deliver(Event event);
+  void deliverReply(ReplyHandler handler, Result<Value> result);
+
+  asio::local::stream_protocol::socket socket_;
+  asio::strand<asio::any_io_executor> strand_;
+  AuditToken token_;
+  std::shared_ptr<SerialQueue> deliveryQueue_;
+  std::shared_ptr<void> context_;
+
+  // Touched on strand_ only.
+  EventHandler handler_;
+  // An open connection keeps itself alive, even while no read is pending (reading pauses
+  // while requests wait for their replies); ending it drops this reference.
+  std::shared_ptr<Connection> keepAlive_;
+  std::vector<uint8_t> input_;  // bytes [inputStart_, inputEnd_) are received, not yet parsed
+  size_t inputStart_ = 0;
+  size_t inputEnd_ = 0;
+  bool reading_ = false;
+  bool resumed_ = false;
+  std::deque<std::vector<uint8_t>> output_;
+  bool writing_ = false;
+  size_t unanswered_ = 0;
+
+  std::atomic<bool> closed_{false};
+  std::atomic<size_t> queuedBytes_{0};
+  std::atomic<uint64_t> nextId_{1};
+  std::mutex pendingMutex_;
+  std::map<uint64_t, ReplyHandler> pending_;  // guarded by pendingMutex_
+};
+
+// What a listener delivers: a new connection, or an error.
+struct ListenerEvent {
+  std::shared_ptr<Connection> connection;
+  std::optional<EkError> error;
+};
+
+class Listener : public std::enable_shared_from_this<Listener> {
+ public:
+  using EventHandler = std::function<void(const ListenerEvent&)>;
+
+  // Listens on the service named name: adopts a socket passed by socket activation, else
+  // binds $EKORA_RUNTIME_DIR/<name> (mode 0666), replacing a socket file left by a dead
+  // process. Fails when another process listens there. Events are delivered on queue.
+  static Result<std::shared_ptr<Listener>> create(
+      std::string_view serviceName, std::shared_ptr<SerialQueue> queue,
+      asio::io_context& context = QueuePool::shared().context());
+  ~Listener();
+
+  void setEventHandler(EventHandler handler);
+  // Starts accepting. Nothing is accepted before.
+  void resume();
+  // Stops accepting, and returns once it has; the handler receives connection-invalid. The
+  // socket file is removed unless it was passed in by socket activation.
+  void cancel();
+
+  const std::string& path() const { return path_; }
+  bool activated() const { return activated_; }
+
+ private:
+  Listener(asio::io_context& context, std::shared_ptr<SerialQueue> queue);
+  void acceptMore();
+
+  asio::local::stream_protocol::acceptor acceptor_;
+  asio::strand<asio::io_context::executor_type> strand_;
+  std::shared_ptr<SerialQueue> queue_;
+  EventHandler handler_;
+  std::string path_;
+  bool activated_ = false;
+  std::atomic<bool> cancelled_{false};
+};
+
+}  // namespace ek::wyre
