@@ -1,0 +1,225 @@
+#include "Ekora/EkSandbox.h"
+
+#include <fmt/format.h>
+#include <limits.h>
+#include <openssl/crypto.h>
+#include <openssl/evp.h>
+#include <openssl/hmac.h>
+#include <openssl/rand.h>
+#include <stdlib.h>
+#include <sys/stat.h>
+
+#include <array>
+#include <atomic>
+#include <cerrno>
+#include <charconv>
+
+namespace ek {
+
+namespace {
+
+constexpr char kSeparator = ';';
+constexpr size_t kMaxFlagsDigits = 10;
+
+// Handles are unique across every sandbox of the process.
+std::atomic<int64_t> nextHandle{1};
+
+std::string toHex(std::string_view bytes) {
+  static constexpr char kDigits[] = "0123456789abcdef";
+  std::string hex;
+  hex.reserve(bytes.size() * 2);
+  for (unsigned char byte : bytes) {
+    hex.push_back(kDigits[byte >> 4]);
+    hex.push_back(kDigits[byte & 0xf]);
+  }
+  return hex;
+}
+
+int hexDigit(char c) {
+  if (c >= '0' && c <= '9') return c - '0';
+  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+  return -1;  // upper case is refused too: a token has exactly one spelling
+}
+
+std::optional<std::string> fromHex(std::string_view hex) {
+  if (hex.size() % 2 != 0) return std::nullopt;
+  std::string bytes;
+  bytes.reserve(hex.size() / 2);
+  for (size_t i = 0; i < hex.size(); i += 2) {
+    const int high = hexDigit(hex[i]);
+    const int low = hexDigit(hex[i + 1]);
+    if (high < 0 || low < 0) return std::nullopt;
+    bytes.push_back(static_cast<char>((high << 4) | low));
+  }
+  return bytes;
+}
+
+bool isValidClass(std::string_view extensionClass) {
+  if (extensionClass.empty() || extensionClass.size() > sandbox::kMaxClassLength) return false;
+  for (char c : extensionClass) {
+    if (c <= ' ' || c > '~' || c == kSeparator) return false;
+  }
+  return true;
+}
+
+bool isValidSubject(std::string_view subject) {
+  return !subject.empty() && subject.size() <= sandbox::kMaxSubjectLength &&
+         subject.find('\0') == std::string_view::npos;
+}
+
+// Decimal without leading zeros, so that one flags value has one spelling.
+std::optional<uint32_t> parseFlags(std::string_view text) {
+  if (text.empty() || text.size() > kMaxFlagsDigits || (text.size() > 1 && text[0] == '0')) {
+    return std::nullopt;
+  }
+  uint32_t value = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value);
+  if (error != std::errc() || end != text.data() + text.size()) return std::nullopt;
+  return value;
+}
+
+std::optional<std::array<uint8_t, sandbox::kTagSize>> computeTag(const EkSandboxKey& key,
+                                                                 std::string_view message) {
+  std::array<uint8_t, sandbox::kTagSize> tag;
+  unsigned int length = 0;
+  if (HMAC(EVP_sha256(), key.data(), static_cast<int>(key.size()),
+           reinterpret_cast<const unsigned char*>(message.data()), message.size(), tag.data(),
+           &length) == nullptr ||
+      length != tag.size()) {
+    return std::nullopt;
+  }
+  return tag;
+}
+
+// The grant a token carries when its form is right and its tag verifies.
+std::optional<EkSandboxGrant> verify(std::string_view token, const EkSandboxKey& key) {
+  if (token.size() > sandbox::kMaxTokenLength) return std::nullopt;
+  std::array<std::string_view, 5> fields;
+  size_t start = 0;
+  for (size_t index = 0; index < fields.size(); ++index) {
+    const size_t end = token.find(kSeparator, start);
+    const bool last = index + 1 == fields.size();
+    if (last != (end == std::string_view::npos)) return std::nullopt;
+    fields[index] = token.substr(start, last ? std::string_view::npos : end - start);
+    start = end + 1;
+  }
+  const auto& [extensionClass, flagsText, subjectHex, nonceHex, tagHex] = fields;
+  if (!isValidClass(extensionClass)) return std::nullopt;
+  const std::optional<uint32_t> flags = parseFlags(flagsText);
+  if (!flags) return std::nullopt;
+  if (subjectHex.size() > 2 * sandbox::kMaxSubjectLength) return std::nullopt;
+  std::optional<std::string> subject = fromHex(subjectHex);
+  if (!subject || !isValidSubject(*subject)) return std::nullopt;
+  if (nonceHex.size() != 2 * sandbox::kNonceSize || !fromHex(nonceHex)) return std::nullopt;
+  if (tagHex.size() != 2 * sandbox::kTagSize) return std::nullopt;
+  const std::optional<std::string> tag = fromHex(tagHex);
+  if (!tag) return std::nullopt;
+
+  const std::string_view message = token.substr(0, token.size() - tagHex.size() - 1);
+  const auto expected = computeTag(key, message);
+  if (!expected || CRYPTO_memcmp(expected->data(), tag->data(), expected->size()) != 0) {
+    return std::nullopt;
+  }
+  return EkSandboxGrant{std::string(extensionClass), *flags, std::move(*subject)};
+}
+
+}  // namespace
+
+EkSandbox::EkSandbox(std::shared_ptr<EkSandboxKeySource> keys) : keys_(std::move(keys)) {}
+
+std::shared_ptr<EkSandbox> EkSandbox::system() {
+  static const std::shared_ptr<EkSandbox> sandbox =
+      std::make_shared<EkSandbox>(std::make_shared<EkSandboxFileKeySource>());
+  return sandbox;
+}
+
+Result<std::string> EkSandbox::issueFileExtension(std::string_view path, uint32_t flags) {
+  const std::string requested(path);
+  if (requested.empty() || requested.front() != '/' || requested.find('\0') != std::string::npos ||
+      requested.size() >= PATH_MAX) {
+    return EkError::posix(EINVAL, fmt::format("cannot issue an extension for \"{}\"", requested));
+  }
+  std::string subject;
+  if ((flags & sandbox::kCanonicalizeFlag) != 0) {
+    char* resolved = ::realpath(requested.c_str(), nullptr);
+    if (resolved == nullptr) return EkError::fromErrno(errno, requested);
+    subject = resolved;
+    ::free(resolved);
+  } else {
+    struct stat status;
+    if (::stat(requested.c_str(), &status) != 0) return EkError::fromErrno(errno, requested);
+    subject = requested;
+  }
+  return issue(sandbox::kReadOnlyFileClass, flags, subject);
+}
+
+Result<std::string> EkSandbox::issueServiceExtension(std::string_view extensionClass,
+                                                     std::string_view serviceName, uint32_t flags) {
+  if (!isValidClass(extensionClass) || !isValidSubject(serviceName)) {
+    return EkError::posix(EINVAL, "cannot issue a service extension for that class and name");
+  }
+  return issue(extensionClass, flags, serviceName);
+}
+
+Result<std::string> EkSandbox::issue(std::string_view extensionClass, uint32_t flags,
+                                     std::string_view subject) {
+  if (!isValidSubject(subject)) {
+    return EkError::posix(ENAMETOOLONG, "the extension's subject is too long");
+  }
+  Result<EkSandboxKey> key = keys_->key();
+  if (!key) return std::move(key).error();
+  std::array<uint8_t, sandbox::kNonceSize> nonce;
+  if (RAND_bytes(nonce.data(), static_cast<int>(nonce.size())) != 1) {
+    return EkError::posix(EIO, "no random bytes for an extension nonce");
+  }
+  std::string token = fmt::format(
+      "{}{}{}{}{}{}{}", extensionClass, kSeparator, flags, kSeparator, toHex(subject), kSeparator,
+      toHex(std::string_view(reinterpret_cast<const char*>(nonce.data()), nonce.size())));
+  const auto tag = computeTag(*key, token);
+  if (!tag) return EkError::posix(EIO, "cannot compute an extension tag");
+  token.push_back(kSeparator);
+  token += toHex(std::string_view(reinterpret_cast<const char*>(tag->data()), tag->size()));
+  return token;
+}
+
+int64_t EkSandbox::consume(std::string_view token) {
+  std::optional<EkSandboxGrant> granted;
+  if (token.size() <= sandbox::kMaxTokenLength) {
+    if (Result<EkSandboxKey> key = keys_->key(); key.ok()) granted = verify(token, *key);
+  }
+  if (!granted) {
+    errno = EINVAL;
+    return -1;
+  }
+  const int64_t handle = nextHandle.fetch_add(1, std::memory_order_relaxed);
+  std::lock_guard lock(mutex_);
+  grants_.emplace(handle, std::move(*granted));
+  return handle;
+}
+
+int EkSandbox::release(int64_t handle) {
+  size_t erased = 0;
+  {
+    std::lock_guard lock(mutex_);
+    erased = grants_.erase(handle);
+  }
+  if (erased == 0) {
+    errno = EBADF;
+    return -1;
+  }
+  return 0;
+}
+
+std::optional<EkSandboxGrant> EkSandbox::grant(int64_t handle) const {
+  std::lock_guard lock(mutex_);
+  auto found = grants_.find(handle);
+  if (found == grants_.end()) return std::nullopt;
+  return found->second;
+}
+
+size_t EkSandbox::heldCount() const {
+  std::lock_guard lock(mutex_);
+  return grants_.size();
+}
+
+}  // namespace ek

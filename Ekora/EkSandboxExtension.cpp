@@ -1,0 +1,66 @@
+#include "Ekora/EkSandboxExtension.h"
+
+#include <cerrno>
+
+#include "platform/log/Log.h"
+
+namespace ek {
+
+Result<std::string> issueFileExtension(const EkFileURL& url) {
+  return issueFileExtension(url, *EkSandbox::system());
+}
+
+Result<std::string> issueFileExtension(const EkFileURL& url, EkSandbox& sandbox) {
+  Result<std::string> token = sandbox.issueFileExtension(url.path(), sandbox::kCanonicalizeFlag);
+  if (token) log::sandbox().debug("issued file extension for %s -> %s", url.path(), *token);
+  return token;
+}
+
+Result<std::string> issueServiceExtension(std::string_view serviceName) {
+  return issueServiceExtension(serviceName, *EkSandbox::system());
+}
+
+Result<std::string> issueServiceExtension(std::string_view serviceName, EkSandbox& sandbox) {
+  Result<std::string> token =
+      sandbox.issueServiceExtension(sandbox::kPlugInServiceClass, serviceName, 0);
+  if (token) log::sandbox().debug("issued service extension for %s -> %s", serviceName, *token);
+  return token;
+}
+
+EkSandboxExtension::EkSandboxExtension(std::string token, std::shared_ptr<EkSandbox> sandbox)
+    : token_(std::move(token)), sandbox_(sandbox ? std::move(sandbox) : EkSandbox::system()) {}
+
+std::shared_ptr<EkSandboxExtension> EkSandboxExtension::initWithExtension(
+    std::string token, std::shared_ptr<EkSandbox> sandbox) {
+  return std::make_shared<EkSandboxExtension>(std::move(token), std::move(sandbox));
+}
+
+EkSandboxExtension::~EkSandboxExtension() {
+  expel();
+}
+
+void EkSandboxExtension::consume() {
+  if (handle_.load() != kNotConsumed) return;
+  const int64_t handle = sandbox_->consume(token_);
+  const int error = errno;
+  handle_.store(handle);
+  if (handle == kNotConsumed) {
+    log::sandbox().defaultLevel("failed to consume extension %s - errno=%d", token_, error);
+  } else {
+    log::sandbox().debug("consuming extension %s -> %ld", token_, handle);
+  }
+}
+
+void EkSandboxExtension::expel() {
+  const int64_t handle = handle_.load();
+  if (handle == kNotConsumed) return;
+  if (sandbox_->release(handle) == 0) {
+    log::sandbox().debug("releasing extension %ld", handle);
+  } else {
+    const int error = errno;
+    log::sandbox().defaultLevel("failed to release extension %ld - errno=%d", handle, error);
+  }
+  handle_.store(kNotConsumed);
+}
+
+}  // namespace ek
