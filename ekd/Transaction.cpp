@@ -1,0 +1,191 @@
+#include "ekd/Transaction.h"
+
+#include <climits>
+#include <cstdlib>
+#include <unordered_map>
+
+#include "Ekora/EkProtocol.h"
+#include "ekd/EkDServer.h"
+#include "ekd/EkDWyreClient.h"
+#include "platform/log/Log.h"
+#include "platform/trace/Probes.h"
+
+namespace ek {
+namespace {
+
+using Handler = void (Transaction::*)();
+
+const std::unordered_map<std::string_view, Handler>& requestTable() {
+  static const std::unordered_map<std::string_view, Handler> table{
+      {protocol::kAdd, &Transaction::addPlugIns},
+      {protocol::kRemove, &Transaction::removePlugIns},
+      {protocol::kBulk, &Transaction::bulkPlugIns},
+      {protocol::kMatch, &Transaction::matchPlugIns},
+      {protocol::kReady, &Transaction::readyPlugIns},
+      {protocol::kAccess, &Transaction::accessPlugIns},
+      {protocol::kAnnotate, &Transaction::annotatePlugIns},
+      {protocol::kBulkAnnotate, &Transaction::bulkAnnotatePlugIns},
+      {protocol::kLock, &Transaction::lockDownPlugIns},
+      {protocol::kFind, &Transaction::findPlugIn},
+  };
+  return table;
+}
+
+}  // namespace
+
+std::shared_ptr<Transaction> Transaction::initWithRequest(wyre::Message request,
+                                                          std::shared_ptr<EkDWyreClient> client) {
+  return std::shared_ptr<Transaction>(new Transaction(std::move(request), std::move(client)));
+}
+
+EkDServer& Transaction::server() const {
+  return *client_->server();
+}
+
+std::shared_ptr<wyre::Connection> Transaction::connection() const {
+  return client_->connection();
+}
+
+const Array* Transaction::arrayForKey(std::string_view key) const {
+  return request_.body.getArray(key);
+}
+
+const Dictionary* Transaction::dictionaryForKey(std::string_view key) const {
+  return request_.body.getDictionary(key);
+}
+
+void Transaction::dispatch() {
+  const std::string* type = request_.body.getString(protocol::kRequest);
+  const uint64_t* requested = request_.body.getUnsigned(protocol::kVersion);
+  version_ = requested ? *requested : 0;
+
+  if (version_ != protocol::kCurrentVersion && version_ != protocol::kOldestVersion) {
+    // Shown as the signed number the client sent, clamped to what a %d can carry.
+    int64_t shown = version_ > INT_MAX ? -1 : static_cast<int64_t>(version_.load());
+    fail(protocol::kErrorVersion,
+         log::format(protocol::kMsgUnsupportedVersion, shown, protocol::kCurrentVersion));
+    return;
+  }
+  if (!client_->acceptWork()) return;
+
+  log::ops().debug("client %d requested %{public}s", client_->pid(),
+                   type ? std::string_view(*type) : std::string_view("(null)"));
+  EK_PROBE2(request, client_->pid(), type ? type->c_str() : "");
+
+  if (!type) {
+    fail(protocol::kErrorInvalidRequest, protocol::kMsgMissingType);
+    return;
+  }
+  auto it = requestTable().find(*type);
+  if (it == requestTable().end()) {
+    fail(protocol::kErrorInvalidRequest, protocol::kMsgUnrecognized);
+    return;
+  }
+  (this->*(it->second))();
+}
+
+void Transaction::done() {
+  if (replied_) {
+    log::ops().error("transaction for client %d replied twice", client_->pid());
+    std::abort();
+  }
+  replied_ = true;
+  Value reply(std::move(reply_));
+  if (EK_PROBE_ENABLED(request_output)) {
+    std::string text = reply.description();
+    EK_PROBE2(request_output, client_->pid(), text.c_str());
+  }
+  if (auto connection = client_->connection()) connection->reply(request_, reply);
+}
+
+void Transaction::fail(int32_t code, std::string_view message) {
+  // The code travels as a signed 32-bit value widened to 64 bits.
+  reply_[std::string(protocol::kErrorCode)] =
+      Value(static_cast<uint64_t>(static_cast<int64_t>(code)));
+  reply_[std::string(protocol::kError)] = Value(message);
+  done();
+}
+
+void Transaction::fail(int32_t code, const EkError& error) {
+  fail(error.isEkora() ? error.code : code, error.description());
+}
+
+bool Transaction::marshalPaths(const PathCallback& callback) {
+  const Array* paths = arrayForKey(protocol::kPaths);
+  if (!paths) {
+    fail(protocol::kErrorInvalidRequest, protocol::kMsgInvalidFormat);
+    return false;
+  }
+  for (const Value& element : *paths) {
+    const std::string* path = element.string();
+    if (!path) {
+      fail(protocol::kErrorInvalidRequest, protocol::kMsgInvalidFormat);
+      return false;
+    }
+    if (path->empty() || (*path)[0] != '/') {
+      fail(protocol::kErrorBadPath, log::format(protocol::kMsgAbsolutePathRequired, *path));
+      return false;
+    }
+    PathStep step;
+    if (path->find('\0') == std::string::npos) {
+      char* resolved = ::realpath(path->c_str(), nullptr);
+      if (resolved) {
+        std::string canonical(resolved);
+        std::free(resolved);
+        step = callback(canonical, true);
+      } else {
+        step = callback(*path, false);
+      }
+    } else {
+      step = callback(*path, false);
+    }
+    if (step == PathStep::Stop) return false;
+  }
+  return true;
+}
+
+bool Transaction::processPaths(const PathCallback& callback) {
+  if (!marshalPaths(callback)) return false;
+  done();
+  return true;
+}
+
+void Transaction::notServed() {
+  log::ops().info("client %d: request type not served by this daemon yet", client_->pid());
+  fail(protocol::kErrorInvalidRequest, protocol::kMsgUnrecognized);
+}
+
+// Until the registry, database and enabling services join the daemon, these request types
+// answer with the frame's error reply.
+void Transaction::addPlugIns() {
+  notServed();
+}
+void Transaction::removePlugIns() {
+  notServed();
+}
+void Transaction::bulkPlugIns() {
+  notServed();
+}
+void Transaction::matchPlugIns() {
+  notServed();
+}
+void Transaction::readyPlugIns() {
+  notServed();
+}
+void Transaction::accessPlugIns() {
+  notServed();
+}
+void Transaction::annotatePlugIns() {
+  notServed();
+}
+void Transaction::bulkAnnotatePlugIns() {
+  notServed();
+}
+void Transaction::lockDownPlugIns() {
+  notServed();
+}
+void Transaction::findPlugIn() {
+  notServed();
+}
+
+}  // namespace ek

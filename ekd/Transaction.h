@@ -1,0 +1,79 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "platform/value/EkError.h"
+#include "platform/value/Value.h"
+#include "platform/wyre/Wyre.h"
+
+namespace ek {
+
+class EkDServer;
+class EkDWyreClient;
+
+// One request from arrival to reply. Made on the connection's queue, then used only on the
+// work queue (or, for a hold with forced termination, on its termination waiter).
+class Transaction : public std::enable_shared_from_this<Transaction> {
+ public:
+  static std::shared_ptr<Transaction> initWithRequest(wyre::Message request,
+                                                      std::shared_ptr<EkDWyreClient> client);
+
+  // Checks version and type and runs the request's handler, which replies exactly once.
+  void dispatch();
+  // Sends the reply on the client's connection (a no-op when it has gone).
+  void done();
+  // Sets "errorcode" and "error", then sends the reply.
+  void fail(int32_t code, std::string_view message);
+  // An Ekora error keeps its own code; any other error is sent with code.
+  void fail(int32_t code, const EkError& error);
+
+  enum class PathStep { Continue, Stop };
+  using PathCallback = std::function<PathStep(const std::string& path, bool resolved)>;
+  // Walks "paths"; true when every path was passed on and accepted. On false a failure
+  // reply has been sent, by the walk or by the callback.
+  bool marshalPaths(const PathCallback& callback);
+  // marshalPaths followed by done when it succeeded.
+  bool processPaths(const PathCallback& callback);
+
+  // The member under key when it is an array / a dictionary; nullptr otherwise.
+  const Array* arrayForKey(std::string_view key) const;
+  const Dictionary* dictionaryForKey(std::string_view key) const;
+
+  const std::shared_ptr<EkDWyreClient>& client() const { return client_; }
+  const Value& request() const { return request_.body; }
+  Dictionary& reply() { return reply_; }
+  uint64_t version() const { return version_.load(); }
+  EkDServer& server() const;
+  std::shared_ptr<wyre::Connection> connection() const;
+
+  // The request handlers, one per request type.
+  void addPlugIns();
+  void removePlugIns();
+  void bulkPlugIns();
+  void matchPlugIns();
+  void readyPlugIns();
+  void accessPlugIns();
+  void annotatePlugIns();
+  void bulkAnnotatePlugIns();
+  void lockDownPlugIns();
+  void findPlugIn();
+
+ private:
+  Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client)
+      : client_(std::move(client)), request_(std::move(request)) {}
+  // The answer of a request type whose service the daemon does not offer yet.
+  void notServed();
+
+  std::shared_ptr<EkDWyreClient> client_;
+  wyre::Message request_;
+  Dictionary reply_;
+  std::atomic<uint64_t> version_{0};
+  bool replied_ = false;
+};
+
+}  // namespace ek

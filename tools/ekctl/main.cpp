@@ -1,0 +1,267 @@
+// ekctl: the command-line client of the plug-in daemon.
+#include <fmt/format.h>
+#include <unistd.h>
+#include <CLI/CLI.hpp>
+
+#include <chrono>
+#include <cstdio>
+#include <future>
+#include <iostream>
+#include <iterator>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "Ekora/EkDaemonClient.h"
+#include "Ekora/EkProtocol.h"
+#include "platform/json/WireJson.h"
+#include "tools/ekctl/Output.h"
+
+namespace {
+
+using namespace ek;
+
+enum Exit { kSuccess = 0, kReplyError = 1, kUsage = 2, kTransport = 3 };
+
+struct Options {
+  std::string service{protocol::kServiceName};
+  bool json = false;
+  int timeoutSeconds = 30;
+};
+
+[[noreturn]] void usageError(const std::string& message) {
+  std::fprintf(stderr, "ekctl: %s\n", message.c_str());
+  std::exit(kUsage);
+}
+
+Value parseJsonArgument(const std::string& text, std::string_view what) {
+  auto value = wirejson::parse(text);
+  if (!value) usageError(fmt::format("{} is not valid JSON: {}", what, value.error().message));
+  return std::move(value).value();
+}
+
+Dictionary parseJsonDictionary(const std::string& text, std::string_view what) {
+  Value value = parseJsonArgument(text, what);
+  if (!value.dictionary()) usageError(fmt::format("{} must be a JSON object", what));
+  return std::move(*value.dictionary());
+}
+
+Uuid parseUuid(const std::string& text) {
+  auto uuid = Uuid::parse(text);
+  if (!uuid) usageError(fmt::format("not a UUID: {}", text));
+  return *uuid;
+}
+
+std::vector<EkDaemonClient::PlugInRef> parsePlugInRefs(const std::vector<std::string>& args) {
+  std::vector<EkDaemonClient::PlugInRef> refs;
+  for (const std::string& arg : args) {
+    auto equals = arg.find('=');
+    EkDaemonClient::PlugInRef ref{parseUuid(arg.substr(0, equals)), std::nullopt};
+    if (equals != std::string::npos) ref.path = arg.substr(equals + 1);
+    refs.push_back(std::move(ref));
+  }
+  return refs;
+}
+
+// Paths are sent absolute, as the daemon requires; a relative one is taken from here.
+std::vector<std::string> absolutePaths(const std::vector<std::string>& paths) {
+  std::vector<std::string> result;
+  std::string cwd;
+  for (const std::string& path : paths) {
+    if (!path.empty() && path[0] == '/') {
+      result.push_back(path);
+      continue;
+    }
+    if (cwd.empty()) {
+      char buffer[4096];
+      if (!getcwd(buffer, sizeof buffer)) usageError("cannot determine the current directory");
+      cwd = buffer;
+    }
+    result.push_back(cwd + "/" + path);
+  }
+  return result;
+}
+
+using Sender = std::function<void(EkDaemonClient&, EkDaemonClient::Reply)>;
+
+// Sends one request and waits for its reply.
+std::optional<Result<Value>> exchange(const Options& options, const Sender& sender) {
+  auto client = EkDaemonClient::initWithServiceName(options.service);
+  auto promise = std::make_shared<std::promise<Result<Value>>>();
+  auto future = promise->get_future();
+  sender(*client, [promise](Result<Value> reply) { promise->set_value(std::move(reply)); });
+  if (future.wait_for(std::chrono::seconds(options.timeoutSeconds)) != std::future_status::ready) {
+    return std::nullopt;
+  }
+  return future.get();
+}
+
+int run(const Options& options, std::string_view command, const Sender& sender) {
+  auto reply = exchange(options, sender);
+  if (!reply) {
+    std::fprintf(stderr, "ekctl: no reply from %s within %d s\n", options.service.c_str(),
+                 options.timeoutSeconds);
+    return kTransport;
+  }
+  if (!*reply) {
+    std::fprintf(stderr, "ekctl: cannot reach %s: %s\n", options.service.c_str(),
+                 reply->error().message.c_str());
+    return kTransport;
+  }
+  Value body = std::move(*reply).value();
+  if (command == "raw") {
+    std::cout << wirejson::write(body) << "\n";
+    return kSuccess;
+  }
+  auto error = EkDaemonClient::errorInReply(body);
+  bool asJson = options.json || !isatty(STDOUT_FILENO);
+  if (error) {
+    if (asJson) std::cout << wirejson::write(body) << "\n";
+    std::fprintf(stderr, "ekctl: error %d: %s\n", error->code, error->message.c_str());
+    return kReplyError;
+  }
+  std::cout << (asJson ? ekctl::replyAsJson(body) : ekctl::replyAsTable(command, body));
+  return kSuccess;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Options options;
+  CLI::App app{"ekctl: query and manage the plug-in daemon"};
+  app.require_subcommand(1);
+  app.add_option("-S", options.service, "service name of the daemon");
+  app.add_flag("--json", options.json, "print replies as JSON");
+  app.add_option("--timeout", options.timeoutSeconds, "seconds to wait for a reply")
+      ->check(CLI::PositiveNumber);
+
+  std::string rawJson, rulesJson, envJson, setJson, annotationsJson, uuidText, urlText;
+  std::vector<std::string> paths, refs, uuidTexts;
+  uint64_t flags = 0;
+
+  auto* raw = app.add_subcommand("raw", "send one request in wire JSON (argument or stdin)");
+  raw->add_option("JSON", rawJson);
+  auto* add = app.add_subcommand("add", "register plug-in or application bundles");
+  add->add_option("PATH", paths)->required();
+  auto* remove = app.add_subcommand("remove", "unregister plug-in or application bundles");
+  remove->add_option("PATH", paths)->required();
+  auto* bulk = app.add_subcommand("bulk", "the \"bulk\" request");
+  bulk->add_option("--flags", flags);
+  auto* match = app.add_subcommand("match", "discover plug-ins matching rules");
+  match->add_option("--flags", flags);
+  match->add_option("RULES", rulesJson, "a JSON dictionary of attribute rules");
+  auto* find = app.add_subcommand("find", "look one plug-in up");
+  auto* findUuid = find->add_option("--uuid", uuidText);
+  auto* findUrl = find->add_option("--url", urlText);
+  findUuid->excludes(findUrl);
+  auto* ready = app.add_subcommand("ready", "make plug-ins ready to launch");
+  ready->add_option("--flags", flags);
+  ready->add_option("--env", envJson, "environment as a JSON dictionary");
+  ready->add_option("UUID[=PATH]", refs)->required();
+  auto* access = app.add_subcommand("access", "obtain read-only extensions to plug-in bundles");
+  access->add_option("--flags", flags);
+  access->add_option("UUID[=PATH]", refs)->required();
+  auto* annotate = app.add_subcommand("annotate", "change plug-ins' annotations");
+  annotate->add_option("--set", setJson, "annotations as a JSON dictionary")->required();
+  annotate->add_option("UUID", uuidTexts)->required();
+  auto* bulkAnnotate = app.add_subcommand("bulk-annotate", "change annotations in bulk");
+  bulkAnnotate->add_option("JSON", annotationsJson)->required();
+  auto* hold = app.add_subcommand("hold", "hold the plug-ins of bundles");
+  hold->add_option("--flags", flags);
+  hold->add_option("PATH", paths)->required();
+  auto* release = app.add_subcommand("release", "release a hold");
+  release->add_option("UUID", uuidText)->required();
+
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::CallForHelp& e) {
+    return app.exit(e);
+  } catch (const CLI::CallForAllHelp& e) {
+    return app.exit(e);
+  } catch (const CLI::ParseError& e) {
+    app.exit(e);
+    return kUsage;
+  }
+
+  if (raw->parsed()) {
+    if (rawJson.empty()) {
+      rawJson.assign(std::istreambuf_iterator<char>(std::cin), std::istreambuf_iterator<char>());
+    }
+    Dictionary message = parseJsonDictionary(rawJson, "the request");
+    return run(options, "raw", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.send(std::move(message), std::move(r));
+    });
+  }
+  if (add->parsed() || remove->parsed()) {
+    bool adding = add->parsed();
+    auto absolute = absolutePaths(paths);
+    return run(options, adding ? "add" : "remove", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      adding ? c.addPlugIns(absolute, std::move(r)) : c.removePlugIns(absolute, std::move(r));
+    });
+  }
+  if (bulk->parsed()) {
+    return run(options, "bulk", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.bulkPlugins(flags, std::move(r));
+    });
+  }
+  if (match->parsed()) {
+    Dictionary rules = rulesJson.empty() ? Dictionary{} : parseJsonDictionary(rulesJson, "RULES");
+    return run(options, "match", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.matchPlugIns(rules, flags, std::move(r));
+    });
+  }
+  if (find->parsed()) {
+    if (uuidText.empty() == urlText.empty()) usageError("find takes one of --uuid or --url");
+    if (!uuidText.empty()) {
+      Uuid uuid = parseUuid(uuidText);
+      return run(options, "find", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+        c.findPlugInByUUID(uuid, std::move(r));
+      });
+    }
+    std::string url = ekctl::urlArgument(urlText);
+    return run(options, "find", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.findPlugInByPathURL(url, std::move(r));
+    });
+  }
+  if (ready->parsed()) {
+    auto plugIns = parsePlugInRefs(refs);
+    std::optional<Dictionary> environment;
+    if (!envJson.empty()) environment = parseJsonDictionary(envJson, "--env");
+    return run(options, "ready", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.readyPlugIns(plugIns, flags, environment, std::move(r));
+    });
+  }
+  if (access->parsed()) {
+    auto plugIns = parsePlugInRefs(refs);
+    return run(options, "access", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.accessPlugIns(plugIns, flags, std::move(r));
+    });
+  }
+  if (annotate->parsed()) {
+    Dictionary annotations = parseJsonDictionary(setJson, "--set");
+    std::vector<Uuid> uuids;
+    for (const auto& text : uuidTexts) uuids.push_back(parseUuid(text));
+    return run(options, "annotate", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.setPluginAnnotations(uuids, annotations, std::move(r));
+    });
+  }
+  if (bulkAnnotate->parsed()) {
+    Dictionary annotations = parseJsonDictionary(annotationsJson, "JSON");
+    return run(options, "bulk-annotate", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.bulkSetPluginAnnotations(annotations, std::move(r));
+    });
+  }
+  if (hold->parsed()) {
+    auto absolute = absolutePaths(paths);
+    return run(options, "hold", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.holdPlugins(absolute, flags, std::move(r));
+    });
+  }
+  if (release->parsed()) {
+    Uuid uuid = parseUuid(uuidText);
+    return run(options, "release", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+      c.releaseHold(uuid, std::move(r));
+    });
+  }
+  return kUsage;
+}
