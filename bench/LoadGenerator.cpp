@@ -1,0 +1,251 @@
+#include "bench/LoadGenerator.h"
+
+#include <fmt/format.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <cmath>
+#include <latch>
+#include <system_error>
+#include <thread>
+
+#include "Ekora/EkProtocol.h"
+#include "bench/FrameIo.h"
+#include "platform/cbor/Cbor.h"
+#include "platform/wyre/Wyre.h"
+
+namespace ek::bench {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+enum class Outcome { Reply, ErrorReply, Failure };
+
+// The error of a reply whose "errorcode", its low 32 bits read as a signed code, is not zero.
+std::optional<std::string> replyError(const Value& reply) {
+  const Value* code = reply.get(protocol::kErrorCode);
+  if (code == nullptr) return std::nullopt;
+  int32_t signedCode = 0;
+  if (const uint64_t* number = code->unsignedNumber()) {
+    signedCode = static_cast<int32_t>(static_cast<uint32_t>(*number));
+  } else if (const int64_t* negative = code->negativeNumber()) {
+    signedCode = static_cast<int32_t>(*negative);
+  }
+  if (signedCode == 0) return std::nullopt;
+  const std::string* text = reply.getString(protocol::kError);
+  return text ? fmt::format("error {}: {}", signedCode, *text)
+              : fmt::format("error {}", signedCode);
+}
+
+const char* describe(FrameReader::Status status) {
+  switch (status) {
+    case FrameReader::Status::Frame:
+      return "frame";
+    case FrameReader::Status::Closed:
+      return "connection closed by the peer";
+    case FrameReader::Status::Failed:
+      return "receive failed";
+    case FrameReader::Status::TooLarge:
+      return "reply header announces an oversized body";
+    case FrameReader::Status::TimedOut:
+      return "no reply in time";
+  }
+  return "unknown";
+}
+
+struct Worker {
+  int fd = -1;
+  FrameReader reader;
+  std::vector<uint8_t> frame;  // header + request body; only the id changes between sends
+  uint64_t nextId = 1;
+  LoadResult result;
+  Clock::time_point finished;
+
+  void disconnect() {
+    if (fd >= 0) ::close(fd);
+    fd = -1;
+    reader = FrameReader();
+  }
+
+  bool connect(const LoadOptions& options) {
+    fd = connectUnix(options.socketPath);
+    if (fd < 0) return false;
+    if (!setIoTimeout(fd, options.replyTimeout)) {
+      disconnect();
+      return false;
+    }
+    return true;
+  }
+
+  void fail(std::string_view why) {
+    ++result.failures;
+    if (result.firstFailure.empty()) result.firstFailure = std::string(why);
+  }
+
+  Outcome roundTrip(Clock::time_point& sent, Clock::time_point& received,
+                    std::chrono::milliseconds timeout) {
+    uint64_t id = nextId++;
+    wyre::encodeHeader(
+        {static_cast<uint32_t>(frame.size() - wyre::kHeaderSize), wyre::kFlagWantsReply, id},
+        frame.data());
+    sent = Clock::now();
+    if (!writeAll(fd, frame.data(), frame.size())) {
+      fail("send failed");
+      return Outcome::Failure;
+    }
+    wyre::FrameHeader header;
+    std::span<const uint8_t> body;
+    FrameReader::Status status = reader.next(fd, header, body, sent + timeout);
+    received = Clock::now();
+    if (status != FrameReader::Status::Frame) {
+      fail(describe(status));
+      return Outcome::Failure;
+    }
+    if (!(header.flags & wyre::kFlagReply)) {
+      fail("answer without the reply flag");
+      return Outcome::Failure;
+    }
+    if (header.id != id) {
+      fail(fmt::format("reply carries id {}, expected {}", header.id, id));
+      return Outcome::Failure;
+    }
+    Result<Value> reply = cbor::decode(body);
+    if (!reply) {
+      fail("undecodable reply: " + reply.error().message);
+      return Outcome::Failure;
+    }
+    std::optional<std::string> error = replyError(*reply);
+    if (!error) return Outcome::Reply;
+    if (result.firstError.empty()) result.firstError = std::move(*error);
+    return Outcome::ErrorReply;
+  }
+
+  void run(const LoadOptions& options, Clock::time_point warmEnd, Clock::time_point end,
+           std::atomic<uint64_t>& tickets) {
+    result.latenciesNs.reserve(1u << 16);
+    for (;;) {
+      Clock::time_point now = Clock::now();
+      if (now >= end) break;
+      bool measured = now >= warmEnd;
+      if (measured && options.count && tickets.fetch_add(1) >= *options.count) break;
+      if (fd < 0 && !connect(options)) {
+        fail("reconnecting failed: " + std::error_code(errno, std::generic_category()).message());
+        break;
+      }
+      Clock::time_point sent, received;
+      Outcome outcome = roundTrip(sent, received, options.replyTimeout);
+      // Failures count in the warm-up too: they say the figures cannot be trusted.
+      if (outcome == Outcome::Failure) {
+        disconnect();
+        continue;
+      }
+      if (!measured) continue;
+      ++result.requests;
+      if (outcome == Outcome::ErrorReply) ++result.errorReplies;
+      result.latenciesNs.push_back(static_cast<uint64_t>(
+          std::chrono::duration_cast<std::chrono::nanoseconds>(received - sent).count()));
+    }
+    finished = Clock::now();
+  }
+};
+
+}  // namespace
+
+uint64_t percentile(const std::vector<uint64_t>& sorted, double fraction) {
+  if (sorted.empty()) return 0;
+  double rank = std::ceil(std::clamp(fraction, 0.0, 1.0) * static_cast<double>(sorted.size()));
+  size_t index = rank < 1 ? 0 : static_cast<size_t>(rank) - 1;
+  return sorted[std::min(index, sorted.size() - 1)];
+}
+
+LatencySummary LoadResult::latency() const {
+  LatencySummary summary;
+  if (latenciesNs.empty()) return summary;
+  std::vector<uint64_t> sorted = latenciesNs;
+  std::sort(sorted.begin(), sorted.end());
+  auto micros = [](uint64_t ns) { return static_cast<double>(ns) / 1000.0; };
+  summary.p50 = micros(percentile(sorted, 0.50));
+  summary.p90 = micros(percentile(sorted, 0.90));
+  summary.p99 = micros(percentile(sorted, 0.99));
+  summary.max = micros(sorted.back());
+  long double total = 0;
+  for (uint64_t ns : sorted) total += ns;
+  summary.mean = micros(static_cast<uint64_t>(total / sorted.size()));
+  return summary;
+}
+
+LoadResult combine(const std::vector<LoadResult>& runs) {
+  LoadResult sum;
+  for (const LoadResult& run : runs) {
+    sum.requests += run.requests;
+    sum.errorReplies += run.errorReplies;
+    sum.failures += run.failures;
+    sum.seconds += run.seconds;
+    if (sum.firstError.empty()) sum.firstError = run.firstError;
+    if (sum.firstFailure.empty()) sum.firstFailure = run.firstFailure;
+    sum.latenciesNs.insert(sum.latenciesNs.end(), run.latenciesNs.begin(), run.latenciesNs.end());
+  }
+  return sum;
+}
+
+Result<LoadResult> runLoad(const LoadOptions& options, std::span<const uint8_t> body) {
+  if (options.connections == 0) return EkError::posix(EINVAL, "at least one connection is needed");
+  if (body.size() > wyre::kMaxBodySize) {
+    return EkError::posix(EMSGSIZE, "request body larger than a frame may carry");
+  }
+  std::vector<Worker> workers(options.connections);
+  for (Worker& worker : workers) {
+    worker.frame.resize(wyre::kHeaderSize);
+    worker.frame.insert(worker.frame.end(), body.begin(), body.end());
+    if (!worker.connect(options)) {
+      EkError error = EkError::fromErrno(errno, "connecting to " + options.socketPath);
+      for (Worker& opened : workers) opened.disconnect();
+      return error;
+    }
+  }
+
+  // Every thread starts from the same instant, taken once all of them are running.
+  std::latch ready(static_cast<std::ptrdiff_t>(workers.size()));
+  std::atomic<bool> go{false};
+  Clock::time_point start;
+  std::atomic<uint64_t> tickets{0};
+  auto warmup = std::chrono::duration_cast<Clock::duration>(options.warmup);
+  auto duration = std::chrono::duration_cast<Clock::duration>(options.duration);
+
+  std::vector<std::thread> threads;
+  threads.reserve(workers.size());
+  for (Worker& worker : workers) {
+    threads.emplace_back([&] {
+      ready.count_down();
+      go.wait(false, std::memory_order_acquire);
+      worker.run(options, start + warmup, start + warmup + duration, tickets);
+    });
+  }
+  ready.wait();
+  start = Clock::now();
+  go.store(true, std::memory_order_release);
+  go.notify_all();
+  for (std::thread& thread : threads) thread.join();
+
+  LoadResult total;
+  Clock::time_point measureStart = start + warmup;
+  Clock::time_point last = measureStart;
+  for (Worker& worker : workers) {
+    worker.disconnect();
+    last = std::max(last, worker.finished);
+    total.requests += worker.result.requests;
+    total.errorReplies += worker.result.errorReplies;
+    total.failures += worker.result.failures;
+    if (total.firstError.empty()) total.firstError = worker.result.firstError;
+    if (total.firstFailure.empty()) total.firstFailure = worker.result.firstFailure;
+    total.latenciesNs.insert(total.latenciesNs.end(), worker.result.latenciesNs.begin(),
+                             worker.result.latenciesNs.end());
+  }
+  total.seconds = Seconds(last - measureStart).count();
+  return total;
+}
+
+}  // namespace ek::bench

@@ -1,0 +1,298 @@
+// ekbench: closed-loop load generator for Wyre services, with an echo baseline measured in the
+// same process so that every figure can be read as a ratio to the bare socket round trip.
+
+#include <fmt/format.h>
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <cstdio>
+#include <iostream>
+#include <memory>
+#include <nlohmann/json.hpp>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "Ekora/EkProtocol.h"
+#include "bench/EchoServer.h"
+#include "bench/LoadGenerator.h"
+#include "platform/cbor/Cbor.h"
+#include "platform/json/WireJson.h"
+#include "platform/paths/Directories.h"
+#include "platform/wyre/Wyre.h"
+
+namespace {
+
+using ek::bench::LoadOptions;
+using ek::bench::LoadResult;
+
+constexpr int kSuccess = 0;
+constexpr int kUntrustworthy = 1;  // failures, or a run that completed no request
+constexpr int kUsage = 2;
+constexpr int kSetupFailed = 3;
+
+// With --count alone the run still ends by itself.
+constexpr double kCountTimeLimitSeconds = 600;
+// Used by --echo-self-test when no request is given: a typical small request map.
+constexpr const char* kSelfTestRequest =
+    R"({"request":"find","version":3,"flags":0,"uuids":{"$uuid":"E621E1F8-C36C-495A-93FC-0C247A3E6E5F"},"paths":"/opt/Bench.app","environment":{}})";
+
+struct Options {
+  std::string service;
+  std::string socket;
+  unsigned connections = 1;
+  double duration = 5;
+  uint64_t count = 0;
+  double warmup = 0.5;
+  double timeout = 5;
+  unsigned rounds = 0;
+  bool baseline = false;
+  bool echoSelfTest = false;
+  bool json = false;
+  std::string request;
+};
+
+struct Runs {
+  std::string label;
+  std::string socket;
+  std::vector<LoadResult> rounds;
+};
+
+bool trustworthy(const LoadResult& run) {
+  return run.failures == 0 && run.requests > 0;
+}
+
+double ratio(double a, double b) {
+  return b > 0 ? a / b : 0;
+}
+
+nlohmann::ordered_json toJson(const LoadResult& run) {
+  ek::bench::LatencySummary latency = run.latency();
+  nlohmann::ordered_json out;
+  out["requests"] = run.requests;
+  out["seconds"] = run.seconds;
+  out["requests_per_second"] = run.requestsPerSecond();
+  out["latency_us"] = {{"p50", latency.p50},
+                       {"p90", latency.p90},
+                       {"p99", latency.p99},
+                       {"max", latency.max},
+                       {"mean", latency.mean}};
+  out["error_replies"] = run.errorReplies;
+  out["failures"] = run.failures;
+  if (!run.firstError.empty()) out["first_error"] = run.firstError;
+  if (!run.firstFailure.empty()) out["first_failure"] = run.firstFailure;
+  return out;
+}
+
+std::string row(const std::string& name, const LoadResult& run) {
+  ek::bench::LatencySummary l = run.latency();
+  return fmt::format(
+      "{:<12} {:>10} {:>8.2f} {:>10.0f} {:>9.1f} {:>9.1f} {:>9.1f} {:>9.1f} {:>7} {:>8}\n", name,
+      run.requests, run.seconds, run.requestsPerSecond(), l.p50, l.p90, l.p99, l.max,
+      run.errorReplies, run.failures);
+}
+
+void printReadable(const Options& options, size_t bodySize, const std::vector<Runs>& all) {
+  std::string bound =
+      options.count ? fmt::format("{} requests (at most {:.0f} s)", options.count, options.duration)
+                    : fmt::format("{:.1f} s", options.duration);
+  fmt::print(
+      "ekbench: {} connection{}, {} measured after {:.1f} s warm-up, {} round{}, request of {} "
+      "bytes (CBOR); latencies in µs\n",
+      options.connections, options.connections == 1 ? "" : "s", bound, options.warmup,
+      options.rounds, options.rounds == 1 ? "" : "s", bodySize);
+  for (const Runs& runs : all) fmt::print("{:<12} {}\n", runs.label, runs.socket);
+  fmt::print("{:<12} {:>10} {:>8} {:>10} {:>9} {:>9} {:>9} {:>9} {:>7} {:>8}\n", "run", "requests",
+             "seconds", "req/s", "p50", "p90", "p99", "max", "errors", "failures");
+  for (size_t round = 0; round < options.rounds; ++round) {
+    for (const Runs& runs : all) {
+      fmt::print("{}", row(fmt::format("{} #{}", runs.label, round + 1), runs.rounds[round]));
+    }
+  }
+  if (options.rounds > 1) {
+    for (const Runs& runs : all) {
+      fmt::print("{}", row(runs.label + " all", ek::bench::combine(runs.rounds)));
+    }
+  }
+  if (all.size() == 2) {
+    LoadResult daemon = ek::bench::combine(all[0].rounds);
+    LoadResult echo = ek::bench::combine(all[1].rounds);
+    fmt::print("daemon / echo: p50 {:.2f}x, req/s {:.2f}x\n",
+               ratio(daemon.latency().p50, echo.latency().p50),
+               ratio(daemon.requestsPerSecond(), echo.requestsPerSecond()));
+  }
+  for (const Runs& runs : all) {
+    LoadResult sum = ek::bench::combine(runs.rounds);
+    if (!sum.firstError.empty()) {
+      fmt::print("{}: first error reply: {}\n", runs.label, sum.firstError);
+    }
+    if (!sum.firstFailure.empty())
+      fmt::print("{}: first failure: {}\n", runs.label, sum.firstFailure);
+  }
+}
+
+void printJson(const Options& options, size_t bodySize, const std::vector<Runs>& all) {
+  nlohmann::ordered_json out;
+  out["connections"] = options.connections;
+  out["duration_s"] = options.duration;
+  out["warmup_s"] = options.warmup;
+  if (options.count) out["count"] = options.count;
+  out["rounds"] = options.rounds;
+  out["request_bytes"] = bodySize;
+  for (const Runs& runs : all) {
+    nlohmann::ordered_json entry = toJson(ek::bench::combine(runs.rounds));
+    entry["socket"] = runs.socket;
+    nlohmann::ordered_json rounds = nlohmann::ordered_json::array();
+    for (const LoadResult& run : runs.rounds) rounds.push_back(toJson(run));
+    entry["runs"] = std::move(rounds);
+    out[runs.label] = std::move(entry);
+  }
+  if (all.size() == 2) {
+    LoadResult daemon = ek::bench::combine(all[0].rounds);
+    LoadResult echo = ek::bench::combine(all[1].rounds);
+    out["ratios"] = {
+        {"p50", ratio(daemon.latency().p50, echo.latency().p50)},
+        {"requests_per_second", ratio(daemon.requestsPerSecond(), echo.requestsPerSecond())}};
+  }
+  std::cout << out.dump() << "\n";
+}
+
+std::optional<std::string> readRequestText(const Options& options) {
+  if (options.request == "-") {
+    // Bounded: a request larger than a frame may carry is refused after parsing anyway.
+    std::string text;
+    char chunk[65536];
+    while (text.size() <= ek::wyre::kMaxBodySize * 2 &&
+           std::cin.read(chunk, sizeof(chunk)).gcount() > 0) {
+      text.append(chunk, static_cast<size_t>(std::cin.gcount()));
+    }
+    return text;
+  }
+  if (!options.request.empty()) return options.request;
+  if (options.echoSelfTest) return std::string(kSelfTestRequest);
+  return std::nullopt;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Options options;
+  CLI::App app{"ekbench: closed-loop load generator for a Wyre service"};
+  auto* service = app.add_option("-S", options.service, "service name (default: the daemon's)");
+  auto* socket = app.add_option("--socket", options.socket, "path of the Unix socket to load");
+  socket->excludes(service);
+  app.add_option("--connections", options.connections, "concurrent connections, one thread each")
+      ->check(CLI::Range(1u, 1024u));
+  auto* duration =
+      app.add_option("--duration", options.duration, "seconds measured per run (default 5)")
+          ->check(CLI::Range(0.001, 3600.0));
+  app.add_option("--count", options.count, "total requests per run instead of a duration")
+      ->check(CLI::Range(uint64_t{1}, uint64_t{1} << 40));
+  app.add_option("--warmup", options.warmup, "seconds of unmeasured traffic first (default 0.5)")
+      ->check(CLI::Range(0.0, 600.0));
+  app.add_option("--timeout", options.timeout, "seconds to wait for one reply (default 5)")
+      ->check(CLI::Range(0.001, 600.0));
+  app.add_option("--rounds", options.rounds,
+                 "runs of each target, alternated (default 2 with --baseline, else 1)")
+      ->check(CLI::Range(1u, 20u));
+  auto* baseline = app.add_flag("--baseline", options.baseline,
+                                "also measure an in-process echo server and print the ratios");
+  auto* selfTest = app.add_flag("--echo-self-test", options.echoSelfTest,
+                                "measure only the in-process echo server");
+  selfTest->excludes(baseline)->excludes(service)->excludes(socket);
+  app.add_flag("--json", options.json, "print one JSON object");
+  app.add_option("REQUEST_JSON", options.request, "the request in wire JSON, or - for stdin");
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& e) {
+    int code = app.exit(e);
+    return code == 0 ? kSuccess : kUsage;
+  }
+  if (options.count && duration->count() == 0) options.duration = kCountTimeLimitSeconds;
+  if (options.rounds == 0) options.rounds = options.baseline ? 2 : 1;
+
+  std::optional<std::string> text = readRequestText(options);
+  if (!text) {
+    std::fprintf(stderr, "ekbench: a request in wire JSON is needed\n");
+    return kUsage;
+  }
+  ek::Result<ek::Value> request = ek::wirejson::parse(*text);
+  if (!request) {
+    std::fprintf(stderr, "ekbench: invalid request: %s\n", request.error().message.c_str());
+    return kUsage;
+  }
+  std::vector<uint8_t> body = ek::cbor::encode(*request);
+  if (body.size() > ek::wyre::kMaxBodySize) {
+    std::fprintf(stderr, "ekbench: the request is larger than a frame may carry\n");
+    return kUsage;
+  }
+  if (!options.service.empty() && !ek::wyre::isValidServiceName(options.service)) {
+    std::fprintf(stderr, "ekbench: invalid service name: %s\n", options.service.c_str());
+    return kUsage;
+  }
+
+  std::vector<Runs> all;
+  if (!options.echoSelfTest) {
+    std::string path = !options.socket.empty() ? options.socket
+                       : !options.service.empty()
+                           ? ek::paths::servicePath(options.service)
+                           : ek::paths::servicePath(ek::protocol::kServiceName);
+    all.push_back({"daemon", path, {}});
+  }
+  std::unique_ptr<ek::bench::EchoServer> echo;
+  if (options.baseline || options.echoSelfTest) {
+    auto started = ek::bench::EchoServer::start();
+    if (!started) {
+      std::fprintf(stderr, "ekbench: echo server: %s\n", started.error().message.c_str());
+      return kSetupFailed;
+    }
+    echo = std::move(started).value();
+    all.push_back({"echo", echo->socketPath(), {}});
+  }
+
+  // Alternating the targets spreads the machine's drift over both of them.
+  for (unsigned round = 0; round < options.rounds; ++round) {
+    for (Runs& runs : all) {
+      LoadOptions load;
+      load.socketPath = runs.socket;
+      load.connections = options.connections;
+      load.warmup = ek::bench::Seconds(options.warmup);
+      load.duration = ek::bench::Seconds(options.duration);
+      if (options.count) load.count = options.count;
+      load.replyTimeout = std::chrono::milliseconds(
+          std::max<int64_t>(1, static_cast<int64_t>(options.timeout * 1000)));
+      ek::Result<LoadResult> result = ek::bench::runLoad(load, body);
+      if (!result) {
+        std::fprintf(stderr, "ekbench: %s\n", result.error().message.c_str());
+        return kSetupFailed;
+      }
+      runs.rounds.push_back(std::move(result).value());
+    }
+  }
+
+  if (options.json) {
+    printJson(options, body.size(), all);
+  } else {
+    printReadable(options, body.size(), all);
+  }
+
+  int status = kSuccess;
+  for (const Runs& runs : all) {
+    LoadResult sum = ek::bench::combine(runs.rounds);
+    for (const LoadResult& run : runs.rounds) {
+      if (!trustworthy(run)) status = kUntrustworthy;
+    }
+    if (sum.errorReplies > 0) {
+      std::fprintf(stderr,
+                   "ekbench: warning: %llu of %llu replies from %s carried an errorcode (%s); "
+                   "the figures measure the error path\n",
+                   static_cast<unsigned long long>(sum.errorReplies),
+                   static_cast<unsigned long long>(sum.requests), runs.label.c_str(),
+                   sum.firstError.c_str());
+    }
+  }
+  if (status != kSuccess) {
+    std::fprintf(stderr, "ekbench: a run had transport failures or completed no request\n");
+  }
+  return status;
+}

@@ -1,0 +1,200 @@
+#include "tests/EkdProcess.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <random>
+#include <sstream>
+#include <thread>
+
+namespace ek::test {
+namespace fs = std::filesystem;
+
+std::string ekdPath() {
+  return EKD_PATH;
+}
+std::string ekctlPath() {
+  return EKCTL_PATH;
+}
+std::string sandboxExecPath() {
+  return SANDBOX_EXEC_PATH;
+}
+
+TempDir::TempDir() {
+  std::string pattern = (fs::temp_directory_path() / "ekora-test-XXXXXX").string();
+  if (!mkdtemp(pattern.data())) std::abort();
+  path_ = pattern;
+}
+
+TempDir::~TempDir() {
+  std::error_code ignored;
+  fs::remove_all(path_, ignored);
+}
+
+namespace {
+
+std::string readAll(int fd) {
+  std::string out;
+  char buffer[65536];
+  ssize_t n;
+  while ((n = read(fd, buffer, sizeof buffer)) > 0) out.append(buffer, static_cast<size_t>(n));
+  return out;
+}
+
+int decodeStatus(int status) {
+  if (WIFEXITED(status)) return WEXITSTATUS(status);
+  if (WIFSIGNALED(status)) return 128 + WTERMSIG(status);
+  return -1;
+}
+
+}  // namespace
+
+CommandResult runCommand(const std::vector<std::string>& argv,
+                         const std::map<std::string, std::string>& env, const std::string& input) {
+  int in[2], out[2], err[2];
+  if (pipe2(in, O_CLOEXEC) || pipe2(out, O_CLOEXEC) || pipe2(err, O_CLOEXEC)) std::abort();
+  pid_t pid = fork();
+  if (pid == 0) {
+    dup2(in[0], 0);
+    dup2(out[1], 1);
+    dup2(err[1], 2);
+    for (const auto& [key, value] : env) setenv(key.c_str(), value.c_str(), 1);
+    std::vector<char*> args;
+    for (const auto& a : argv) args.push_back(const_cast<char*>(a.c_str()));
+    args.push_back(nullptr);
+    execv(args[0], args.data());
+    _exit(127);
+  }
+  close(in[0]);
+  close(out[1]);
+  close(err[1]);
+  if (!input.empty()) {
+    ssize_t ignored = write(in[1], input.data(), input.size());
+    (void)ignored;
+  }
+  close(in[1]);
+  CommandResult result;
+  std::thread errReader([&] { result.err = readAll(err[0]); });
+  result.out = readAll(out[0]);
+  errReader.join();
+  close(out[0]);
+  close(err[0]);
+  int status = 0;
+  waitpid(pid, &status, 0);
+  result.status = decodeStatus(status);
+  return result;
+}
+
+EkdProcess::EkdProcess(std::vector<std::string> extraArgs) : extraArgs_(std::move(extraArgs)) {
+  std::random_device random;
+  service_ = "com.corvane.ekora.test." + std::to_string(random() % 1000000);
+  fs::create_directories(root_.path() / "run");
+  fs::create_directories(root_.path() / "state");
+  fs::create_directories(root_.path() / "System");
+}
+
+EkdProcess::~EkdProcess() {
+  if (running()) kill9();
+}
+
+std::map<std::string, std::string> EkdProcess::environment() const {
+  return {{"EKORA_RUNTIME_DIR", (root_.path() / "run").string()},
+          {"EKORA_STATE_DIR", (root_.path() / "state").string()},
+          {"EKORA_SYSTEM_ROOT", (root_.path() / "System").string()}};
+}
+
+void EkdProcess::exportEnvironment() const {
+  for (const auto& [key, value] : environment()) setenv(key.c_str(), value.c_str(), 1);
+}
+
+std::string EkdProcess::socketPath() const {
+  return (root_.path() / "run" / service_).string();
+}
+
+std::string EkdProcess::log() const {
+  std::ifstream in(root_.path() / "ekd.log");
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+bool EkdProcess::start() {
+  std::string logPath = (root_.path() / "ekd.log").string();
+  pid_ = fork();
+  if (pid_ == 0) {
+    int fd = open(logPath.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
+    dup2(fd, 2);
+    int devnull = open("/dev/null", O_RDWR);
+    dup2(devnull, 0);
+    dup2(devnull, 1);
+    for (const auto& [key, value] : environment()) setenv(key.c_str(), value.c_str(), 1);
+    if (!getenv("EKORA_LOG")) setenv("EKORA_LOG", "debug", 1);
+    unsetenv("JOURNAL_STREAM");
+    std::vector<std::string> argv{ekdPath(), "-S", service_};
+    argv.insert(argv.end(), extraArgs_.begin(), extraArgs_.end());
+    std::vector<char*> args;
+    for (auto& a : argv) args.push_back(a.data());
+    args.push_back(nullptr);
+    execv(args[0], args.data());
+    _exit(127);
+  }
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  while (std::chrono::steady_clock::now() < deadline) {
+    int status;
+    if (waitpid(pid_, &status, WNOHANG) == pid_) {
+      exitStatus_ = decodeStatus(status);
+      pid_ = -1;
+      return false;
+    }
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::string path = socketPath();
+    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+    bool connected = connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
+    close(fd);
+    if (connected) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return false;
+}
+
+bool EkdProcess::running() const {
+  return pid_ > 0;
+}
+
+int EkdProcess::terminate() {
+  if (pid_ <= 0) return exitStatus_;
+  ::kill(pid_, SIGTERM);
+  int status = 0;
+  waitpid(pid_, &status, 0);
+  pid_ = -1;
+  exitStatus_ = decodeStatus(status);
+  return exitStatus_;
+}
+
+void EkdProcess::kill9() {
+  if (pid_ <= 0) return;
+  ::kill(pid_, SIGKILL);
+  int status = 0;
+  waitpid(pid_, &status, 0);
+  pid_ = -1;
+  exitStatus_ = decodeStatus(status);
+}
+
+CommandResult EkdProcess::ekctl(std::vector<std::string> args, const std::string& input) const {
+  std::vector<std::string> argv{ekctlPath(), "-S", service_};
+  argv.insert(argv.end(), args.begin(), args.end());
+  return runCommand(argv, environment(), input);
+}
+
+}  // namespace ek::test
