@@ -22,7 +22,9 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
   server->databasePath_ = std::move(database);
   server->platform_ = std::move(platform);
   server->wyreQueue_ = SerialQueue::make("wyre");
-  server->mainQueue_ = SerialQueue::make("service");
+  // Requests run on the thread that reads the sockets: a request then reaches its handler
+  // without waking another thread, and handlers run one at a time all the same.
+  server->mainQueue_ = SerialQueue::make("service", wyre::ioContext());
   server->syncQueue_ = SerialQueue::make("serverSync");
 
   auto listener = wyre::Listener::create(serviceName, server->wyreQueue_);

@@ -14,6 +14,7 @@
 
 #include <cstring>
 #include <future>
+#include <thread>
 
 #include "platform/cbor/Cbor.h"
 #include "platform/log/Log.h"
@@ -43,6 +44,20 @@ uint32_t getU32(const uint8_t* p) {
 }
 
 }  // namespace
+
+asio::io_context& ioContext() {
+  // Never destroyed: sockets may still be served while the process exits.
+  static asio::io_context* context = [] {
+    auto* io = new asio::io_context(2);
+    auto* guard =
+        new asio::executor_work_guard<asio::io_context::executor_type>(io->get_executor());
+    (void)guard;
+    std::thread([io] { io->run(); }).detach();
+    std::thread([io] { io->run(); }).detach();
+    return io;
+  }();
+  return *context;
+}
 
 EkError connectionInvalidError() {
   return {std::string(kErrorDomain), kConnectionInvalid, "Connection invalid"};
@@ -134,7 +149,7 @@ void Connection::cancel() {
 }
 
 void Connection::readMore() {
-  if (reading_ || closed_ || unanswered_ >= kMaxUnansweredRequests) return;
+  if (reading_ || closed_ || unanswered_.load() >= kMaxUnansweredRequests) return;
   if (inputStart_ == inputEnd_) {
     inputStart_ = inputEnd_ = 0;
   }
@@ -164,7 +179,7 @@ void Connection::readMore() {
 }
 
 void Connection::parseInput() {
-  while (!closed_ && unanswered_ < kMaxUnansweredRequests) {
+  while (!closed_ && unanswered_.load() < kMaxUnansweredRequests) {
     size_t available = inputEnd_ - inputStart_;
     if (available < kHeaderSize) return;
     FrameHeader header = decodeHeader(input_.data() + inputStart_);
@@ -198,7 +213,7 @@ void Connection::parseInput() {
     Event event;
     event.type = EventType::Message;
     event.message = Message{std::move(body).value(), header.id, header.flags};
-    if (event.message.wantsReply()) ++unanswered_;
+    if (event.message.wantsReply()) unanswered_.fetch_add(1);
     deliver(std::move(event));
   }
 }
@@ -223,12 +238,19 @@ void Connection::deliverReply(ReplyHandler handler, Result<Value> result) {
 }
 
 void Connection::fail() {
-  if (closed_.exchange(true)) return;
-  asio::error_code ignored;
-  socket_.shutdown(stream_protocol::socket::shutdown_both, ignored);
-  socket_.close(ignored);
-  output_.clear();
-  queuedBytes_ = 0;
+  {
+    std::lock_guard lock(outputMutex_);
+    if (closed_) return;
+    closed_ = true;
+    asio::error_code ignored;
+    socket_.shutdown(stream_protocol::socket::shutdown_both, ignored);
+    socket_.close(ignored);
+    // A write in flight still refers to the queued frames; its completion drops them.
+    if (!writing_) {
+      output_.clear();
+      queuedBytes_ = 0;
+    }
+  }
   std::map<uint64_t, ReplyHandler> pending;
   {
     std::lock_guard lock(pendingMutex_);
@@ -244,51 +266,89 @@ void Connection::fail() {
   keepAlive_.reset();
 }
 
+void Connection::releaseUnanswered() {
+  size_t before = unanswered_.load();
+  while (before > 0 && !unanswered_.compare_exchange_weak(before, before - 1)) {
+  }
+  if (before == kMaxUnansweredRequests) {
+    asio::post(strand_, [self = shared_from_this()] {
+      self->parseInput();
+      self->readMore();
+    });
+  }
+}
+
 void Connection::enqueueOutput(std::vector<uint8_t> frame, bool answersRequest) {
-  size_t size = frame.size();
-  asio::dispatch(strand_, [self = shared_from_this(), frame = std::move(frame), size,
-                           answersRequest]() mutable {
-    if (answersRequest && self->unanswered_ > 0) {
-      bool wasPaused = self->unanswered_ >= kMaxUnansweredRequests;
-      --self->unanswered_;
-      if (wasPaused) {
-        self->parseInput();
-        self->readMore();
+  if (answersRequest) releaseUnanswered();
+  if (frame.empty()) return;
+  bool failNow = false;
+  bool startWriter = false;
+  {
+    std::lock_guard lock(outputMutex_);
+    if (closed_) return;
+    if (output_.empty() && !writing_) {
+      // Nothing queued: write straight from this thread, saving a hop to the I/O thread.
+      ssize_t n =
+          ::send(socket_.native_handle(), frame.data(), frame.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+      if (n == static_cast<ssize_t>(frame.size())) return;
+      if (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR) {
+        failNow = true;
+      } else if (n > 0) {
+        frame.erase(frame.begin(), frame.begin() + n);
       }
     }
-    if (self->closed_ || size == 0) return;
-    if (self->queuedBytes_ + size > kMaxQueuedOutput) {
-      log::process().error("closing connection from pid=%d: it does not read its replies",
-                           self->pid());
-      self->fail();
-      return;
+    if (!failNow && queuedBytes_ + frame.size() > kMaxQueuedOutput) {
+      log::process().error("closing connection from pid=%d: it does not read its replies", pid());
+      failNow = true;
     }
-    self->queuedBytes_ += size;
-    self->output_.push_back(std::move(frame));
-    self->writeMore();
-  });
+    if (!failNow) {
+      queuedBytes_ += frame.size();
+      output_.push_back(std::move(frame));
+      if (!writing_) writing_ = startWriter = true;
+    }
+  }
+  if (failNow) {
+    cancel();
+  } else if (startWriter) {
+    asio::post(strand_, [self = shared_from_this()] { self->writeMore(); });
+  }
 }
 
 void Connection::writeMore() {
-  if (writing_ || closed_ || output_.empty()) return;
-  writing_ = true;
   std::vector<asio::const_buffer> buffers;
-  size_t count = std::min(output_.size(), kMaxGather);
-  buffers.reserve(count);
-  for (size_t i = 0; i < count; ++i) buffers.emplace_back(asio::buffer(output_[i]));
+  {
+    std::lock_guard lock(outputMutex_);
+    if (closed_ || output_.empty()) {
+      output_.clear();
+      queuedBytes_ = 0;
+      writing_ = false;
+      return;
+    }
+    size_t count = std::min(output_.size(), kMaxGather);
+    buffers.reserve(count);
+    for (size_t i = 0; i < count; ++i) buffers.emplace_back(asio::buffer(output_[i]));
+  }
+  size_t count = buffers.size();
   asio::async_write(socket_, buffers,
                     asio::bind_executor(strand_, [self = shared_from_this(), count](
                                                      const asio::error_code& ec, size_t written) {
-                      self->writing_ = false;
-                      if (ec || self->closed_) {
-                        self->fail();
-                        return;
+                      {
+                        std::lock_guard lock(self->outputMutex_);
+                        for (size_t i = 0; i < count && !self->output_.empty(); ++i) {
+                          self->output_.pop_front();
+                        }
+                        self->queuedBytes_ -= std::min(written, self->queuedBytes_);
                       }
-                      for (size_t i = 0; i < count && !self->output_.empty(); ++i)
-                        self->output_.pop_front();
-                      self->queuedBytes_ -= std::min(written, self->queuedBytes_.load());
+                      if (ec) {
+                        self->fail();
+                      }
                       self->writeMore();
                     }));
+}
+
+size_t Connection::queuedOutputBytes() const {
+  std::lock_guard lock(outputMutex_);
+  return queuedBytes_;
 }
 
 void Connection::send(const Value& message) {

@@ -34,6 +34,11 @@ inline constexpr size_t kMaxQueuedOutput = 8u << 20;
 // A connection stops reading while this many of its requests are unanswered.
 inline constexpr size_t kMaxUnansweredRequests = 256;
 
+// The context that runs every socket of the process on two threads of its own, so that a
+// connection's reads, parsing and event delivery never wait for a pool thread to be woken,
+// and two cores can make system calls at once under load.
+asio::io_context& ioContext();
+
 inline constexpr std::string_view kErrorDomain = "Wyre";
 inline constexpr int32_t kConnectionInvalid = 1;
 inline constexpr int32_t kTerminationImminent = 2;
@@ -84,7 +89,7 @@ class Connection : public std::enable_shared_from_this<Connection> {
   // when one is given, else on the connection's own event queue.
   static Result<std::shared_ptr<Connection>> connect(
       std::string_view serviceName, std::shared_ptr<SerialQueue> deliveryQueue = nullptr,
-      asio::io_context& context = QueuePool::shared().context());
+      asio::io_context& context = ioContext());
   // Adopts an accepted socket (the listener's side).
   static std::shared_ptr<Connection> adopt(asio::local::stream_protocol::socket socket,
                                            AuditToken token);
@@ -113,7 +118,7 @@ class Connection : public std::enable_shared_from_this<Connection> {
   bool isValid() const { return !closed_.load(); }
 
   // Bytes of encoded output not yet written to the socket.
-  size_t queuedOutputBytes() const { return queuedBytes_.load(); }
+  size_t queuedOutputBytes() const;
 
  private:
   Connection(asio::local::stream_protocol::socket socket, AuditToken token,
@@ -122,6 +127,7 @@ class Connection : public std::enable_shared_from_this<Connection> {
   void readMore();
   void parseInput();
   void enqueueOutput(std::vector<uint8_t> frame, bool answersRequest);
+  void releaseUnanswered();
   void writeMore();
   void fail();
   void deliver(Event event);
@@ -143,12 +149,17 @@ class Connection : public std::enable_shared_from_this<Connection> {
   size_t inputEnd_ = 0;
   bool reading_ = false;
   bool resumed_ = false;
-  std::deque<std::vector<uint8_t>> output_;
-  bool writing_ = false;
-  size_t unanswered_ = 0;
 
+  // Replies are written from the thread that makes them when nothing is queued; otherwise
+  // they queue here for the writer on strand_. Closing the socket also takes this mutex, so
+  // no thread writes to a descriptor number that has been reused.
+  mutable std::mutex outputMutex_;
+  std::deque<std::vector<uint8_t>> output_;  // guarded by outputMutex_
+  size_t queuedBytes_ = 0;                   // guarded by outputMutex_
+  bool writing_ = false;                     // a writer owns the socket; guarded by outputMutex_
+
+  std::atomic<size_t> unanswered_{0};
   std::atomic<bool> closed_{false};
-  std::atomic<size_t> queuedBytes_{0};
   std::atomic<uint64_t> nextId_{1};
   std::mutex pendingMutex_;
   std::map<uint64_t, ReplyHandler> pending_;  // guarded by pendingMutex_
@@ -167,9 +178,9 @@ class Listener : public std::enable_shared_from_this<Listener> {
   // Listens on the service named name: adopts a socket passed by socket activation, else
   // binds $EKORA_RUNTIME_DIR/<name> (mode 0666), replacing a socket file left by a dead
   // process. Fails when another process listens there. Events are delivered on queue.
-  static Result<std::shared_ptr<Listener>> create(
-      std::string_view serviceName, std::shared_ptr<SerialQueue> queue,
-      asio::io_context& context = QueuePool::shared().context());
+  static Result<std::shared_ptr<Listener>> create(std::string_view serviceName,
+                                                  std::shared_ptr<SerialQueue> queue,
+                                                  asio::io_context& context = ioContext());
   ~Listener();
 
   void setEventHandler(EventHandler handler);

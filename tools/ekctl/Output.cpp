@@ -16,6 +16,7 @@ namespace {
 std::string cell(const Value* value) {
   if (!value) return "-";
   if (const std::string* text = value->string()) return *text;
+  if (const Uuid* uuid = value->uuid()) return uuid->string();
   return wirejson::write(*value);
 }
 
