@@ -2,6 +2,8 @@
 
 #include <fmt/format.h>
 
+#include "Ekora/EkBundle.h"
+#include "Ekora/EkFileURL.h"
 #include "ekd/EkDServer.h"
 #include "ekd/Transaction.h"
 #include "platform/log/Log.h"
@@ -16,7 +18,12 @@ std::shared_ptr<EkDWyreClient> EkDWyreClient::initWithConnection(
   client->server_ = std::move(server);
   client->token_ = connection->auditToken();
   client->pid_ = connection->pid();
-  client->path_ = executablePathForPid(client->pid_).value_or("");
+  if (auto path = executablePathForPid(client->pid_)) {
+    if (auto url = EkFileURL::fromPath(*path)) {
+      client->bundle_ = EkBundle::initWithExecutableURL(url.value());
+    }
+    client->path_ = std::move(*path);
+  }
 
   log::ops().debug("new client %d %s", client->pid_, client->path_);
   EK_PROBE1(client_new, client->pid_);

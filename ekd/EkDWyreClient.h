@@ -13,6 +13,7 @@
 
 namespace ek {
 
+class EkBundle;
 class EkDServer;
 
 // The daemon's record of one connected client. It lives as long as its connection (which
@@ -43,6 +44,8 @@ class EkDWyreClient : public std::enable_shared_from_this<EkDWyreClient> {
   const std::shared_ptr<EkDServer>& server() const { return server_; }
   // Path of the client's executable; empty when it could not be read.
   const std::string& path() const { return path_; }
+  // The bundle around the client's executable, or nullptr.
+  const std::shared_ptr<EkBundle>& bundle() const { return bundle_; }
   // Changed only on the work queue.
   uint32_t requestCount() const { return requestCount_; }
   uint32_t countRequest() { return ++requestCount_; }
@@ -55,10 +58,11 @@ class EkDWyreClient : public std::enable_shared_from_this<EkDWyreClient> {
   std::weak_ptr<wyre::Connection> connection_;
   std::shared_ptr<EkDServer> server_;
   std::string path_;
+  std::shared_ptr<EkBundle> bundle_;
   std::shared_ptr<CodeSigningTask> task_;
   AuditToken token_;
   pid_t pid_ = 0;
-  uint32_t requestCount_ = 0;
+  std::atomic<uint32_t> requestCount_{0};
 };
 
 }  // namespace ek
