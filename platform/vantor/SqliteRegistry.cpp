@@ -1,0 +1,1271 @@
+#include "platform/vantor/SqliteRegistry.h"
+
+#include <errno.h>
+#include <fmt/format.h>
+#include <sqlite3.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <ctime>
+#include <filesystem>
+#include <map>
+#include <set>
+
+#include "platform/cbor/Cbor.h"
+#include "platform/dmap/Dmap.h"
+#include "platform/log/Log.h"
+#include "platform/paths/Directories.h"
+
+namespace ek::vantor {
+namespace {
+
+namespace fs = std::filesystem;
+
+// Bumped whenever the tables change; a file with another version is set aside and rebuilt
+// (the registry is derived data: the installer and the start-up scan can always refill it).
+constexpr int kSchemaVersion = 1;
+// Bounds on what one bundle may make the registry read.
+constexpr size_t kMaxPlugInsPerApplication = 4096;
+constexpr size_t kMaxLanguagesPerBundle = 512;
+constexpr size_t kMaxSystemBundles = 65536;
+// Negative: KiB. Enough for the pages of tens of thousands of plug-ins, so that lookups are
+// answered from memory; the file belongs to this process alone (exclusive locking).
+constexpr int kCacheSizeKiB = 32 * 1024;
+
+constexpr const char* kSchema = R"sql(
+CREATE TABLE meta(key TEXT PRIMARY KEY, value BLOB NOT NULL);
+CREATE TABLE applications(
+  path TEXT PRIMARY KEY,
+  identifier TEXT NOT NULL,
+  version TEXT,
+  info BLOB NOT NULL,
+  strings BLOB NOT NULL,
+  registered REAL NOT NULL);
+CREATE INDEX applications_identifier ON applications(identifier);
+CREATE TABLE plugins(
+  uuid BLOB PRIMARY KEY,
+  path TEXT NOT NULL UNIQUE,
+  identifier TEXT NOT NULL,
+  original_identifier TEXT NOT NULL,
+  version TEXT,
+  app_path TEXT,
+  point TEXT,
+  info BLOB NOT NULL,
+  sdk BLOB NOT NULL,
+  entitlements BLOB NOT NULL,
+  registered REAL NOT NULL,
+  container TEXT,
+  strings BLOB NOT NULL);
+CREATE INDEX plugins_app ON plugins(app_path);
+CREATE TABLE plugin_points(point TEXT NOT NULL, uuid BLOB NOT NULL, PRIMARY KEY(point, uuid))
+  WITHOUT ROWID;
+CREATE INDEX plugin_points_uuid ON plugin_points(uuid);
+CREATE TABLE extension_points(identifier TEXT PRIMARY KEY, sdk BLOB NOT NULL);
+)sql";
+
+constexpr const char* kPlugInColumns =
+    "p.uuid, p.path, p.identifier, p.original_identifier, p.version, p.app_path, p.point, "
+    "p.info, p.sdk, p.entitlements, p.registered, p.container, p.strings";
+
+double now() {
+  return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
+}
+
+std::vector<uint8_t> encodeDictionary(const Dictionary& dictionary) {
+  return cbor::encode(Value(dictionary));
+}
+
+Dictionary decodeDictionary(const void* bytes, int size) {
+  if (bytes == nullptr || size <= 0) return {};
+  auto value = cbor::decode(
+      std::span<const uint8_t>(static_cast<const uint8_t*>(bytes), static_cast<size_t>(size)));
+  if (!value.ok() || value->dictionary() == nullptr) {
+    log::vr().error("registry row holds an undecodable dictionary");
+    return {};
+  }
+  return std::move(*value->dictionary());
+}
+
+std::string parentOf(const std::string& path) {
+  size_t slash = path.rfind('/');
+  if (slash == std::string::npos || slash == 0) return "/";
+  return path.substr(0, slash);
+}
+
+std::string baseName(const std::string& path) {
+  size_t slash = path.rfind('/');
+  return slash == std::string::npos ? path : path.substr(slash + 1);
+}
+
+bool endsWith(std::string_view text, std::string_view suffix) {
+  return text.size() >= suffix.size() && text.substr(text.size() - suffix.size()) == suffix;
+}
+
+bool isDirectory(const std::string& path) {
+  struct stat st {};
+  return ::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+
+// A bundle directory is gone only when the system says so; a transient failure to look
+// (EACCES, EIO) must not unregister anything.
+bool isGone(const std::string& path) {
+  struct stat st {};
+  if (::stat(path.c_str(), &st) == 0) return !S_ISDIR(st.st_mode);
+  return errno == ENOENT || errno == ENOTDIR;
+}
+
+// Sorted names of the directory's entries that are directories, at most limit of them.
+std::vector<std::string> subdirectories(const std::string& dir, std::string_view suffix,
+                                        size_t limit, bool& truncated) {
+  std::vector<std::string> names;
+  truncated = false;
+  std::error_code ec;
+  for (fs::directory_iterator it(dir, ec), end; !ec && it != end; it.increment(ec)) {
+    std::string name = it->path().filename().string();
+    if (name.empty() || name.front() == '.') continue;
+    if (!suffix.empty() && !endsWith(name, suffix)) continue;
+    if (!isDirectory(it->path().string())) continue;
+    if (names.size() == limit) {
+      truncated = true;
+      break;
+    }
+    names.push_back(std::move(name));
+  }
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
+Result<Dictionary> readInfo(const std::string& bundle) {
+  if (!isDirectory(bundle)) {
+    return makeError(kMalformedBundle, fmt::format("{} is not a bundle directory", bundle));
+  }
+  auto value = dmap::readFile(paths::join(bundle, "Info.dmap"));
+  if (!value.ok()) {
+    return makeError(kMalformedBundle,
+                     fmt::format("{}: unreadable Info.dmap: {}", bundle, value.error().message));
+  }
+  if (value->dictionary() == nullptr) {
+    return makeError(kMalformedBundle,
+                     fmt::format("{}: Info.dmap does not hold a dictionary", bundle));
+  }
+  return std::move(*value->dictionary());
+}
+
+// Every <language>.lproj/InfoDmap.strings of the bundle: language -> table. A malformed table
+// is logged and left out; it does not make the bundle malformed.
+Dictionary readInfoStrings(const std::string& bundle) {
+  Dictionary tables;
+  bool truncated = false;
+  for (const std::string& dir :
+       subdirectories(bundle, ".lproj", kMaxLanguagesPerBundle, truncated)) {
+    std::string file = paths::join(paths::join(bundle, dir), "InfoDmap.strings");
+    auto value = dmap::readFile(file);
+    if (!value.ok()) {
+      if (!value.error().isPosix(ENOENT)) {
+        log::vr().error("ignoring strings table %s: %s", file, value.error().message);
+      }
+      continue;
+    }
+    if (value->dictionary() == nullptr) {
+      log::vr().error("ignoring strings table %s: not a dictionary", file);
+      continue;
+    }
+    tables.emplace(dir.substr(0, dir.size() - std::string_view(".lproj").size()),
+                   std::move(*value));
+  }
+  if (truncated)
+    log::vr().error("%s: more than %u languages; the rest ignored", bundle,
+                    static_cast<unsigned>(kMaxLanguagesPerBundle));
+  return tables;
+}
+
+std::optional<std::string> stringValue(const Dictionary& dictionary, std::string_view key) {
+  auto it = dictionary.find(key);
+  if (it == dictionary.end() || it->second.string() == nullptr) return std::nullopt;
+  return *it->second.string();
+}
+
+// A localized value: the strings table of the first language that has one, then the info
+// dictionary itself.
+std::optional<std::string> localized(const Dictionary& info, const Dictionary& tables,
+                                     const std::vector<std::string>& languages,
+                                     std::initializer_list<std::string_view> keys) {
+  for (const std::string& language : languages) {
+    auto table = tables.find(language);
+    if (table == tables.end() || table->second.dictionary() == nullptr) continue;
+    for (std::string_view key : keys) {
+      if (auto text = stringValue(*table->second.dictionary(), key)) return text;
+    }
+  }
+  for (std::string_view key : keys) {
+    if (auto text = stringValue(info, key)) return text;
+  }
+  return std::nullopt;
+}
+
+std::optional<std::string> localizedName(const Dictionary& info, const Dictionary& tables,
+                                         const std::vector<std::string>& languages) {
+  return localized(info, tables, languages, {kBundleDisplayNameKey, kBundleNameKey});
+}
+
+std::string utcStamp() {
+  std::time_t t = std::time(nullptr);
+  std::tm tm{};
+  gmtime_r(&t, &tm);
+  char text[32];
+  std::strftime(text, sizeof text, "%Y%m%dT%H%M%SZ", &tm);
+  return text;
+}
+
+}  // namespace
+
+struct AppPlan {
+  std::string path;
+  std::string identifier;
+  std::optional<std::string> version;
+  Dictionary info;
+  Dictionary strings;
+};
+
+struct PlugInPlan {
+  std::string path;
+  std::string identifier;
+  std::optional<std::string> version;
+  std::optional<std::string> appPath;
+  std::optional<std::string> point;
+  Dictionary info;  // merged
+  Dictionary sdk;
+  Dictionary entitlements;
+  std::optional<std::string> container;
+  Dictionary strings;
+};
+
+struct SqliteRegistry::Plan {
+  std::vector<AppPlan> apps;
+  std::vector<PlugInPlan> plugIns;
+  // An application being (re-)registered: its registered plug-ins missing from plugIns go.
+  std::optional<std::string> replacesPlugInsOf;
+};
+
+// Prepared once, kept for the life of the connection.
+struct SqliteRegistry::Statements {
+  sqlite3_stmt* begin = nullptr;
+  sqlite3_stmt* commit = nullptr;
+  sqlite3_stmt* rollback = nullptr;
+  sqlite3_stmt* setMeta = nullptr;
+  sqlite3_stmt* getMeta = nullptr;
+  sqlite3_stmt* upsertApp = nullptr;
+  sqlite3_stmt* deleteApp = nullptr;
+  sqlite3_stmt* appByPath = nullptr;
+  sqlite3_stmt* appByIdentifier = nullptr;
+  sqlite3_stmt* appExists = nullptr;
+  sqlite3_stmt* allApps = nullptr;
+  sqlite3_stmt* insertPlugIn = nullptr;
+  sqlite3_stmt* deletePlugIn = nullptr;
+  sqlite3_stmt* insertPoint = nullptr;
+  sqlite3_stmt* deletePoints = nullptr;
+  sqlite3_stmt* plugInByUuid = nullptr;
+  sqlite3_stmt* plugInByPath = nullptr;
+  sqlite3_stmt* plugInsOfApp = nullptr;
+  sqlite3_stmt* plugInUuidsOfApp = nullptr;
+  sqlite3_stmt* allPlugIns = nullptr;
+  sqlite3_stmt* plugInsOfPoint = nullptr;
+  sqlite3_stmt* upsertSdk = nullptr;
+  sqlite3_stmt* sdkOf = nullptr;
+
+  std::vector<sqlite3_stmt**> all() {
+    return {&begin,          &commit,       &rollback,     &setMeta,          &getMeta,
+            &upsertApp,      &deleteApp,    &appByPath,    &appByIdentifier,  &appExists,
+            &allApps,        &insertPlugIn, &deletePlugIn, &insertPoint,      &deletePoints,
+            &plugInByUuid,   &plugInByPath, &plugInsOfApp, &plugInUuidsOfApp, &allPlugIns,
+            &plugInsOfPoint, &upsertSdk,    &sdkOf};
+  }
+  ~Statements() {
+    for (sqlite3_stmt** statement : all()) sqlite3_finalize(*statement);
+  }
+};
+
+namespace {
+
+// Resets a kept statement when a scope using it ends, whatever the path out.
+class Use {
+ public:
+  explicit Use(sqlite3_stmt* statement) : statement_(statement) {}
+  ~Use() {
+    sqlite3_reset(statement_);
+    sqlite3_clear_bindings(statement_);
+  }
+  Use(const Use&) = delete;
+  Use& operator=(const Use&) = delete;
+
+  Use& text(int index, std::string_view value) {
+    sqlite3_bind_text(statement_, index, value.data(), static_cast<int>(value.size()),
+                      SQLITE_TRANSIENT);
+    return *this;
+  }
+  Use& optionalText(int index, const std::optional<std::string>& value) {
+    if (value) return text(index, *value);
+    sqlite3_bind_null(statement_, index);
+    return *this;
+  }
+  Use& blob(int index, const void* bytes, size_t size) {
+    sqlite3_bind_blob(statement_, index, bytes, static_cast<int>(size), SQLITE_TRANSIENT);
+    return *this;
+  }
+  Use& blob(int index, const std::vector<uint8_t>& bytes) {
+    return blob(index, bytes.data(), bytes.size());
+  }
+  Use& uuid(int index, const Uuid& uuid) { return blob(index, uuid.bytes.data(), 16); }
+  Use& real(int index, double value) {
+    sqlite3_bind_double(statement_, index, value);
+    return *this;
+  }
+  int step() { return sqlite3_step(statement_); }
+  sqlite3_stmt* get() const { return statement_; }
+
+ private:
+  sqlite3_stmt* statement_;
+};
+
+std::optional<std::string> columnText(sqlite3_stmt* statement, int column) {
+  if (sqlite3_column_type(statement, column) == SQLITE_NULL) return std::nullopt;
+  const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(statement, column));
+  return std::string(text, static_cast<size_t>(sqlite3_column_bytes(statement, column)));
+}
+
+Dictionary columnDictionary(sqlite3_stmt* statement, int column) {
+  const void* bytes = sqlite3_column_blob(statement, column);
+  return decodeDictionary(bytes, sqlite3_column_bytes(statement, column));
+}
+
+Uuid columnUuid(sqlite3_stmt* statement, int column) {
+  Uuid uuid;
+  if (sqlite3_column_bytes(statement, column) == 16) {
+    uuid = Uuid::fromBytes(static_cast<const uint8_t*>(sqlite3_column_blob(statement, column)));
+  }
+  return uuid;
+}
+
+}  // namespace
+
+// ---------------------------------------------------------------------------------------------
+// Opening
+
+SqliteRegistry::SqliteRegistry(Options options) : options_(std::move(options)) {}
+
+SqliteRegistry::~SqliteRegistry() {
+  // Notices already posted run before the registry goes, so an observer that looks back into
+  // the registry from a notice never finds it half destroyed.
+  if (options_.queue && !options_.queue->isCurrent()) options_.queue->sync([] {});
+  closeDatabase();
+}
+
+Result<std::shared_ptr<SqliteRegistry>> SqliteRegistry::open(Options options) {
+  if (options.stateDir.empty()) options.stateDir = paths::stateDir();
+  if (options.systemRoot.empty()) options.systemRoot = paths::systemRoot();
+  if (options.databasePath.empty()) {
+    options.databasePath = paths::join(options.stateDir, "registry.db");
+  }
+  if (!options.codeSigning) options.codeSigning = CodeSigning::system();
+  if (!options.queue) options.queue = SerialQueue::make("com.corvane.vantor");
+  std::shared_ptr<SqliteRegistry> registry(new SqliteRegistry(std::move(options)));
+  registry->observers_ = registry->options_.observers;
+  EK_TRY(registry->openDatabase());
+  registry->checkLocale();
+  if (registry->options_.scanOnOpen) registry->reconcile();
+  return registry;
+}
+
+void SqliteRegistry::closeDatabase() {
+  statements_.reset();
+  if (db_ != nullptr) sqlite3_close_v2(db_);
+  db_ = nullptr;
+}
+
+namespace {
+
+enum class OpenOutcome { Ok, Corrupt, Failed };
+
+struct OpenResult {
+  OpenOutcome outcome = OpenOutcome::Ok;
+  EkError error;
+};
+
+bool isCorruption(int rc) {
+  int primary = rc & 0xff;
+  return primary == SQLITE_NOTADB || primary == SQLITE_CORRUPT || primary == SQLITE_CANTOPEN ||
+         primary == SQLITE_PERM || primary == SQLITE_AUTH || primary == SQLITE_READONLY;
+}
+
+OpenResult failure(sqlite3* db, int rc, std::string_view what) {
+  std::string message = fmt::format("{}: {}", what, db ? sqlite3_errmsg(db) : sqlite3_errstr(rc));
+  int primary = rc & 0xff;
+  if (primary == SQLITE_BUSY || primary == SQLITE_LOCKED) {
+    return {OpenOutcome::Failed,
+            makeError(kInUse, fmt::format("registry database is in use: {}", message))};
+  }
+  if (isCorruption(rc)) return {OpenOutcome::Corrupt, makeError(kDatabase, message)};
+  return {OpenOutcome::Failed, makeError(kDatabase, message)};
+}
+
+// Runs a statement that may answer rows; answers the first column of the first row.
+int execute(sqlite3* db, const char* sql, std::string* firstValue = nullptr) {
+  sqlite3_stmt* statement = nullptr;
+  int rc = sqlite3_prepare_v2(db, sql, -1, &statement, nullptr);
+  if (rc != SQLITE_OK) return rc;
+  bool first = true;
+  while ((rc = sqlite3_step(statement)) == SQLITE_ROW) {
+    if (first && firstValue != nullptr) {
+      const unsigned char* text = sqlite3_column_text(statement, 0);
+      *firstValue = text ? reinterpret_cast<const char*>(text) : "";
+    }
+    first = false;
+  }
+  sqlite3_finalize(statement);
+  return rc == SQLITE_DONE ? SQLITE_OK : rc;
+}
+
+OpenResult openAndCheck(const std::string& path, sqlite3** out) {
+  sqlite3* db = nullptr;
+  int rc = sqlite3_open_v2(
+      path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr);
+  *out = db;
+  if (rc != SQLITE_OK) return failure(db, rc, "opening the registry database");
+  sqlite3_extended_result_codes(db, 1);
+  // Exclusive locking before WAL is first used: the WAL index then lives in this process's
+  // memory and the lock is never given back until the connection closes.
+  if ((rc = execute(db, "PRAGMA locking_mode=EXCLUSIVE")) != SQLITE_OK) {
+    return failure(db, rc, "setting exclusive locking");
+  }
+  std::string mode;
+  if ((rc = execute(db, "PRAGMA journal_mode=WAL", &mode)) != SQLITE_OK) {
+    return failure(db, rc, "setting WAL mode");
+  }
+  if (mode != "wal") {
+    return {OpenOutcome::Failed, makeError(kDatabase, "the registry database refused WAL mode")};
+  }
+  // Take the lock now, so that a second opener fails at once rather than on its first write.
+  if ((rc = execute(db, "BEGIN EXCLUSIVE")) != SQLITE_OK) {
+    return failure(db, rc, "locking the registry database");
+  }
+  execute(db, "COMMIT");
+  std::string check;
+  if ((rc = execute(db, "PRAGMA quick_check", &check)) != SQLITE_OK) {
+    return failure(db, rc, "checking the registry database");
+  }
+  if (check != "ok") {
+    return {OpenOutcome::Corrupt, makeError(kDatabase, fmt::format("quick_check: {}", check))};
+  }
+  std::string version;
+  if ((rc = execute(db, "PRAGMA user_version", &version)) != SQLITE_OK) {
+    return failure(db, rc, "reading the schema version");
+  }
+  std::string tables;
+  if ((rc = execute(db, "SELECT count(*) FROM sqlite_master", &tables)) != SQLITE_OK) {
+    return failure(db, rc, "reading the schema");
+  }
+  if (version == "0" && tables == "0") {
+    std::string create =
+        fmt::format("BEGIN; {} PRAGMA user_version={}; COMMIT;", kSchema, kSchemaVersion);
+    if ((rc = sqlite3_exec(db, create.c_str(), nullptr, nullptr, nullptr)) != SQLITE_OK) {
+      OpenResult result = failure(db, rc, "creating the registry schema");
+      execute(db, "ROLLBACK");
+      return result;
+    }
+  } else if (version != std::to_string(kSchemaVersion)) {
+    return {OpenOutcome::Corrupt,
+            makeError(kDatabase,
+                      fmt::format("schema version {} (expected {})", version, kSchemaVersion))};
+  }
+  if ((rc = execute(db, fmt::format("PRAGMA cache_size=-{}", kCacheSizeKiB).c_str())) !=
+          SQLITE_OK ||
+      (rc = execute(db, "PRAGMA synchronous=FULL")) != SQLITE_OK) {
+    return failure(db, rc, "configuring the registry database");
+  }
+  return {};
+}
+
+}  // namespace
+
+Result<void> SqliteRegistry::openDatabase() {
+  const std::string& path = options_.databasePath;
+  EK_TRY(paths::ensureDirectory(parentOf(path)));
+  for (int attempt = 0; attempt < 2; ++attempt) {
+    sqlite3* db = nullptr;
+    OpenResult result = openAndCheck(path, &db);
+    if (result.outcome == OpenOutcome::Ok) {
+      db_ = db;
+      break;
+    }
+    if (result.outcome == OpenOutcome::Failed || attempt == 1) {
+      sqlite3_close_v2(db);
+      return result.error;
+    }
+    // Renamed while still open: closing may delete the -wal file, which belongs to the
+    // evidence being kept.
+    std::string aside = fmt::format("{}.corrupt-{}", path, utcStamp());
+    for (int n = 1; access(aside.c_str(), F_OK) == 0; ++n) {
+      aside = fmt::format("{}.corrupt-{}-{}", path, utcStamp(), n);
+    }
+    log::vr().error("registry database %s is unusable (%s); moved aside to %s, rebuilding", path,
+                    result.error.message, aside);
+    if (::rename(path.c_str(), aside.c_str()) != 0 && errno != ENOENT) {
+      int error = errno;
+      sqlite3_close_v2(db);
+      return EkError::fromErrno(error, fmt::format("moving {} aside", path));
+    }
+    // Kept beside the main file under the names SQLite looks for, so the copy stays readable.
+    for (const char* suffix : {"-wal", "-shm"}) {
+      std::string from = path + suffix;
+      std::string to = aside + suffix;
+      if (::rename(from.c_str(), to.c_str()) != 0 && errno != ENOENT) {
+        log::vr().error("could not move %s aside: %{errno}d", from, errno);
+        ::unlink(from.c_str());
+      }
+    }
+    sqlite3_close_v2(db);
+  }
+  return prepareSchema();
+}
+
+Result<void> SqliteRegistry::prepareSchema() {
+  statements_ = std::make_unique<Statements>();
+  Statements& s = *statements_;
+  const std::string plugInSelect = fmt::format("SELECT {} FROM plugins p ", kPlugInColumns);
+  const std::pair<sqlite3_stmt**, std::string> sql[] = {
+      {&s.begin, "BEGIN IMMEDIATE"},
+      {&s.commit, "COMMIT"},
+      {&s.rollback, "ROLLBACK"},
+      {&s.setMeta, "INSERT OR REPLACE INTO meta(key, value) VALUES(?1, ?2)"},
+      {&s.getMeta, "SELECT value FROM meta WHERE key = ?1"},
+      {&s.upsertApp,
+       "INSERT OR REPLACE INTO applications(path, identifier, version, info, strings, "
+       "registered) VALUES(?1, ?2, ?3, ?4, ?5, ?6)"},
+      {&s.deleteApp, "DELETE FROM applications WHERE path = ?1"},
+      {&s.appByPath,
+       "SELECT path, identifier, version, info, strings, registered FROM applications "
+       "WHERE path = ?1"},
+      {&s.appByIdentifier,
+       "SELECT path, identifier, version, info, strings, registered FROM applications "
+       "WHERE identifier = ?1 ORDER BY path LIMIT 1"},
+      {&s.appExists, "SELECT 1 FROM applications WHERE path = ?1"},
+      {&s.allApps, "SELECT path FROM applications ORDER BY path"},
+      {&s.insertPlugIn,
+       "INSERT INTO plugins(uuid, path, identifier, original_identifier, version, app_path, "
+       "point, info, sdk, entitlements, registered, container, strings) "
+       "VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, ?11, ?12, ?13)"},
+      {&s.deletePlugIn, "DELETE FROM plugins WHERE uuid = ?1"},
+      {&s.insertPoint, "INSERT OR IGNORE INTO plugin_points(point, uuid) VALUES(?1, ?2)"},
+      {&s.deletePoints, "DELETE FROM plugin_points WHERE uuid = ?1"},
+      {&s.plugInByUuid, plugInSelect + "WHERE p.uuid = ?1"},
+      {&s.plugInByPath, plugInSelect + "WHERE p.path = ?1"},
+      {&s.plugInsOfApp, plugInSelect + "WHERE p.app_path = ?1 ORDER BY p.path"},
+      {&s.plugInUuidsOfApp, "SELECT uuid FROM plugins WHERE app_path = ?1 ORDER BY path"},
+      {&s.allPlugIns, plugInSelect + "ORDER BY p.path"},
+      {&s.plugInsOfPoint, fmt::format("SELECT {} FROM plugin_points pp JOIN plugins p "
+                                      "ON p.uuid = pp.uuid WHERE pp.point = ?1 ORDER BY p.path",
+                                      kPlugInColumns)},
+      {&s.upsertSdk, "INSERT OR REPLACE INTO extension_points(identifier, sdk) VALUES(?1, ?2)"},
+      {&s.sdkOf, "SELECT sdk FROM extension_points WHERE identifier = ?1"},
+  };
+  for (const auto& [statement, text] : sql) {
+    int rc =
+        sqlite3_prepare_v3(db_, text.c_str(), -1, SQLITE_PREPARE_PERSISTENT, statement, nullptr);
+    if (rc != SQLITE_OK) {
+      return makeError(kDatabase, fmt::format("preparing \"{}\": {}", text, sqlite3_errmsg(db_)));
+    }
+  }
+  {
+    Use get(s.getMeta);
+    get.text(1, "knowledge");
+    if (get.step() == SQLITE_ROW && sqlite3_column_bytes(get.get(), 0) == 16) {
+      knowledge_ = columnUuid(get.get(), 0);
+      return {};
+    }
+  }
+  knowledge_ = Uuid::random();
+  Use set(s.setMeta);
+  set.text(1, "knowledge").uuid(2, knowledge_);
+  if (set.step() != SQLITE_DONE) {
+    return makeError(kDatabase, fmt::format("storing the knowledge UUID: {}", sqlite3_errmsg(db_)));
+  }
+  return {};
+}
+
+// ---------------------------------------------------------------------------------------------
+// Reading bundles into a plan (no lock held: only files are read)
+
+namespace {
+
+struct BundleReader {
+  const SqliteRegistry::Options& options;
+
+  Result<AppPlan> readApplication(const std::string& path) {
+    Dictionary info = EK_TRY(readInfo(path));
+    auto identifier = stringValue(info, kBundleIdentifierKey);
+    if (!identifier) {
+      return makeError(kMalformedBundle,
+                       fmt::format("{}: Info.dmap has no QvBundleIdentifier string", path));
+    }
+    AppPlan plan;
+    plan.path = path;
+    plan.identifier = *identifier;
+    plan.version = stringValue(info, kBundleVersionKey);
+    plan.strings = readInfoStrings(path);
+    plan.info = std::move(info);
+    return plan;
+  }
+
+  std::optional<Dictionary> readSdk(const std::string& point) {
+    if (!checkPlugInIdentifier(point).ok()) {
+      log::vr().error("extension point \"%s\" cannot name an SDK file", point);
+      return std::nullopt;
+    }
+    std::string file =
+        paths::join(paths::join(options.systemRoot, "Library/ExtensionPoints"), point + ".dmap");
+    auto value = dmap::readFile(file);
+    if (!value.ok()) {
+      if (value.error().isPosix(ENOENT)) {
+        log::vr().info("plug-in sdk \"%s\" not registered", point);
+      } else {
+        log::vr().error("unreadable SDK dictionary %s: %s", file, value.error().message);
+      }
+      return std::nullopt;
+    }
+    if (value->dictionary() == nullptr) {
+      log::vr().error("SDK dictionary %s does not hold a dictionary", file);
+      return std::nullopt;
+    }
+    return std::move(*value->dictionary());
+  }
+
+  Result<PlugInPlan> readPlugIn(const std::string& path) {
+    Dictionary own = EK_TRY(readInfo(path));
+    auto identifier = stringValue(own, kBundleIdentifierKey);
+    if (!identifier) {
+      return makeError(kMalformedBundle,
+                       fmt::format("{}: Info.dmap has no QvBundleIdentifier string", path));
+    }
+    EK_TRY(checkPlugInIdentifier(*identifier));
+    auto extension = own.find(kExtensionKey);
+    if (extension == own.end() || extension->second.dictionary() == nullptr) {
+      return makeError(kMalformedBundle,
+                       fmt::format("{}: Info.dmap has no ZuExtension dictionary", path));
+    }
+    PlugInPlan plan;
+    plan.path = path;
+    plan.identifier = *identifier;
+    plan.version = stringValue(own, kBundleVersionKey);
+    if (const Value* point = extension->second.get(kExtensionPointKey)) {
+      if (point->string() == nullptr) {
+        return makeError(kMalformedBundle,
+                         fmt::format("{}: ZuExtensionPointIdentifier is not a string", path));
+      }
+      plan.point = *point->string();
+    }
+    if (auto executable = own.find(kBundleExecutableKey); executable != own.end()) {
+      const std::string* name = executable->second.string();
+      if (name == nullptr || name->empty() || *name == "." || *name == ".." ||
+          name->find('/') != std::string::npos || name->find('\0') != std::string::npos) {
+        return makeError(kMalformedBundle,
+                         fmt::format("{}: QvBundleExecutable is not a file name", path));
+      }
+      plan.entitlements = options.codeSigning->entitlementsForExecutable(paths::join(path, *name));
+    }
+    if (plan.point) {
+      if (auto sdk = readSdk(*plan.point)) plan.sdk = std::move(*sdk);
+    }
+    plan.info = mergeSdk(plan.sdk, own);
+    Dictionary* merged = plan.info[std::string(kExtensionKey)].dictionary();
+    if (plan.point) {
+      auto attributes = merged->find(kExtensionAttributesKey);
+      if (attributes != merged->end() && attributes->second.dictionary() != nullptr) {
+        attributes->second.dictionary()->try_emplace(std::string(kExtensionPointKey), *plan.point);
+      }
+    }
+    const Value* protocol = nullptr;
+    if (auto it = merged->find(kExtensionProtocolKey); it != merged->end()) protocol = &it->second;
+    bool dataOnly = protocol != nullptr && protocol->string() != nullptr &&
+                    *protocol->string() == kDataProtocol;
+    if (!dataOnly) {
+      plan.container = paths::join(paths::join(options.stateDir, "containers"), plan.identifier);
+    }
+    plan.strings = readInfoStrings(path);
+    std::string parent = parentOf(path);
+    if (baseName(parent) == "PlugIns" && endsWith(parentOf(parent), ".app")) {
+      plan.appPath = parentOf(parent);
+    }
+    return plan;
+  }
+};
+
+}  // namespace
+
+Result<void> SqliteRegistry::registerBundle(const std::string& rawPath) {
+  auto path = pathFromUrlOrPath(rawPath);
+  if (!path) {
+    return makeError(kMalformedBundle, fmt::format("\"{}\" is not an absolute path", rawPath));
+  }
+  std::lock_guard change(changeMutex_);
+  BundleReader reader{options_};
+  Plan plan;
+  if (endsWith(*path, ".app")) {
+    plan.apps.push_back(EK_TRY(reader.readApplication(*path)));
+    bool truncated = false;
+    std::string plugIns = paths::join(*path, "PlugIns");
+    auto names = subdirectories(plugIns, ".appex", kMaxPlugInsPerApplication, truncated);
+    if (truncated) {
+      return makeError(kMalformedBundle,
+                       fmt::format("{}: more than {} plug-ins", *path, kMaxPlugInsPerApplication));
+    }
+    for (const std::string& name : names) {
+      PlugInPlan plugIn = EK_TRY(reader.readPlugIn(paths::join(plugIns, name)));
+      plan.plugIns.push_back(std::move(plugIn));
+    }
+    plan.replacesPlugInsOf = *path;
+  } else {
+    PlugInPlan plugIn = EK_TRY(reader.readPlugIn(*path));
+    if (plugIn.appPath) {
+      bool known = false;
+      {
+        std::lock_guard db(dbMutex_);
+        Use exists(statements_->appExists);
+        exists.text(1, *plugIn.appPath);
+        known = exists.step() == SQLITE_ROW;
+      }
+      if (!known) plan.apps.push_back(EK_TRY(reader.readApplication(*plugIn.appPath)));
+    }
+    plan.plugIns.push_back(std::move(plugIn));
+  }
+  return applyPlan(plan);
+}
+
+Result<void> SqliteRegistry::applyPlan(Plan& plan) {
+  // Containers first: they outlive registrations anyway, and a failure here leaves the
+  // registry untouched.
+  for (const PlugInPlan& plugIn : plan.plugIns) {
+    if (!plugIn.container) continue;
+    EK_TRY(paths::ensureDirectory(*plugIn.container));
+    EK_TRY(paths::ensureDirectory(paths::join(*plugIn.container, "tmp")));
+  }
+
+  std::vector<Uuid> uuids;
+  std::vector<PlugInProxyPtr> leaving;
+  {
+    std::lock_guard db(dbMutex_);
+    std::set<std::string> planned;
+    for (const PlugInPlan& plugIn : plan.plugIns) {
+      planned.insert(plugIn.path);
+      Use find(statements_->plugInByPath);
+      find.text(1, plugIn.path);
+      PlugInProxyPtr existing = find.step() == SQLITE_ROW ? readPlugInLocked(find.get()) : nullptr;
+      if (existing && existing->identifier == plugIn.identifier) {
+        uuids.push_back(existing->uuid);
+      } else {
+        uuids.push_back(Uuid::random());
+        if (existing) leaving.push_back(existing);
+      }
+    }
+    if (plan.replacesPlugInsOf) {
+      Use list(statements_->plugInsOfApp);
+      list.text(1, *plan.replacesPlugInsOf);
+      for (PlugInProxyPtr& old : readAllLocked(list.get())) {
+        if (!planned.contains(old->path)) leaving.push_back(std::move(old));
+      }
+    }
+  }
+
+  deliverUninstall(leaving);
+
+  std::vector<PlugInProxyPtr> installed;
+  {
+    std::lock_guard db(dbMutex_);
+    Statements& s = *statements_;
+    auto fail = [&](std::string_view what) {
+      EkError error = makeError(kDatabase, fmt::format("{}: {}", what, sqlite3_errmsg(db_)));
+      Use(s.rollback).step();
+      return error;
+    };
+    if (Use(s.begin).step() != SQLITE_DONE) {
+      return makeError(kDatabase, fmt::format("beginning a change: {}", sqlite3_errmsg(db_)));
+    }
+    double registered = now();
+    for (const AppPlan& app : plan.apps) {
+      Use upsert(s.upsertApp);
+      upsert.text(1, app.path)
+          .text(2, app.identifier)
+          .optionalText(3, app.version)
+          .blob(4, encodeDictionary(app.info))
+          .blob(5, encodeDictionary(app.strings))
+          .real(6, registered);
+      if (upsert.step() != SQLITE_DONE) return fail("registering an application");
+    }
+    for (const PlugInProxyPtr& old : leaving) {
+      Use points(s.deletePoints);
+      points.uuid(1, old->uuid);
+      Use remove(s.deletePlugIn);
+      remove.uuid(1, old->uuid);
+      if (points.step() != SQLITE_DONE || remove.step() != SQLITE_DONE) {
+        return fail("unregistering a replaced plug-in");
+      }
+    }
+    for (size_t i = 0; i < plan.plugIns.size(); ++i) {
+      const PlugInPlan& plugIn = plan.plugIns[i];
+      const Uuid& uuid = uuids[i];
+      {
+        Use points(s.deletePoints);
+        points.uuid(1, uuid);
+        Use remove(s.deletePlugIn);
+        remove.uuid(1, uuid);
+        if (points.step() != SQLITE_DONE || remove.step() != SQLITE_DONE) {
+          return fail("replacing a plug-in");
+        }
+      }
+      Use insert(s.insertPlugIn);
+      insert.uuid(1, uuid)
+          .text(2, plugIn.path)
+          .text(3, plugIn.identifier)
+          .text(4, plugIn.identifier)
+          .optionalText(5, plugIn.version)
+          .optionalText(6, plugIn.appPath)
+          .optionalText(7, plugIn.point)
+          .blob(8, encodeDictionary(plugIn.info))
+          .blob(9, encodeDictionary(plugIn.sdk))
+          .blob(10, encodeDictionary(plugIn.entitlements))
+          .real(11, registered)
+          .optionalText(12, plugIn.container)
+          .blob(13, encodeDictionary(plugIn.strings));
+      if (insert.step() != SQLITE_DONE) return fail("registering a plug-in");
+      for (const std::string& value : extensionPointIndexValues(plugIn.info)) {
+        Use point(s.insertPoint);
+        point.text(1, extensionPointIndexKey(value)).uuid(2, uuid);
+        if (point.step() != SQLITE_DONE) return fail("indexing a plug-in");
+      }
+      if (plugIn.point && !plugIn.sdk.empty()) {
+        Use sdk(s.upsertSdk);
+        sdk.text(1, *plugIn.point).blob(2, encodeDictionary(plugIn.sdk));
+        if (sdk.step() != SQLITE_DONE) return fail("recording an extension point");
+      }
+    }
+    Uuid knowledge = Uuid::random();
+    {
+      Use meta(s.setMeta);
+      meta.text(1, "knowledge").uuid(2, knowledge);
+      if (meta.step() != SQLITE_DONE) return fail("changing the knowledge UUID");
+    }
+    if (Use(s.commit).step() != SQLITE_DONE) return fail("committing a change");
+    knowledge_ = knowledge;
+    for (const Uuid& uuid : uuids) {
+      Use find(s.plugInByUuid);
+      find.uuid(1, uuid);
+      if (find.step() == SQLITE_ROW) installed.push_back(readPlugInLocked(find.get()));
+    }
+  }
+  for (const PlugInProxyPtr& plugIn : installed) {
+    log::vr().info("registered %s", plugIn->description());
+  }
+  deliverInstall(std::move(installed));
+  return {};
+}
+
+Result<void> SqliteRegistry::unregisterBundle(const std::string& rawPath) {
+  auto path = pathFromUrlOrPath(rawPath);
+  if (!path) {
+    return makeError(kNotRegistered, fmt::format("\"{}\" is not an absolute path", rawPath));
+  }
+  std::lock_guard change(changeMutex_);
+  return unregisterLocked(*path);
+}
+
+Result<void> SqliteRegistry::unregisterLocked(const std::string& path) {
+  std::vector<PlugInProxyPtr> leaving;
+  bool isApplication = false;
+  {
+    std::lock_guard db(dbMutex_);
+    Use find(statements_->plugInByPath);
+    find.text(1, path);
+    if (find.step() == SQLITE_ROW) {
+      leaving.push_back(readPlugInLocked(find.get()));
+    } else {
+      Use exists(statements_->appExists);
+      exists.text(1, path);
+      if (exists.step() != SQLITE_ROW) {
+        return makeError(kNotRegistered, fmt::format("no bundle is registered at {}", path));
+      }
+      isApplication = true;
+      Use list(statements_->plugInsOfApp);
+      list.text(1, path);
+      leaving = readAllLocked(list.get());
+    }
+  }
+
+  deliverUninstall(leaving);
+
+  std::lock_guard db(dbMutex_);
+  Statements& s = *statements_;
+  auto fail = [&](std::string_view what) {
+    EkError error = makeError(kDatabase, fmt::format("{}: {}", what, sqlite3_errmsg(db_)));
+    Use(s.rollback).step();
+    return error;
+  };
+  if (Use(s.begin).step() != SQLITE_DONE) {
+    return makeError(kDatabase, fmt::format("beginning a change: {}", sqlite3_errmsg(db_)));
+  }
+  for (const PlugInProxyPtr& old : leaving) {
+    Use points(s.deletePoints);
+    points.uuid(1, old->uuid);
+    Use remove(s.deletePlugIn);
+    remove.uuid(1, old->uuid);
+    if (points.step() != SQLITE_DONE || remove.step() != SQLITE_DONE) {
+      return fail("unregistering a plug-in");
+    }
+  }
+  if (isApplication) {
+    Use remove(s.deleteApp);
+    remove.text(1, path);
+    if (remove.step() != SQLITE_DONE) return fail("unregistering an application");
+  }
+  Uuid knowledge = Uuid::random();
+  {
+    Use meta(s.setMeta);
+    meta.text(1, "knowledge").uuid(2, knowledge);
+    if (meta.step() != SQLITE_DONE) return fail("changing the knowledge UUID");
+  }
+  if (Use(s.commit).step() != SQLITE_DONE) return fail("committing a change");
+  knowledge_ = knowledge;
+  log::vr().info("unregistered %s (%u plug-ins)", path, static_cast<unsigned>(leaving.size()));
+  return {};
+}
+
+void SqliteRegistry::reconcile() {
+  std::lock_guard change(changeMutex_);
+  BundleReader reader{options_};
+  std::string dir = paths::join(options_.systemRoot, "Library/PlugIns");
+  bool truncated = false;
+  for (const std::string& name : subdirectories(dir, "", kMaxSystemBundles, truncated)) {
+    std::string path = paths::join(dir, name);
+    Plan plan;
+    auto plugIn = reader.readPlugIn(path);
+    if (!plugIn.ok()) {
+      log::vr().error("not registering system plug-in %s: %s", path, plugIn.error().message);
+      continue;
+    }
+    plan.plugIns.push_back(std::move(plugIn).value());
+    if (auto applied = applyPlan(plan); !applied.ok()) {
+      log::vr().error("not registering system plug-in %s: %s", path, applied.error().message);
+    }
+  }
+  if (truncated) log::vr().error("%s: too many bundles; the rest ignored", dir);
+
+  std::vector<std::string> gone;
+  {
+    std::lock_guard db(dbMutex_);
+    Use list(statements_->allPlugIns);
+    for (const PlugInProxyPtr& plugIn : readAllLocked(list.get())) {
+      if (isGone(plugIn->path)) gone.push_back(plugIn->path);
+    }
+    Use apps(statements_->allApps);
+    while (apps.step() == SQLITE_ROW) {
+      if (auto path = columnText(apps.get(), 0); path && isGone(*path)) gone.push_back(*path);
+    }
+  }
+  for (const std::string& path : gone) {
+    if (auto removed = unregisterLocked(path);
+        !removed.ok() && removed.error().code != kNotRegistered) {
+      log::vr().error("could not unregister vanished bundle %s: %s", path, removed.error().message);
+    }
+  }
+}
+
+// ---------------------------------------------------------------------------------------------
+// Lookups
+
+PlugInProxyPtr SqliteRegistry::readPlugInLocked(void* raw) {
+  auto* statement = static_cast<sqlite3_stmt*>(raw);
+  auto proxy = std::make_shared<PlugInProxy>();
+  proxy->uuid = columnUuid(statement, 0);
+  proxy->path = columnText(statement, 1).value_or("");
+  proxy->url = fileUrlForPath(proxy->path);
+  proxy->identifier = columnText(statement, 2).value_or("");
+  proxy->originalIdentifier = columnText(statement, 3).value_or(proxy->identifier);
+  proxy->bundleVersion = columnText(statement, 4);
+  proxy->containingAppPath = columnText(statement, 5);
+  proxy->extensionPoint = columnText(statement, 6);
+  proxy->info = columnDictionary(statement, 7);
+  proxy->sdk = columnDictionary(statement, 8);
+  proxy->entitlements = columnDictionary(statement, 9);
+  proxy->registrationDate = Date{sqlite3_column_double(statement, 10)};
+  proxy->dataContainerPath = columnText(statement, 11);
+  Dictionary strings = columnDictionary(statement, 12);
+  std::vector<std::string> languages = languageCandidates(languageLocked());
+  proxy->localizedName = localizedName(proxy->info, strings, languages);
+  proxy->localizedShortName = localized(proxy->info, strings, languages, {kBundleNameKey});
+  const std::string& root = options_.systemRoot;
+  proxy->onSystemVolume = proxy->path.size() > root.size() &&
+                          proxy->path.compare(0, root.size(), root) == 0 &&
+                          proxy->path[root.size()] == '/';
+  if (proxy->containingAppPath) {
+    Use app(statements_->appByPath);
+    app.text(1, *proxy->containingAppPath);
+    if (app.step() == SQLITE_ROW) {
+      proxy->containingAppName =
+          localizedName(columnDictionary(app.get(), 3), columnDictionary(app.get(), 4), languages);
+    }
+  }
+  return proxy;
+}
+
+std::vector<PlugInProxyPtr> SqliteRegistry::readAllLocked(void* raw) {
+  auto* statement = static_cast<sqlite3_stmt*>(raw);
+  std::vector<PlugInProxyPtr> proxies;
+  while (sqlite3_step(statement) == SQLITE_ROW) proxies.push_back(readPlugInLocked(statement));
+  return proxies;
+}
+
+PlugInProxyPtr SqliteRegistry::plugInByUuid(const Uuid& uuid) {
+  checkLocale();
+  std::lock_guard db(dbMutex_);
+  Use find(statements_->plugInByUuid);
+  find.uuid(1, uuid);
+  return find.step() == SQLITE_ROW ? readPlugInLocked(find.get()) : nullptr;
+}
+
+PlugInProxyPtr SqliteRegistry::plugInByUrl(std::string_view urlOrPath) {
+  auto path = pathFromUrlOrPath(urlOrPath);
+  if (!path) return nullptr;
+  checkLocale();
+  std::lock_guard db(dbMutex_);
+  Use find(statements_->plugInByPath);
+  find.text(1, *path);
+  return find.step() == SQLITE_ROW ? readPlugInLocked(find.get()) : nullptr;
+}
+
+std::vector<PlugInProxyPtr> SqliteRegistry::plugInsOfApplication(std::string_view appPath) {
+  auto path = pathFromUrlOrPath(appPath);
+  if (!path) return {};
+  checkLocale();
+  std::lock_guard db(dbMutex_);
+  Use list(statements_->plugInsOfApp);
+  list.text(1, *path);
+  return readAllLocked(list.get());
+}
+
+std::vector<PlugInProxyPtr> SqliteRegistry::installedPlugIns() {
+  checkLocale();
+  std::lock_guard db(dbMutex_);
+  Use list(statements_->allPlugIns);
+  return readAllLocked(list.get());
+}
+
+namespace {
+
+ApplicationProxyPtr readApplication(sqlite3_stmt* statement, sqlite3_stmt* uuids,
+                                    const std::vector<std::string>& languages) {
+  auto proxy = std::make_shared<ApplicationProxy>();
+  proxy->path = columnText(statement, 0).value_or("");
+  proxy->url = fileUrlForPath(proxy->path);
+  proxy->identifier = columnText(statement, 1).value_or("");
+  proxy->bundleVersion = columnText(statement, 2);
+  proxy->info = columnDictionary(statement, 3);
+  proxy->name = localizedName(proxy->info, columnDictionary(statement, 4), languages);
+  proxy->registrationDate = Date{sqlite3_column_double(statement, 5)};
+  Use list(uuids);
+  list.text(1, proxy->path);
+  while (list.step() == SQLITE_ROW) proxy->plugInUuids.push_back(columnUuid(uuids, 0));
+  return proxy;
+}
+
+}  // namespace
+
+ApplicationProxyPtr SqliteRegistry::applicationByPath(std::string_view urlOrPath) {
+  auto path = pathFromUrlOrPath(urlOrPath);
+  if (!path) return nullptr;
+  checkLocale();
+  std::lock_guard db(dbMutex_);
+  Use find(statements_->appByPath);
+  find.text(1, *path);
+  if (find.step() != SQLITE_ROW) return nullptr;
+  return readApplication(find.get(), statements_->plugInUuidsOfApp,
+                         languageCandidates(languageLocked()));
+}
+
+ApplicationProxyPtr SqliteRegistry::applicationByIdentifier(std::string_view identifier) {
+  checkLocale();
+  std::lock_guard db(dbMutex_);
+  Use find(statements_->appByIdentifier);
+  find.text(1, identifier);
+  if (find.step() != SQLITE_ROW) return nullptr;
+  return readApplication(find.get(), statements_->plugInUuidsOfApp,
+                         languageCandidates(languageLocked()));
+}
+
+std::vector<PlugInProxyPtr> SqliteRegistry::query(const Dictionary& rules,
+                                                  const PlugInFilter& filter) {
+  checkLocale();
+  std::vector<PlugInProxyPtr> candidates;
+  {
+    std::lock_guard db(dbMutex_);
+    auto points = indexedExtensionPoints(rules);
+    if (!points) {
+      Use list(statements_->allPlugIns);
+      candidates = readAllLocked(list.get());
+    } else {
+      std::set<std::string> keys;
+      for (const std::string& point : *points) keys.insert(extensionPointIndexKey(point));
+      std::set<Uuid> seen;
+      for (const std::string& key : keys) {
+        Use list(statements_->plugInsOfPoint);
+        list.text(1, key);
+        for (PlugInProxyPtr& proxy : readAllLocked(list.get())) {
+          if (seen.insert(proxy->uuid).second) candidates.push_back(std::move(proxy));
+        }
+      }
+    }
+  }
+  if (!filter) return candidates;
+  std::vector<PlugInProxyPtr> accepted;
+  for (PlugInProxyPtr& candidate : candidates) {
+    if (filter(*candidate)) accepted.push_back(std::move(candidate));
+  }
+  return accepted;
+}
+
+std::optional<Dictionary> SqliteRegistry::extensionPointSdk(std::string_view identifier) {
+  std::lock_guard db(dbMutex_);
+  Use find(statements_->sdkOf);
+  find.text(1, identifier);
+  if (find.step() != SQLITE_ROW) return std::nullopt;
+  return columnDictionary(find.get(), 0);
+}
+
+Dictionary SqliteRegistry::localizedStrings(const Uuid& plugIn, std::string_view table,
+                                            const std::vector<std::string>& keys) {
+  Dictionary result;
+  if (!checkPlugInIdentifier(table).ok()) return result;
+  PlugInProxyPtr proxy = plugInByUuid(plugIn);
+  if (!proxy) return result;
+  std::string language;
+  {
+    std::lock_guard db(dbMutex_);
+    language = languageLocked();
+  }
+  for (const std::string& candidate : languageCandidates(language)) {
+    std::string file = fmt::format("{}/{}.lproj/{}.strings", proxy->path, candidate, table);
+    auto value = dmap::readFile(file);
+    if (!value.ok() || value->dictionary() == nullptr) continue;
+    for (const std::string& key : keys) {
+      if (result.contains(key)) continue;
+      if (const Value* text = value->get(key)) result.emplace(key, *text);
+    }
+  }
+  return result;
+}
+
+Uuid SqliteRegistry::knowledgeUuid() {
+  std::lock_guard db(dbMutex_);
+  return knowledge_;
+}
+
+void SqliteRegistry::clearCaches() {
+  // Proxies are built fresh from the database on every lookup; the only state worth
+  // refreshing is the language.
+  checkLocale();
+}
+
+// ---------------------------------------------------------------------------------------------
+// Locale
+
+std::string SqliteRegistry::languageLocked() {
+  {
+    std::lock_guard lock(localeMutex_);
+    if (fileLanguage_) return *fileLanguage_;
+  }
+  return environmentLanguage();
+}
+
+void SqliteRegistry::checkLocale() {
+  std::string file = paths::join(options_.stateDir, "locale");
+  struct stat st {};
+  bool exists = ::stat(file.c_str(), &st) == 0;
+  bool changed = false;
+  {
+    std::lock_guard lock(localeMutex_);
+    bool same = localeSeen_ && exists == localeExists_ &&
+                (!exists || (st.st_ino == localeStat_.st_ino && st.st_dev == localeStat_.st_dev &&
+                             st.st_size == localeStat_.st_size &&
+                             st.st_mtim.tv_sec == localeStat_.st_mtim.tv_sec &&
+                             st.st_mtim.tv_nsec == localeStat_.st_mtim.tv_nsec));
+    if (same) return;
+    changed = localeSeen_;
+    localeSeen_ = true;
+    localeExists_ = exists;
+    localeStat_ = st;
+    fileLanguage_ = exists ? readLocaleFile(file) : std::nullopt;
+  }
+  if (changed) {
+    log::vr().defaultLevel("locale file %s changed", file);
+    deliverLocaleChange();
+  }
+}
+
+// ---------------------------------------------------------------------------------------------
+// Observers
+
+void SqliteRegistry::addObserver(std::weak_ptr<RegistryObserver> observer) {
+  std::lock_guard lock(observersMutex_);
+  observers_.push_back(std::move(observer));
+}
+
+void SqliteRegistry::removeObserver(const std::shared_ptr<RegistryObserver>& observer) {
+  std::lock_guard lock(observersMutex_);
+  std::erase_if(observers_, [&](const std::weak_ptr<RegistryObserver>& weak) {
+    auto strong = weak.lock();
+    return !strong || strong == observer;
+  });
+}
+
+std::vector<std::shared_ptr<RegistryObserver>> SqliteRegistry::liveObservers() {
+  std::lock_guard lock(observersMutex_);
+  std::vector<std::shared_ptr<RegistryObserver>> live;
+  std::erase_if(observers_, [&](const std::weak_ptr<RegistryObserver>& weak) {
+    auto strong = weak.lock();
+    if (!strong) return true;
+    live.push_back(std::move(strong));
+    return false;
+  });
+  return live;
+}
+
+void SqliteRegistry::deliverInstall(std::vector<PlugInProxyPtr> plugIns) {
+  if (plugIns.empty()) return;
+  auto observers = liveObservers();
+  if (observers.empty()) return;
+  options_.queue->async([observers = std::move(observers), plugIns = std::move(plugIns)] {
+    for (const auto& observer : observers) observer->plugInsDidInstall(plugIns);
+  });
+}
+
+void SqliteRegistry::deliverUninstall(const std::vector<PlugInProxyPtr>& plugIns) {
+  if (plugIns.empty()) return;
+  auto observers = liveObservers();
+  if (observers.empty()) return;
+  auto deliver = [&] {
+    for (const auto& observer : observers) observer->plugInsWillUninstall(plugIns);
+  };
+  if (options_.queue->isCurrent()) {
+    deliver();
+  } else {
+    options_.queue->sync(deliver);
+  }
+}
+
+void SqliteRegistry::deliverLocaleChange() {
+  auto observers = liveObservers();
+  if (observers.empty()) return;
+  options_.queue->async([observers = std::move(observers)] {
+    for (const auto& observer : observers) observer->localeDidChange();
+  });
+}
+
+}  // namespace ek::vantor

@@ -1,0 +1,121 @@
+#pragma once
+
+#include <sys/stat.h>
+
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/codesign/CodeSigning.h"
+#include "platform/queue/SerialQueue.h"
+#include "platform/vantor/Registry.h"
+
+struct sqlite3;
+
+namespace ek::vantor {
+
+// The registry kept in one SQLite database, $EKORA_STATE_DIR/registry.db.
+//
+// The daemon owns the file: it is opened in WAL mode with exclusive locking, so no second
+// process (nor a second SqliteRegistry in this one) can open it while the daemon runs, and
+// outside tools (sqlite3 on the command line) cannot read it then either. In exchange every
+// statement is prepared once and kept, reads never take file locks, the WAL index lives in
+// the process's memory instead of a -shm file, and the page cache is sized (32 MiB) to hold
+// a registry of tens of thousands of plug-ins, so lookups do not touch the file at all.
+//
+// Opening checks the file (quick_check and the schema version); one that is not a database,
+// fails the check or carries another schema version is renamed aside to
+// registry.db.corrupt-<UTC timestamp> (with its -wal and -shm) and a fresh registry is built.
+// Then the start-up scan runs (see reconcile).
+class SqliteRegistry : public Registry {
+ public:
+  struct Options {
+    std::string databasePath;                  // default: <stateDir>/registry.db
+    std::string stateDir;                      // default: ek::paths::stateDir()
+    std::string systemRoot;                    // default: ek::paths::systemRoot()
+    std::shared_ptr<CodeSigning> codeSigning;  // default: CodeSigning::system()
+    std::shared_ptr<SerialQueue> queue;        // default: a new queue "com.corvane.vantor"
+    // Told about everything the start-up scan installs and uninstalls.
+    std::vector<std::weak_ptr<RegistryObserver>> observers;
+    bool scanOnOpen = true;
+  };
+
+  static Result<std::shared_ptr<SqliteRegistry>> open(Options options);
+  ~SqliteRegistry() override;
+  SqliteRegistry(const SqliteRegistry&) = delete;
+  SqliteRegistry& operator=(const SqliteRegistry&) = delete;
+
+  Result<void> registerBundle(const std::string& path) override;
+  Result<void> unregisterBundle(const std::string& path) override;
+  PlugInProxyPtr plugInByUuid(const Uuid& uuid) override;
+  PlugInProxyPtr plugInByUrl(std::string_view urlOrPath) override;
+  std::vector<PlugInProxyPtr> plugInsOfApplication(std::string_view appPath) override;
+  std::vector<PlugInProxyPtr> installedPlugIns() override;
+  ApplicationProxyPtr applicationByPath(std::string_view urlOrPath) override;
+  ApplicationProxyPtr applicationByIdentifier(std::string_view identifier) override;
+  std::vector<PlugInProxyPtr> query(const Dictionary& rules, const PlugInFilter& filter) override;
+  std::optional<Dictionary> extensionPointSdk(std::string_view identifier) override;
+  Dictionary localizedStrings(const Uuid& plugIn, std::string_view table,
+                              const std::vector<std::string>& keys) override;
+  Uuid knowledgeUuid() override;
+  void clearCaches() override;
+  void addObserver(std::weak_ptr<RegistryObserver> observer) override;
+  void removeObserver(const std::shared_ptr<RegistryObserver>& observer) override;
+
+  // The start-up scan: registers every bundle under <systemRoot>/Library/PlugIns/ and
+  // unregisters every plug-in and application whose bundle directory no longer exists.
+  // A bundle that fails to register is logged and skipped.
+  void reconcile();
+
+  // Compares the locale file with what was seen last and, when it changed, raises the
+  // locale-change notice. Lookups do this on their own; exposed for callers that poll.
+  void checkLocale();
+
+  const std::string& databasePath() const { return options_.databasePath; }
+  const std::shared_ptr<SerialQueue>& queue() const { return options_.queue; }
+
+  struct Statements;
+  struct Plan;
+
+ private:
+  explicit SqliteRegistry(Options options);
+  Result<void> openDatabase();
+  Result<void> prepareSchema();
+  void closeDatabase();
+
+  // Under changeMutex_.
+  Result<void> applyPlan(Plan& plan);
+  Result<void> unregisterLocked(const std::string& path);
+
+  // Under dbMutex_. The language is the one checkLocale last saw.
+  PlugInProxyPtr readPlugInLocked(void* statement);
+  std::vector<PlugInProxyPtr> readAllLocked(void* statement);
+  std::string languageLocked();
+
+  void deliverInstall(std::vector<PlugInProxyPtr> plugIns);
+  void deliverUninstall(const std::vector<PlugInProxyPtr>& plugIns);
+  void deliverLocaleChange();
+  std::vector<std::shared_ptr<RegistryObserver>> liveObservers();
+
+  Options options_;
+  // Serialises changes (register, unregister, the start-up scan), held across the uninstall
+  // notice so that what the notice announces is what gets deleted.
+  std::mutex changeMutex_;
+  // Guards the connection and its statements.
+  std::mutex dbMutex_;
+  sqlite3* db_ = nullptr;
+  std::unique_ptr<Statements> statements_;
+  Uuid knowledge_;  // REQUIRES dbMutex_
+
+  std::mutex observersMutex_;
+  std::vector<std::weak_ptr<RegistryObserver>> observers_;
+
+  std::mutex localeMutex_;
+  bool localeSeen_ = false;
+  struct stat localeStat_ {};
+  bool localeExists_ = false;
+  std::optional<std::string> fileLanguage_;  // the locale file's language as last seen
+};
+
+}  // namespace ek::vantor
