@@ -2,6 +2,7 @@
 
 #include "ekd/EkDWyreClient.h"
 #include "platform/log/Log.h"
+#include "platform/vantor/SqliteRegistry.h"
 
 namespace ek {
 namespace {
@@ -21,6 +22,16 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
   auto server = std::shared_ptr<EkDServer>(new EkDServer());
   server->databasePath_ = std::move(database);
   server->platform_ = std::move(platform);
+  if (!server->platform_.registry) {
+    vantor::SqliteRegistry::Options options;
+    options.codeSigning = server->platform_.codeSigning;
+    auto registry = vantor::SqliteRegistry::open(std::move(options));
+    if (!registry) {
+      log::vr().error("unable to open the registry: %{public}@", registry.error());
+      return nullptr;
+    }
+    server->platform_.registry = std::move(registry).value();
+  }
   server->wyreQueue_ = SerialQueue::make("wyre");
   // Requests run on the thread that reads the sockets: a request then reaches its handler
   // without waking another thread, and handlers run one at a time all the same.

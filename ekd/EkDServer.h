@@ -10,6 +10,7 @@
 #include "platform/codesign/CodeSigning.h"
 #include "platform/queue/SerialQueue.h"
 #include "platform/sandbox/SandboxCheck.h"
+#include "platform/vantor/Registry.h"
 #include "platform/wyre/Wyre.h"
 
 namespace ek {
@@ -20,6 +21,9 @@ class EkDWyreClient;
 struct EkDPlatform {
   std::shared_ptr<CodeSigning> codeSigning;
   std::shared_ptr<SandboxCheck> sandbox;
+  // The application registry; when none is given the server opens the one in the state
+  // directory, which also registers the system plug-ins.
+  std::shared_ptr<vantor::Registry> registry;
 
   static EkDPlatform system();
 };
@@ -51,6 +55,7 @@ class EkDServer : public std::enable_shared_from_this<EkDServer> {
   const std::optional<std::string>& databasePath() const { return databasePath_; }
 
   const EkDPlatform& platform() const { return platform_; }
+  const std::shared_ptr<vantor::Registry>& registry() const { return platform_.registry; }
   const std::shared_ptr<SerialQueue>& mainQueue() const { return mainQueue_; }
   const std::shared_ptr<SerialQueue>& syncQueue() const { return syncQueue_; }
   const std::shared_ptr<wyre::Listener>& service() const { return service_; }

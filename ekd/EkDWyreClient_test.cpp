@@ -13,6 +13,7 @@
 
 #include "ekd/EkDServer.h"
 #include "platform/log/Log.h"
+#include "platform/vantor/FakeRegistry.h"
 
 namespace ek {
 namespace {
@@ -60,7 +61,8 @@ class EkDWyreClientTest : public ::testing::Test {
                                                        {"string", "x"},
                                                        {"array", Array{}}});
     sandbox_->setSandboxed(getpid(), true);
-    server_ = EkDServer::initForService("unit", std::nullopt, {codeSigning_, sandbox_});
+    server_ = EkDServer::initForService(
+        "unit", std::nullopt, {codeSigning_, sandbox_, std::make_shared<vantor::FakeRegistry>()});
     ASSERT_TRUE(server_);
 
     int fds[2];
