@@ -112,6 +112,8 @@ void SerialQueue::drain() {
 }
 
 void SerialQueue::sync(const std::function<void()>& block) {
+  // The block may drop the caller's last reference; the queue must outlive this call.
+  auto self = shared_from_this();
   if (isCurrent()) {
     std::fprintf(stderr, "SerialQueue::sync: re-entered queue \"%s\"\n", label_.c_str());
     std::abort();

@@ -47,15 +47,15 @@ uint32_t getU32(const uint8_t* p) {
 
 asio::io_context& ioContext() {
   // Never destroyed: sockets may still be served while the process exits.
-  static asio::io_context* context = [] {
-    auto* io = new asio::io_context(2);
+  static asio::io_context* context = new asio::io_context(2);
+  static auto* work = [] {
     auto* guard =
-        new asio::executor_work_guard<asio::io_context::executor_type>(io->get_executor());
-    (void)guard;
-    std::thread([io] { io->run(); }).detach();
-    std::thread([io] { io->run(); }).detach();
-    return io;
+        new asio::executor_work_guard<asio::io_context::executor_type>(context->get_executor());
+    std::thread([] { context->run(); }).detach();
+    std::thread([] { context->run(); }).detach();
+    return guard;
   }();
+  (void)work;
   return *context;
 }
 
