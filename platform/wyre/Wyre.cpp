@@ -308,7 +308,8 @@ void Connection::enqueueOutput(std::vector<uint8_t> frame, bool answersRequest) 
     }
   }
   if (failNow) {
-    cancel();
+    // Posted, never run inline: the sender may be inside this connection's event handler.
+    asio::post(strand_, [self = shared_from_this()] { self->fail(); });
   } else if (startWriter) {
     asio::post(strand_, [self = shared_from_this()] { self->writeMore(); });
   }

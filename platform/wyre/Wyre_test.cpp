@@ -52,14 +52,15 @@ class WyreLoopback : public ::testing::Test {
     ASSERT_TRUE(listener.ok()) << listener.error().message;
     listener_ = listener.value();
     // Echoes every request's body back as its reply.
-    listener_->setEventHandler([this](const ListenerEvent& event) {
+    listener_->setEventHandler([invalidated_ = invalidated_](const ListenerEvent& event) {
       if (!event.connection) return;
       auto connection = event.connection;
       std::weak_ptr<Connection> weak = connection;
-      connection->setEventHandler([this, weak](const Event& e) {
+      // Server-side connections may outlive the fixture: capture nothing of it.
+      connection->setEventHandler([invalidated = invalidated_, weak](const Event& e) {
         auto self = weak.lock();
         if (e.isConnectionInvalid()) {
-          ++invalidated_;
+          ++*invalidated;
           return;
         }
         if (self && e.type == EventType::Message) self->reply(e.message, e.message.body);
@@ -76,7 +77,7 @@ class WyreLoopback : public ::testing::Test {
   std::string dir_;
   std::shared_ptr<SerialQueue> queue_;
   std::shared_ptr<Listener> listener_;
-  std::atomic<int> invalidated_{0};
+  std::shared_ptr<std::atomic<int>> invalidated_ = std::make_shared<std::atomic<int>>(0);
 };
 
 TEST_F(WyreLoopback, RepliesReachTheirHandlersInOrder) {
