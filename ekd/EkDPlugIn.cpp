@@ -1,0 +1,418 @@
+#include "ekd/EkDPlugIn.h"
+
+#include <cerrno>
+#include <cmath>
+#include <filesystem>
+#include <limits>
+#include <set>
+#include <stdexcept>
+#include <system_error>
+#include <vector>
+
+#include "Ekora/EkPlugInKeys.h"
+#include "Ekora/EkProtocol.h"
+#include "Ekora/EkSandboxExtension.h"
+#include "platform/log/Log.h"
+#include "platform/paths/Directories.h"
+
+namespace ek {
+
+namespace pk = plugin;
+
+namespace {
+
+constexpr std::string_view kFileProviderActions = "ZuExtensionFileProviderActions";
+constexpr std::string_view kFileProviderActionName = "ZuExtensionFileProviderActionName";
+constexpr std::string_view kLocalizableTable = "Localizable";
+constexpr std::string_view kBundleItself = ".";
+
+constexpr std::string_view kNoDataContainerMessage = "this plug-in has no sandbox data container";
+constexpr std::string_view kOutsideSystemMessage =
+    "plug-ins outside containing apps must be in /System";
+
+constexpr std::string_view kLogMisconfigured = "ignoring mis-configured plug-in at %@: %{public}@";
+constexpr std::string_view kLogNoFreshProxy = "could not obtain fresh proxy for %@";
+constexpr std::string_view kLogProxyFallback =
+    "Failed to find Plugin by %{uuid_t}.16P fallback to path %@";
+constexpr std::string_view kLogMissingActionName =
+    "missing ZuExtensionFileProviderActionName for plugin %@";
+constexpr std::string_view kLogResourceExtensionFailed =
+    "failed to make extension for %@ in plug-in at %@: %{public}s";
+constexpr std::string_view kLogServiceExtensionFailed =
+    "failed to make service extension for %@ in plug-in at %@: %{public}s";
+
+// The member under key, sharing ownership of the whole dictionary.
+ValueRef member(const DictionaryRef& dictionary, std::string_view key) {
+  if (!dictionary) return nullptr;
+  auto it = dictionary->find(key);
+  if (it == dictionary->end()) return nullptr;
+  return ValueRef(dictionary, &it->second);
+}
+
+// The member under key when it is a dictionary, sharing ownership of the whole.
+DictionaryRef dictionaryMember(const DictionaryRef& dictionary, std::string_view key) {
+  ValueRef value = member(dictionary, key);
+  if (!value || value->dictionary() == nullptr) return nullptr;
+  return DictionaryRef(value, value->dictionary());
+}
+
+std::string logText(const Value* value) {
+  if (value == nullptr) return "(null)";
+  if (const std::string* text = value->string()) return *text;
+  return value->description();
+}
+
+// The system's own text for an error: strerror for operating-system errors.
+std::string systemErrorText(const EkError& error) {
+  if (error.domain == kPosixErrorDomain) return std::generic_category().message(error.code);
+  return error.message;
+}
+
+EkError invalidDefinition(std::string_view message) {
+  return EkError::ekora(pk::kCodeInvalidDefinition, std::string(message));
+}
+
+// Whole seconds since 1970, the fraction dropped; dates beyond the 32-bit range stick to its
+// ends rather than wrap.
+int32_t secondsSince1970(const Date& date) {
+  const double seconds = std::trunc(date.seconds);
+  if (std::isnan(seconds)) return 0;
+  if (seconds <= static_cast<double>(std::numeric_limits<int32_t>::min())) {
+    return std::numeric_limits<int32_t>::min();
+  }
+  if (seconds >= static_cast<double>(std::numeric_limits<int32_t>::max())) {
+    return std::numeric_limits<int32_t>::max();
+  }
+  return static_cast<int32_t>(seconds);
+}
+
+std::optional<EkFileURL> urlOfPath(const std::optional<std::string>& path) {
+  if (!path || path->empty()) return std::nullopt;
+  Result<EkFileURL> url = EkFileURL::fromPath(*path);
+  if (!url) return std::nullopt;
+  return std::move(url).value();
+}
+
+// Path lies strictly below root, judged on the text alone: a path with "." or ".."
+// components is never below anything.
+bool isBelow(std::string_view path, std::string_view root) {
+  while (root.size() > 1 && root.ends_with('/')) root.remove_suffix(1);
+  if (root == "/") root = "";
+  if (!path.starts_with(root) || path.size() <= root.size() + 1 || path[root.size()] != '/') {
+    return false;
+  }
+  std::string_view rest = path.substr(root.size() + 1);
+  while (!rest.empty()) {
+    const size_t slash = rest.find('/');
+    const std::string_view component = rest.substr(0, slash);
+    if (component == "." || component == "..") return false;
+    if (slash == std::string_view::npos) break;
+    rest.remove_prefix(slash + 1);
+  }
+  return true;
+}
+
+// The location a path resolves to, links followed; the errno of the failure otherwise.
+Result<std::string> canonicalPath(const std::string& path) {
+  std::error_code error;
+  std::filesystem::path resolved = std::filesystem::canonical(path, error);
+  if (error) return EkError::posix(error.value(), path);
+  return resolved.string();
+}
+
+bool isWithin(const std::string& path, const std::string& directory) {
+  if (path == directory) return true;
+  if (directory == "/") return true;
+  return path.size() > directory.size() && path.starts_with(directory) &&
+         path[directory.size()] == '/';
+}
+
+}  // namespace
+
+// ---- Construction ---------------------------------------------------------------------------
+
+EkDPlugIn::EkDPlugIn(EkDPlugInContext context) : context_(std::move(context)) {
+  if (!context_.registry) throw std::logic_error("EkDPlugIn needs a registry");
+}
+
+std::shared_ptr<EkDPlugIn> EkDPlugIn::createWithVRData(const vantor::PlugInProxy& proxy,
+                                                       EkDPlugInContext context) {
+  std::shared_ptr<EkDPlugIn> record(new EkDPlugIn(std::move(context)));
+  if (!record->initWithVRData(proxy)) return nullptr;
+  return record;
+}
+
+bool EkDPlugIn::initWithVRData(const vantor::PlugInProxy& proxy) {
+  std::optional<EkFileURL> url;
+  if (!proxy.url.empty()) {
+    Result<EkFileURL> parsed = EkFileURL::parse(proxy.url);
+    if (parsed) url = std::move(parsed).value();
+  }
+  if (!url) url = urlOfPath(proxy.path);
+  if (!url) return false;
+
+  std::optional<std::string> identifier;
+  if (!proxy.identifier.empty()) identifier = proxy.identifier;
+  if (!initWithName(std::move(identifier), url, nullptr, proxy.extensionDictionary(), proxy.uuid)) {
+    return false;
+  }
+
+  setLastModified(secondsSince1970(proxy.registrationDate));
+  setOnSystemVolume(proxy.onSystemVolume);
+  setLocalizedName(proxy.localizedName);
+  setLocalizedShortName(proxy.localizedShortName);
+  setLocalizedContainingName(proxy.containingAppName);
+  setLocalizedFileProviderActionNames(
+      std::make_shared<const Dictionary>(localizedFileProviderActionNamesForEkDict(
+          proxy, proxy.extensionDictionary(), *context_.registry)));
+  setOriginalIdentifier(proxy.originalIdentifier);
+  setEntitlements(std::make_shared<const Dictionary>(proxy.entitlements));
+  setDataContainerURL(urlOfPath(proxy.dataContainerPath));
+  {
+    std::lock_guard lock(infoMutex_);
+    infoDmap_ = std::make_shared<const Dictionary>(proxy.info);
+  }
+
+  std::optional<uint32_t> hubProtocolVersion;
+  if (DictionaryRef plugIn = plugInDictionary()) {
+    auto it = plugIn->find(pk::kHubProtocolVersion);
+    if (it != plugIn->end()) {
+      const uint64_t* number = it->second.unsignedNumber();
+      if (number != nullptr && *number <= std::numeric_limits<uint32_t>::max()) {
+        hubProtocolVersion = static_cast<uint32_t>(*number);
+      }
+    }
+  }
+  if (!hubProtocolVersion) {
+    hubProtocolVersion = proxy.info.contains(pk::kInfoOldStyleMarker) ? 1 : 2;
+  }
+  setHubProtocolVersion(*hubProtocolVersion);
+
+  setContainingUrl(urlOfPath(proxy.containingAppPath));
+
+  if (std::optional<EkError> error = diagnose()) {
+    log::ops().info(kLogMisconfigured, url->path(), error->description());
+    return false;
+  }
+  return true;
+}
+
+// ---- Registry --------------------------------------------------------------------------------
+
+vantor::PlugInProxyPtr EkDPlugIn::getProxy() const {
+  const Uuid id = uuid();
+  if (vantor::PlugInProxyPtr proxy = context_.registry->plugInByUuid(id)) return proxy;
+  std::optional<EkFileURL> location = url();
+  log::vr().defaultLevel(kLogProxyFallback, id, location ? location->string() : "(null)");
+  if (!location) return nullptr;
+  return context_.registry->plugInByUrl(location->string());
+}
+
+DictionaryRef EkDPlugIn::bundleInfoDictionary() const {
+  const Uuid knowledge = context_.registry->knowledgeUuid();
+  {
+    std::lock_guard lock(infoMutex_);
+    if (vrKnowledgeUUID_ == knowledge) return infoDmap_;
+  }
+  std::lock_guard refresh(refreshMutex_);
+  vantor::PlugInProxyPtr proxy = getProxy();
+  DictionaryRef info;
+  if (proxy) {
+    info = std::make_shared<const Dictionary>(proxy->info);
+  } else {
+    log::ops().error(kLogNoFreshProxy, uuid());
+  }
+  std::lock_guard lock(infoMutex_);
+  infoDmap_ = info;
+  vrKnowledgeUUID_ = knowledge;
+  return info;
+}
+
+DictionaryRef EkDPlugIn::infoDmap() const {
+  std::lock_guard lock(infoMutex_);
+  return infoDmap_;
+}
+
+std::optional<Uuid> EkDPlugIn::vrKnowledgeUUID() const {
+  std::lock_guard lock(infoMutex_);
+  return vrKnowledgeUUID_;
+}
+
+DictionaryRef EkDPlugIn::currentPlugInDictionary() const {
+  return dictionaryMember(bundleInfoDictionary(), pk::kInfoPlugInDictionary);
+}
+
+ValueRef EkDPlugIn::infoKey(std::string_view key) const {
+  ValueRef value = member(bundleInfoDictionary(), key);
+  log::vr().debug(pk::kLogInfoKey, "infoKey", key, logText(value.get()));
+  return value;
+}
+
+ValueRef EkDPlugIn::pluginKey(std::string_view key) const {
+  return member(currentPlugInDictionary(), key);
+}
+
+ValueRef EkDPlugIn::attribute(std::string_view key) const {
+  return member(dictionaryMember(currentPlugInDictionary(), pk::kAttributes), key);
+}
+
+std::optional<Dictionary> EkDPlugIn::readSDKDictionary(std::string_view extensionPoint) const {
+  std::optional<Dictionary> sdk = context_.registry->extensionPointSdk(extensionPoint);
+  if (!sdk) log::ops().defaultLevel(pk::kLogSdkNotRegistered, extensionPoint);
+  return sdk;
+}
+
+// ---- Entitlements ----------------------------------------------------------------------------
+
+ValueRef EkDPlugIn::valueForEntitlement(std::string_view key) const {
+  return member(entitlements(), key);
+}
+
+bool EkDPlugIn::hasEntitlement(std::string_view key) const {
+  ValueRef value = valueForEntitlement(key);
+  if (!value) return false;
+  const bool* flag = value->boolean();
+  return flag == nullptr || *flag;
+}
+
+std::string EkDPlugIn::annotationKey() const {
+  ValueRef replaced = valueForEntitlement(protocol::kEntitlementReplacePlugIn);
+  if (replaced && replaced->string() != nullptr) return *replaced->string();
+  return identifier().value_or(std::string());
+}
+
+// ---- Validation ------------------------------------------------------------------------------
+
+std::optional<EkError> EkDPlugIn::diagnose() const {
+  if (std::optional<EkError> error = EkPlugInCore::diagnose()) return error;
+  if (!isData() && !dataContainerURL()) return invalidDefinition(kNoDataContainerMessage);
+  if (!containingUrl()) {
+    const std::string root =
+        context_.systemRoot.empty() ? paths::systemRoot() : context_.systemRoot;
+    std::optional<std::string> location = path();
+    if (!location || !isBelow(*location, root)) return invalidDefinition(kOutsideSystemMessage);
+  }
+  return std::nullopt;
+}
+
+// ---- Sandbox extensions ----------------------------------------------------------------------
+
+EkSandbox& EkDPlugIn::sandbox() const {
+  return context_.sandbox ? *context_.sandbox : *EkSandbox::system();
+}
+
+void EkDPlugIn::augmentForm(Dictionary& form) const {
+  std::optional<Value> shared;
+  if (isAppExtension()) {
+    // An application extension's host reads the whole bundle, nothing beside it.
+    shared = Array{Value(kBundleItself)};
+  } else if (ValueRef declared = pluginKey(pk::kShared)) {
+    shared = *declared;
+  }
+  if (shared) {
+    if (std::optional<Dictionary> extensions = issueResourceExtensions(*shared)) {
+      form.insert_or_assign(std::string(pk::form::kExtensions), std::move(*extensions));
+    }
+  }
+
+  if (isData()) return;
+  ValueRef bundleIdentifier = infoKey(pk::kInfoBundleIdentifier);
+  const std::string* service = bundleIdentifier ? bundleIdentifier->string() : nullptr;
+  Result<std::string> token =
+      issueServiceExtension(service ? std::string_view(*service) : std::string_view(), sandbox());
+  if (token) {
+    form.insert_or_assign(std::string(pk::form::kServiceExtension), std::move(token).value());
+  } else {
+    log::ops().info(kLogServiceExtensionFailed, logText(bundleIdentifier.get()),
+                    path().value_or("(null)"), systemErrorText(token.error()));
+  }
+}
+
+std::optional<Dictionary> EkDPlugIn::issueResourceExtensions(const Value& paths) const {
+  Array single;
+  const Array* elements = paths.array();
+  if (elements == nullptr) {
+    if (paths.string() == nullptr) return std::nullopt;
+    single.push_back(paths);
+    elements = &single;
+  }
+
+  Dictionary result;
+  const std::optional<EkFileURL> bundle = url();
+  if (!bundle) return result;
+  const std::string& bundlePath = bundle->path();
+  // Every target must resolve inside the bundle: "Shared" is the plug-in's to write, and a
+  // "../.." or a link out of the bundle must not hand a host the rest of the disk.
+  Result<std::string> canonicalBundle = canonicalPath(bundlePath);
+
+  for (const Value& element : *elements) {
+    const std::string* relative = element.string();
+    if (relative == nullptr) continue;
+    const std::string targetPath =
+        *relative == kBundleItself ? bundlePath : paths::join(bundlePath, *relative);
+    auto fail = [&](const EkError& error) {
+      log::ops().info(kLogResourceExtensionFailed, targetPath, bundlePath, systemErrorText(error));
+    };
+    if (!canonicalBundle) {
+      fail(canonicalBundle.error());
+      continue;
+    }
+    Result<std::string> canonicalTarget = canonicalPath(targetPath);
+    if (!canonicalTarget) {
+      fail(canonicalTarget.error());
+      continue;
+    }
+    if (!isWithin(*canonicalTarget, *canonicalBundle)) {
+      fail(EkError::posix(EPERM, targetPath));
+      continue;
+    }
+    Result<EkFileURL> target = EkFileURL::fromPath(*canonicalTarget);
+    if (!target) {
+      fail(EkError::posix(EINVAL, targetPath));
+      continue;
+    }
+    Result<std::string> token = issueFileExtension(*target, sandbox());
+    if (!token) {
+      fail(token.error());
+      continue;
+    }
+    result.insert_or_assign(*relative, std::move(token).value());
+  }
+  return result;
+}
+
+// ---- Localized file-provider action names --------------------------------------------------
+
+Dictionary localizedFileProviderActionNamesForEkDict(const vantor::PlugInProxy& proxy,
+                                                     const Dictionary* extensionDictionary,
+                                                     vantor::Registry& registry) {
+  Dictionary result;
+  if (extensionDictionary == nullptr) return result;
+  auto it = extensionDictionary->find(kFileProviderActions);
+  if (it == extensionDictionary->end() || it->second.array() == nullptr) return result;
+
+  std::set<std::string> names;
+  for (const Value& action : *it->second.array()) {
+    const std::string* name = action.getString(kFileProviderActionName);
+    if (name == nullptr) {
+      log::vr().error(kLogMissingActionName, proxy);
+      continue;
+    }
+    names.insert(*name);
+  }
+  if (names.empty()) return result;
+
+  const std::vector<std::string> keys(names.begin(), names.end());
+  const Dictionary localized = registry.localizedStrings(proxy.uuid, kLocalizableTable, keys);
+  for (const std::string& name : keys) {
+    auto entry = localized.find(name);
+    if (entry != localized.end() && entry->second.string() != nullptr) {
+      result.insert_or_assign(name, *entry->second.string());
+    } else {
+      result.insert_or_assign(name, name);
+    }
+  }
+  return result;
+}
+
+}  // namespace ek

@@ -1,0 +1,126 @@
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "Ekora/EkPlugInCore.h"
+#include "Ekora/EkSandbox.h"
+#include "platform/value/EkError.h"
+#include "platform/value/Uuid.h"
+#include "platform/value/Value.h"
+#include "platform/vantor/Registry.h"
+
+namespace ek {
+
+// What a daemon record needs from the daemon around it. The database that builds records hands
+// every record the same context.
+struct EkDPlugInContext {
+  // Where the record refreshes its info dictionary, its SDK and its localized strings from.
+  // Required.
+  std::shared_ptr<vantor::Registry> registry;
+  // Issues the extension tokens of augmentForm and issueResourceExtensions; null means the
+  // process's sandbox.
+  std::shared_ptr<EkSandbox> sandbox;
+  // The system volume: plug-ins outside any application must lie below it. Empty means
+  // $EKORA_SYSTEM_ROOT (else /System).
+  std::string systemRoot;
+};
+
+// The daemon's record of one installed plug-in, built from the registry's proxy. Beside the
+// base record it knows the registry's current info dictionary (re-read whenever the registry's
+// knowledge UUID changes), the plug-in's entitlements and data container, and which sandbox
+// extensions a host receives with the plug-in's form.
+//
+// Lookups (infoKey, pluginKey, attribute and everything derived from them: protocolSpec,
+// isData, isDedicated, version, ...) read the registry's current info dictionary, never the
+// plug-in dictionary stored at construction; exportForm's "info" still carries the latter.
+//
+// A record exists only for a proxy with a bundle URL whose definition passed diagnose.
+// Thread-safe once built.
+class EkDPlugIn : public EkPlugInCore {
+ public:
+  // A record for proxy, or nullptr when the proxy has no bundle URL (silently) or the
+  // plug-in is mis-configured (logged at info level in "ops").
+  static std::shared_ptr<EkDPlugIn> createWithVRData(const vantor::PlugInProxy& proxy,
+                                                     EkDPlugInContext context);
+
+  // A fresh proxy for this plug-in: by UUID, else (logged in "vr") by bundle URL.
+  vantor::PlugInProxyPtr getProxy() const;
+
+  // The registry's info dictionary for this plug-in, fetched again when the registry's
+  // knowledge UUID differs from the one of the last fetch. Absent after a failed fetch until
+  // the registry changes again.
+  DictionaryRef bundleInfoDictionary() const override;
+  ValueRef infoKey(std::string_view key) const override;
+  // The value inside the info dictionary's "ZuExtension".
+  ValueRef pluginKey(std::string_view key) const override;
+  // The value inside "ZuExtensionAttributes" of "ZuExtension".
+  ValueRef attribute(std::string_view key) const override;
+
+  // The database rebuilds a cached record that is no longer valid; a record never becomes
+  // invalid (its info dictionary follows the registry by itself).
+  bool isStillValid() const { return true; }
+
+  // The value of one of the plug-in's entitlements, or nullptr.
+  ValueRef valueForEntitlement(std::string_view key) const;
+  // Held: present and not boolean false.
+  bool hasEntitlement(std::string_view key) const;
+  // The key the plug-in's annotations are filed under: the identifier named by its
+  // "com.corvane.developer.replace-plugin" entitlement when that is a string, so a
+  // replacement shares the elections of the plug-in it replaces; otherwise its own identifier.
+  std::string annotationKey() const;
+
+  // The base checks, then: a plug-in with code needs a data container, and a plug-in outside
+  // any application must lie on the system volume. Code 12.
+  std::optional<EkError> diagnose() const override;
+  // The extension point's SDK dictionary as the registry recorded it.
+  std::optional<Dictionary> readSDKDictionary(std::string_view extensionPoint) const override;
+
+  // Adds to a form about to go to a host: "extensions" (read access to the shared resource
+  // paths; only the bundle itself for an application extension) and, for a plug-in with code,
+  // "service-extension" (the right to look up its service). Failures are logged and leave
+  // their entry out.
+  void augmentForm(Dictionary& form) const;
+  // Read-only file extensions for bundle-relative paths (a string, or an array whose strings
+  // are paths; "." is the bundle itself): path to token. A path that fails, or that resolves
+  // outside the bundle, is logged and left out. Absent only when paths is neither a string
+  // nor an array.
+  std::optional<Dictionary> issueResourceExtensions(const Value& paths) const;
+
+  // The info dictionary as last fetched, and the knowledge UUID of that fetch (absent before
+  // the first one). Neither refreshes.
+  DictionaryRef infoDmap() const;
+  std::optional<Uuid> vrKnowledgeUUID() const;
+
+  const EkDPlugInContext& context() const { return context_; }
+
+ private:
+  explicit EkDPlugIn(EkDPlugInContext context);
+
+  bool initWithVRData(const vantor::PlugInProxy& proxy);
+  EkSandbox& sandbox() const;
+  // The "ZuExtension" dictionary of the current info dictionary, sharing its ownership.
+  DictionaryRef currentPlugInDictionary() const;
+
+  const EkDPlugInContext context_;
+
+  // Serialises refreshes; the fields below have their own lock so readers never wait for a
+  // registry lookup.
+  mutable std::mutex refreshMutex_;
+  mutable std::mutex infoMutex_;
+  mutable DictionaryRef infoDmap_;
+  mutable std::optional<Uuid> vrKnowledgeUUID_;
+};
+
+// File-provider action names of an extension dictionary ("ZuExtensionFileProviderActions",
+// each element's "ZuExtensionFileProviderActionName"), each mapped to its localized title from
+// the plug-in's "Localizable" strings table, or to itself when the table has none. Elements
+// without a name are logged in "vr" and skipped. Always a dictionary.
+Dictionary localizedFileProviderActionNamesForEkDict(const vantor::PlugInProxy& proxy,
+                                                     const Dictionary* extensionDictionary,
+                                                     vantor::Registry& registry);
+
+}  // namespace ek
