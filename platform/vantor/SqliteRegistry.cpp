@@ -741,6 +741,25 @@ Result<void> SqliteRegistry::registerBundle(const std::string& rawPath) {
   return applyPlan(plan);
 }
 
+EkError SqliteRegistry::rollback(std::string_view what) {
+  EkError error = makeError(kDatabase, fmt::format("{}: {}", what, sqlite3_errmsg(db_)));
+  Use(statements_->rollback).step();
+  return error;
+}
+
+Result<void> SqliteRegistry::commitWithNewKnowledge() {
+  Statements& s = *statements_;
+  Uuid knowledge = Uuid::random();
+  {
+    Use meta(s.setMeta);
+    meta.text(1, "knowledge").uuid(2, knowledge);
+    if (meta.step() != SQLITE_DONE) return rollback("changing the knowledge UUID");
+  }
+  if (Use(s.commit).step() != SQLITE_DONE) return rollback("committing a change");
+  knowledge_ = knowledge;
+  return {};
+}
+
 Result<void> SqliteRegistry::applyPlan(Plan& plan) {
   // Containers first: they outlive registrations anyway, and a failure here leaves the
   // registry untouched.
@@ -782,11 +801,7 @@ Result<void> SqliteRegistry::applyPlan(Plan& plan) {
   {
     std::lock_guard db(dbMutex_);
     Statements& s = *statements_;
-    auto fail = [&](std::string_view what) {
-      EkError error = makeError(kDatabase, fmt::format("{}: {}", what, sqlite3_errmsg(db_)));
-      Use(s.rollback).step();
-      return error;
-    };
+    auto fail = [&](std::string_view what) { return rollback(what); };
     if (Use(s.begin).step() != SQLITE_DONE) {
       return makeError(kDatabase, fmt::format("beginning a change: {}", sqlite3_errmsg(db_)));
     }
@@ -848,14 +863,7 @@ Result<void> SqliteRegistry::applyPlan(Plan& plan) {
         if (sdk.step() != SQLITE_DONE) return fail("recording an extension point");
       }
     }
-    Uuid knowledge = Uuid::random();
-    {
-      Use meta(s.setMeta);
-      meta.text(1, "knowledge").uuid(2, knowledge);
-      if (meta.step() != SQLITE_DONE) return fail("changing the knowledge UUID");
-    }
-    if (Use(s.commit).step() != SQLITE_DONE) return fail("committing a change");
-    knowledge_ = knowledge;
+    EK_TRY(commitWithNewKnowledge());
     for (const Uuid& uuid : uuids) {
       Use find(s.plugInByUuid);
       find.uuid(1, uuid);
@@ -904,11 +912,7 @@ Result<void> SqliteRegistry::unregisterLocked(const std::string& path) {
 
   std::lock_guard db(dbMutex_);
   Statements& s = *statements_;
-  auto fail = [&](std::string_view what) {
-    EkError error = makeError(kDatabase, fmt::format("{}: {}", what, sqlite3_errmsg(db_)));
-    Use(s.rollback).step();
-    return error;
-  };
+  auto fail = [&](std::string_view what) { return rollback(what); };
   if (Use(s.begin).step() != SQLITE_DONE) {
     return makeError(kDatabase, fmt::format("beginning a change: {}", sqlite3_errmsg(db_)));
   }
@@ -926,14 +930,7 @@ Result<void> SqliteRegistry::unregisterLocked(const std::string& path) {
     remove.text(1, path);
     if (remove.step() != SQLITE_DONE) return fail("unregistering an application");
   }
-  Uuid knowledge = Uuid::random();
-  {
-    Use meta(s.setMeta);
-    meta.text(1, "knowledge").uuid(2, knowledge);
-    if (meta.step() != SQLITE_DONE) return fail("changing the knowledge UUID");
-  }
-  if (Use(s.commit).step() != SQLITE_DONE) return fail("committing a change");
-  knowledge_ = knowledge;
+  EK_TRY(commitWithNewKnowledge());
   log::vr().info("unregistered %s (%u plug-ins)", path, static_cast<unsigned>(leaving.size()));
   return {};
 }

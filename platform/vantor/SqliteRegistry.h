@@ -86,6 +86,10 @@ class SqliteRegistry : public Registry {
 
   // Under changeMutex_.
   Result<void> applyPlan(Plan& plan);
+  // REQUIRES: dbMutex_ held, inside a transaction. Rolls it back and answers the error.
+  EkError rollback(std::string_view what);
+  // REQUIRES: dbMutex_ held, inside a transaction. Changes the knowledge UUID and commits.
+  Result<void> commitWithNewKnowledge();
   Result<void> unregisterLocked(const std::string& path);
 
   // Under dbMutex_. The language is the one checkLocale last saw.
