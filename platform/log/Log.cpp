@@ -549,8 +549,8 @@ void setSink(std::shared_ptr<Sink> sink) {
   Registry::shared().setSink(std::move(sink));
 }
 
-void configure(std::string_view specification) {
-  Registry::shared().configure(specification);
+void configure(std::string_view levels) {
+  Registry::shared().configure(levels);
 }
 
 Category::Category(std::string subsystem, std::string name)

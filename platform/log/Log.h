@@ -100,9 +100,9 @@ class Sink {
 // capturing sink; nullptr restores the default.
 void setSink(std::shared_ptr<Sink> sink);
 
-// Re-reads the enabled levels from a specification in EKORA_LOG's syntax
+// Re-reads the enabled levels, written in EKORA_LOG's syntax
 // ("debug", "info", "ops:debug,vr:info"). The environment is read on first use.
-void configure(std::string_view specification);
+void configure(std::string_view levels);
 
 // A log category of a subsystem. Thread-safe.
 class Category {
