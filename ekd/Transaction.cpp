@@ -1,6 +1,5 @@
 #include "ekd/Transaction.h"
 
-#include <climits>
 #include <cstdlib>
 #include <unordered_map>
 
@@ -60,8 +59,8 @@ void Transaction::dispatch() {
   version_ = requested ? *requested : 0;
 
   if (version_ != protocol::kCurrentVersion && version_ != protocol::kOldestVersion) {
-    // Shown as the signed number the client sent, clamped to what a %d can carry.
-    int64_t shown = version_ > INT_MAX ? -1 : static_cast<int64_t>(version_.load());
+    // Shown as %d shows it: the low 32 bits, signed.
+    int32_t shown = static_cast<int32_t>(static_cast<uint32_t>(version_.load()));
     fail(protocol::kErrorVersion,
          log::format(protocol::kMsgUnsupportedVersion, shown, protocol::kCurrentVersion));
     return;
