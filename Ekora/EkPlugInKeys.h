@@ -1,5 +1,7 @@
 #pragma once
 
+#include "Ekora/EkProtocol.h"
+
 // Keys and message texts of the plug-in record and its form. Protocol keys live elsewhere.
 
 #include <cstdint>
@@ -70,9 +72,9 @@ inline constexpr std::string_view kOverriding = "overriding";
 }  // namespace form
 
 // Error codes of the "Ekora" domain used by the record.
-inline constexpr int32_t kCodeUnresolved = -1;
-inline constexpr int32_t kCodeNotCarriedOut = 4;
-inline constexpr int32_t kCodeInvalidDefinition = 12;
+inline constexpr int32_t kCodeUnresolved = protocol::kErrorUnresolved;
+inline constexpr int32_t kCodeNotCarriedOut = protocol::kErrorInvalidRequest;
+inline constexpr int32_t kCodeInvalidDefinition = protocol::kErrorInvalidPlugIn;
 
 // Validation messages (code 12).
 inline constexpr std::string_view kMissingIdentifierMessage =
