@@ -18,7 +18,7 @@ void FakeRegistry::install(PlugInProxy proxy) {
   auto observers = liveObservers();
   if (observers.empty()) return;
   queue_->async([observers = std::move(observers), shared] {
-    for (const auto& observer : observers) observer->plugInsDidInstall({shared});
+    for (const auto& observer : observers) observer->pluginsDidInstall({shared});
   });
 }
 
@@ -27,7 +27,7 @@ bool FakeRegistry::uninstall(const Uuid& uuid) {
   if (!proxy) return false;
   auto observers = liveObservers();
   auto deliver = [&] {
-    for (const auto& observer : observers) observer->plugInsWillUninstall({proxy});
+    for (const auto& observer : observers) observer->pluginsWillUninstall({proxy});
   };
   if (!observers.empty()) {
     if (queue_->isCurrent()) {

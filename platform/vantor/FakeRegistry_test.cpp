@@ -23,10 +23,10 @@ PlugInProxy proxy(std::string identifier, std::string point, std::string path) {
 class Counter : public RegistryObserver {
  public:
   explicit Counter(Registry& registry) : registry_(registry) {}
-  void plugInsDidInstall(const std::vector<PlugInProxyPtr>& plugIns) override {
+  void pluginsDidInstall(const std::vector<PlugInProxyPtr>& plugIns) override {
     installs += static_cast<int>(plugIns.size());
   }
-  void plugInsWillUninstall(const std::vector<PlugInProxyPtr>& plugIns) override {
+  void pluginsWillUninstall(const std::vector<PlugInProxyPtr>& plugIns) override {
     for (const auto& plugIn : plugIns) readableOnUninstall = !!registry_.plugInByUuid(plugIn->uuid);
     uninstalls += static_cast<int>(plugIns.size());
   }

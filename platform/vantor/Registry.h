@@ -88,8 +88,8 @@ using ApplicationProxyPtr = std::shared_ptr<const ApplicationProxy>;
 class RegistryObserver {
  public:
   virtual ~RegistryObserver() = default;
-  virtual void plugInsDidInstall(const std::vector<PlugInProxyPtr>& plugIns) = 0;
-  virtual void plugInsWillUninstall(const std::vector<PlugInProxyPtr>& plugIns) = 0;
+  virtual void pluginsDidInstall(const std::vector<PlugInProxyPtr>& plugIns) = 0;
+  virtual void pluginsWillUninstall(const std::vector<PlugInProxyPtr>& plugIns) = 0;
   // The current language changed; localized names in proxies handed out before are stale.
   virtual void localeDidChange() {}
 };

@@ -1239,7 +1239,7 @@ void SqliteRegistry::deliverInstall(std::vector<PlugInProxyPtr> plugIns) {
   auto observers = liveObservers();
   if (observers.empty()) return;
   options_.queue->async([observers = std::move(observers), plugIns = std::move(plugIns)] {
-    for (const auto& observer : observers) observer->plugInsDidInstall(plugIns);
+    for (const auto& observer : observers) observer->pluginsDidInstall(plugIns);
   });
 }
 
@@ -1248,7 +1248,7 @@ void SqliteRegistry::deliverUninstall(const std::vector<PlugInProxyPtr>& plugIns
   auto observers = liveObservers();
   if (observers.empty()) return;
   auto deliver = [&] {
-    for (const auto& observer : observers) observer->plugInsWillUninstall(plugIns);
+    for (const auto& observer : observers) observer->pluginsWillUninstall(plugIns);
   };
   if (options_.queue->isCurrent()) {
     deliver();

@@ -55,10 +55,10 @@ class Recorder : public RegistryObserver {
     registry_ = registry;
   }
 
-  void plugInsDidInstall(const std::vector<PlugInProxyPtr>& plugIns) override {
+  void pluginsDidInstall(const std::vector<PlugInProxyPtr>& plugIns) override {
     record("install", plugIns);
   }
-  void plugInsWillUninstall(const std::vector<PlugInProxyPtr>& plugIns) override {
+  void pluginsWillUninstall(const std::vector<PlugInProxyPtr>& plugIns) override {
     record("uninstall", plugIns);
   }
   void localeDidChange() override { record("locale", {}); }
