@@ -1,5 +1,9 @@
 #include "ekd/EkDServer.h"
 
+#include <mutex>
+
+#include "Ekora/EkProtocol.h"
+#include "ekd/EkDPlugInHold.h"
 #include "ekd/EkDWyreClient.h"
 #include "platform/log/Log.h"
 #include "platform/vantor/SqliteRegistry.h"
@@ -13,7 +17,15 @@ std::mutex gServerMutex;
 }  // namespace
 
 EkDPlatform EkDPlatform::system() {
-  return {CodeSigning::system(), SandboxCheck::system()};
+  EkDPlatform platform;
+  platform.codeSigning = CodeSigning::system();
+  platform.sandbox = SandboxCheck::system();
+  auto serviceManager = std::make_shared<stard::FileServiceManager>();
+  // Declarations of hosts that exited while the daemon was not running.
+  serviceManager->pruneDeclarations();
+  platform.serviceManager = std::move(serviceManager);
+  platform.notifier = std::make_shared<notify::FileNotifier>();
+  return platform;
 }
 
 std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceName,
@@ -32,6 +44,17 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
     }
     server->platform_.registry = std::move(registry).value();
   }
+  if (!server->platform_.serviceManager) {
+    server->platform_.serviceManager = std::make_shared<stard::FileServiceManager>();
+  }
+  if (!server->platform_.notifier) {
+    server->platform_.notifier = std::make_shared<notify::FileNotifier>();
+  }
+  EkDatabasePlatform databasePlatform{
+      server->platform_.registry, server->platform_.extensions, {}, server->platform_.notifier};
+  if (!server->initWithDatabase(server->databasePath_, std::move(databasePlatform))) {
+    return nullptr;
+  }
   server->wyreQueue_ = SerialQueue::make("wyre");
   // Requests run on the thread that reads the sockets: a request then reaches its handler
   // without waking another thread, and handlers run one at a time all the same.
@@ -48,6 +71,8 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
     std::lock_guard lock(gServerMutex);
     gServer = server;
   }
+  server->setDelegate(std::static_pointer_cast<EkDatabaseDelegate>(server));
+  server->registry()->addObserver(std::static_pointer_cast<vantor::RegistryObserver>(server));
   // The listener holds the server weakly: the process-wide reference keeps it alive.
   std::weak_ptr<EkDServer> weak = server;
   server->service_->setEventHandler([weak](const wyre::ListenerEvent& event) {
@@ -86,6 +111,150 @@ void EkDServer::submitWork(std::function<void()> work) {
 
 void EkDServer::stop() {
   service_->cancel();
+  std::vector<std::shared_ptr<EkDPlugInHold>> released;
+  syncQueue_->sync([&] {
+    for (const auto& hold : holds_) {
+      log::ops().debug("releasing plug-in hold %{public}@ because server is stopping",
+                       hold->uuid());
+    }
+    released.swap(holds_);
+    notifier()->post(protocol::kAnnotationChangeNotification);
+  });
+}
+
+bool EkDServer::holdOnPlugIn(const EkDPlugIn& plugIn) {
+  bool held = false;
+  syncQueue_->sync([&] {
+    for (const auto& hold : holds_) {
+      if (hold->blocks(plugIn)) {
+        held = true;
+        return;
+      }
+    }
+  });
+  return held;
+}
+
+void EkDServer::addHold(std::shared_ptr<EkDPlugInHold> hold) {
+  syncQueue_->sync([&] { holds_.push_back(std::move(hold)); });
+  notifier()->post(protocol::kAnnotationChangeNotification);
+}
+
+void EkDServer::unholdToken(const Uuid& token) {
+  // Destroyed outside the queue: a hold's last reference may be the list's.
+  std::shared_ptr<EkDPlugInHold> released;
+  syncQueue_->sync([&] {
+    for (auto it = holds_.begin(); it != holds_.end(); ++it) {
+      if ((*it)->uuid() == token) {
+        log::ops().debug("releasing plug-in hold %{public}@ at client's request", token);
+        released = std::move(*it);
+        holds_.erase(it);
+        notifier()->post(protocol::kAnnotationChangeNotification);
+        return;
+      }
+    }
+  });
+}
+
+void EkDServer::unholdClient(const std::shared_ptr<EkDWyreClient>& client) {
+  std::vector<std::shared_ptr<EkDPlugInHold>> released;
+  syncQueue_->sync([&] {
+    for (auto it = holds_.begin(); it != holds_.end();) {
+      if ((*it)->placedBy(client)) {
+        log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", (*it)->uuid(),
+                         client->pid());
+        released.push_back(std::move(*it));
+        it = holds_.erase(it);
+        notifier()->post(protocol::kAnnotationChangeNotification);
+      } else {
+        ++it;
+      }
+    }
+  });
+}
+
+size_t EkDServer::holdCount() {
+  size_t count = 0;
+  syncQueue_->sync([&] { count = holds_.size(); });
+  return count;
+}
+
+namespace {
+
+// Counts the service manager's answers for one termination request and runs the waiter's
+// steps as they arrive, so no thread blocks while the answers are outstanding.
+struct TerminationWaiter {
+  std::shared_ptr<SerialQueue> waiterQueue;
+  std::function<void()> reply;
+  int32_t expected = 0;
+  int32_t received = 0;  // on waiterQueue
+  int32_t awaiting = 0;  // on waiterQueue: the index of the answer the waiter waits for
+  bool started = false;  // on waiterQueue: the waiter has begun
+
+  // On waiterQueue: logs and passes every answer already in, then either waits for the next
+  // one or sends the reply.
+  void advance() {
+    if (!started) return;
+    while (awaiting < expected && received > awaiting) {
+      ++awaiting;
+      if (awaiting < expected) log::ops().debug("awaiting termination reply #%d", awaiting);
+    }
+    if (awaiting >= expected) {
+      log::ops().debug("sending termination reply");
+      if (reply) std::exchange(reply, nullptr)();
+    }
+  }
+};
+
+}  // namespace
+
+void EkDServer::terminatePlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns,
+                                 std::function<void()> reply) {
+  auto killer = SerialQueue::make("killer");
+  auto waiter = std::make_shared<TerminationWaiter>();
+  waiter->waiterQueue = SerialQueue::make("killer-waiter");
+  waiter->reply = std::move(reply);
+  waiter->expected = static_cast<int32_t>(plugIns.size());
+
+  for (const auto& proxy : plugIns) {
+    const std::string* infoVersion = nullptr;
+    auto it = proxy->info.find(vantor::kBundleVersionKey);
+    if (it != proxy->info.end()) infoVersion = it->second.string();
+    std::string version = infoVersion ? *infoVersion : "1";
+    std::string uuid = proxy->uuid.string();
+    log::ops().debug("requesting termination for %@(%@) stard:%@ %@", proxy->identifier,
+                     proxy->bundleVersion.value_or("(null)"), version, uuid);
+    platform_.serviceManager->removeExternalService(
+        proxy->identifier, version, killer, [waiter, uuid](int error) {
+          if (error == stard::kNoSuchProcess) {
+            log::ops().debug("stard reported no plug-ins on record for uuid=%@", uuid);
+          } else if (error != 0) {
+            log::ops().error("stard error attempting to terminate plug-ins: error=%d for uuid=%@",
+                             error, uuid);
+          } else {
+            log::ops().info("one or more plug-ins have been terminated for uuid=%@", uuid);
+          }
+          waiter->waiterQueue->async([waiter] {
+            ++waiter->received;
+            waiter->advance();
+          });
+        });
+  }
+  waiter->waiterQueue->async([waiter] {
+    waiter->started = true;
+    log::ops().debug("waiting for %d termination replies", waiter->expected);
+    if (waiter->expected > 0) log::ops().debug("awaiting termination reply #%d", 0);
+    waiter->advance();
+  });
+}
+
+void EkDServer::removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) {
+  auto described = std::make_shared<std::string>();
+  if (log::ops().enabled(log::Level::Debug)) {
+    for (const auto& proxy : plugIns) *described += proxy->description() + " ";
+  }
+  terminatePlugIns(plugIns,
+                   [described] { log::ops().debug("removal complete for %@", *described); });
 }
 
 }  // namespace ek

@@ -6,15 +6,20 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
+#include "ekd/EkDatabase.h"
 #include "platform/codesign/CodeSigning.h"
+#include "platform/notify/Notifications.h"
 #include "platform/queue/SerialQueue.h"
 #include "platform/sandbox/SandboxCheck.h"
+#include "platform/stard/ServiceManager.h"
 #include "platform/vantor/Registry.h"
 #include "platform/wyre/Wyre.h"
 
 namespace ek {
 
+class EkDPlugInHold;
 class EkDWyreClient;
 
 // The platform services the daemon reaches, replaceable by doubles in tests.
@@ -24,13 +29,20 @@ struct EkDPlatform {
   // The application registry; when none is given the server opens the one in the state
   // directory, which also registers the system plug-ins.
   std::shared_ptr<vantor::Registry> registry;
+  std::shared_ptr<stard::ServiceManager> serviceManager;
+  std::shared_ptr<notify::Notifier> notifier;
+  // The tokens added to forms; null means the process's sandbox.
+  std::shared_ptr<EkSandbox> extensions;
 
   static EkDPlatform system();
 };
 
 // The daemon's one server: owns the listener, the work queue on which every request runs,
-// and the queue that guards the hold list.
-class EkDServer : public std::enable_shared_from_this<EkDServer> {
+// and the queue that guards the hold list. It is also the plug-in database, and that
+// database's delegate.
+class EkDServer : public EkDatabase,
+                  public EkDatabaseDelegate,
+                  public std::enable_shared_from_this<EkDServer> {
  public:
   // Answers nullptr when the server cannot be built (for instance, the service cannot be
   // listened on); the reason is logged.
@@ -48,10 +60,21 @@ class EkDServer : public std::enable_shared_from_this<EkDServer> {
   // Cancels the listener and releases every hold. Called just before the process exits.
   void stop();
 
+  // Holds. The list is confined to syncQueue(), which these enter synchronously: never call
+  // them from it.
+  bool holdOnPlugIn(const EkDPlugIn& plugIn);
+  void addHold(std::shared_ptr<EkDPlugInHold> hold);
+  void unholdToken(const Uuid& token);
+  void unholdClient(const std::shared_ptr<EkDWyreClient>& client);
+  size_t holdCount();
+  // Asks the service manager to end every running instance of each plug-in; reply runs once
+  // every answer is in, on a queue of its own. Returns at once.
+  void terminatePlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns,
+                        std::function<void()> reply);
+  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) override;
+
   uint32_t verbose() const { return verbose_; }
   void setVerbose(uint32_t verbose) { verbose_ = verbose; }
-  int32_t cacheLimit() const { return cacheLimit_; }
-  void setCacheLimit(int32_t limit) { cacheLimit_ = limit; }
   const std::optional<std::string>& databasePath() const { return databasePath_; }
 
   const EkDPlatform& platform() const { return platform_; }
@@ -65,13 +88,13 @@ class EkDServer : public std::enable_shared_from_this<EkDServer> {
   void handleListenerEvent(const wyre::ListenerEvent& event);
 
   std::atomic<uint32_t> verbose_{0};
-  std::atomic<int32_t> cacheLimit_{1000000};
   std::optional<std::string> databasePath_;
   EkDPlatform platform_;
   std::shared_ptr<SerialQueue> wyreQueue_;
   std::shared_ptr<SerialQueue> mainQueue_;  // "service": every request runs here
   std::shared_ptr<SerialQueue> syncQueue_;  // "serverSync": guards the hold list
   std::shared_ptr<wyre::Listener> service_;
+  std::vector<std::shared_ptr<EkDPlugInHold>> holds_;  // on syncQueue_
 };
 
 }  // namespace ek

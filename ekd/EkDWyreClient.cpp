@@ -76,6 +76,7 @@ void EkDWyreClient::dying() {
 }
 
 void EkDWyreClient::dead() {
+  server_->unholdClient(shared_from_this());
   log::ops().debug("client %d is dead", pid_);
   acceptWork_ = false;
   EK_PROBE1(client_done, pid_);

@@ -52,6 +52,7 @@ class EkDWyreClientTest : public ::testing::Test {
     ASSERT_TRUE(mkdtemp(pattern));
     dir_ = pattern;
     setenv("EKORA_RUNTIME_DIR", dir_.c_str(), 1);
+    setenv("EKORA_STATE_DIR", dir_.c_str(), 1);
     codeSigning_ = std::make_shared<FakeCodeSigning>();
     sandbox_ = std::make_shared<FakeSandboxCheck>();
     codeSigning_->setEntitlements(getpid(), Dictionary{{"false", false},

@@ -2,7 +2,9 @@
 
 #include <cstdlib>
 #include <unordered_map>
+#include <utility>
 
+#include "Ekora/EkFileURL.h"
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDWyreClient.h"
@@ -89,6 +91,7 @@ void Transaction::done() {
     std::abort();
   }
   replied_ = true;
+  if (beforeReply_) std::exchange(beforeReply_, nullptr)();
   Value reply(std::move(reply_));
   if (EK_PROBE_ENABLED(request_output)) {
     std::string text = reply.description();
@@ -149,22 +152,54 @@ bool Transaction::processPaths(const PathCallback& callback) {
   return true;
 }
 
+bool Transaction::processUuidList(const PlugInStep& step) {
+  const Array* uuids = arrayForKey(protocol::kUuids);
+  if (!uuids) {
+    fail(protocol::kErrorInvalidRequest, "invalid request format (uuid)");
+    return false;
+  }
+  const Array* paths = nullptr;
+  if (const Value* value = request_.body.get(protocol::kPaths)) {
+    if (!value->array()) {
+      log::traffic().defaultLevel("Paths present but not an array (ignoring values)");
+    } else if (value->array()->size() != uuids->size()) {
+      log::traffic().defaultLevel("Paths present but has different count than UUIDs (ignoring)");
+    } else {
+      paths = value->array();
+    }
+  }
+  EkDServer& database = server();
+  for (size_t i = 0; i < uuids->size(); ++i) {
+    const Uuid* uuid = (*uuids)[i].uuid();
+    if (!uuid) {
+      fail(protocol::kErrorInvalidRequest, "invalid request (bad uuid array)");
+      return false;
+    }
+    auto plugIn = database.findPlugIn(*uuid);
+    if (!plugIn && paths) {
+      log::traffic().info("Failed to find plugin by %{uuid_t}.16P", *uuid);
+      if (const std::string* path = (*paths)[i].string()) {
+        log::traffic().info("Looking for plugin %{uuid_t}.16P by path %s", *uuid, *path);
+        if (auto url = EkFileURL::fromPath(*path))
+          plugIn = database.findPlugInAtPath(url->string());
+      }
+    }
+    if (!plugIn) {
+      fail(protocol::kErrorInvalidRequest, "no such plugin (uuid not found)");
+      return false;
+    }
+    if (!step(plugIn)) return false;
+  }
+  return true;
+}
+
 void Transaction::notServed() {
   log::ops().info("client %d: request type not served by this daemon yet", client_->pid());
   fail(protocol::kErrorInvalidRequest, protocol::kMsgUnrecognized);
 }
 
-// Until the registry, database and enabling services join the daemon, these request types
-// answer with the frame's error reply.
-void Transaction::addPlugIns() {
-  notServed();
-}
-void Transaction::removePlugIns() {
-  notServed();
-}
-void Transaction::bulkPlugIns() {
-  notServed();
-}
+// Until the discovery, enabling and hold services join the daemon, these request types answer
+// with the frame's error reply.
 void Transaction::matchPlugIns() {
   notServed();
 }
@@ -174,16 +209,7 @@ void Transaction::readyPlugIns() {
 void Transaction::accessPlugIns() {
   notServed();
 }
-void Transaction::annotatePlugIns() {
-  notServed();
-}
-void Transaction::bulkAnnotatePlugIns() {
-  notServed();
-}
 void Transaction::lockDownPlugIns() {
-  notServed();
-}
-void Transaction::findPlugIn() {
   notServed();
 }
 

@@ -13,6 +13,7 @@
 
 namespace ek {
 
+class EkDPlugIn;
 class EkDServer;
 class EkDWyreClient;
 
@@ -25,8 +26,12 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
 
   // Checks version and type and runs the request's handler, which replies exactly once.
   void dispatch();
-  // Sends the reply on the client's connection (a no-op when it has gone).
+  // Sends the reply on the client's connection (a no-op when it has gone), after running the
+  // work set with beforeReply.
   void done();
+  // Work that must be finished before any reply, success or failure, leaves: what the reply
+  // acknowledges must be durable by then.
+  void beforeReply(std::function<void()> work) { beforeReply_ = std::move(work); }
   // Sets "errorcode" and "error", then sends the reply.
   void fail(int32_t code, std::string_view message);
   // An Ekora error keeps its own code; any other error is sent with code.
@@ -39,6 +44,14 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   bool marshalPaths(const PathCallback& callback);
   // marshalPaths followed by done when it succeeded.
   bool processPaths(const PathCallback& callback);
+
+  using PlugInStep = std::function<bool(const std::shared_ptr<EkDPlugIn>& plugIn)>;
+  // Walks "uuids" (with "paths" as fallbacks for unknown UUIDs) and runs step per plug-in
+  // until it answers false. True when every entry was resolved and accepted; on false a
+  // failure reply has been sent, by the walk or by the step.
+  bool processUuidList(const PlugInStep& step);
+  // Sets form["annotations"] to the plug-in's stored annotations (empty when it has none).
+  void addAnnotationForPlugIn(const EkDPlugIn& plugIn, Dictionary& form);
 
   // The member under key when it is an array / a dictionary; nullptr otherwise.
   const Array* arrayForKey(std::string_view key) const;
@@ -62,6 +75,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   void bulkAnnotatePlugIns();
   void lockDownPlugIns();
   void findPlugIn();
+  std::shared_ptr<EkDPlugIn> findPlugInByUUID(const Uuid& uuid);
+  std::shared_ptr<EkDPlugIn> findPlugInByPathURL(const std::string& url);
 
  private:
   Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client)
@@ -74,6 +89,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   Dictionary reply_;
   std::atomic<uint64_t> version_{0};
   bool replied_ = false;
+  std::function<void()> beforeReply_;
 };
 
 }  // namespace ek

@@ -4,10 +4,12 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <cstring>
@@ -15,6 +17,8 @@
 #include <random>
 #include <sstream>
 #include <thread>
+
+#include "tests/RawClient.h"
 
 namespace ek::test {
 namespace fs = std::filesystem;
@@ -138,6 +142,7 @@ bool EkdProcess::start() {
     dup2(devnull, 1);
     for (const auto& [key, value] : environment()) setenv(key.c_str(), value.c_str(), 1);
     if (!getenv("EKORA_LOG")) setenv("EKORA_LOG", "debug", 1);
+    for (const auto& [key, value] : extraEnvironment_) setenv(key.c_str(), value.c_str(), 1);
     unsetenv("JOURNAL_STREAM");
     std::vector<std::string> argv{ekdPath(), "-S", service_};
     argv.insert(argv.end(), extraArgs_.begin(), extraArgs_.end());
@@ -195,6 +200,68 @@ CommandResult EkdProcess::ekctl(std::vector<std::string> args, const std::string
   std::vector<std::string> argv{ekctlPath(), "-S", service_};
   argv.insert(argv.end(), args.begin(), args.end());
   return runCommand(argv, environment(), input);
+}
+
+CommandResult EkdProcess::ekctlAs(const std::string& program, std::vector<std::string> args) const {
+  std::vector<std::string> argv{program, "-S", service_};
+  argv.insert(argv.end(), args.begin(), args.end());
+  return runCommand(argv, environment());
+}
+
+void EkdProcess::setEnvironment(const std::string& name, const std::string& value) {
+  extraEnvironment_[name] = value;
+}
+
+std::optional<Value> EkdProcess::ask(const Value& request,
+                                     std::chrono::milliseconds timeout) const {
+  static std::atomic<uint64_t> nextId{1};
+  RawClient client(socketPath());
+  uint64_t id = nextId++;
+  if (!client.connected() || !client.sendMessage(request, id)) return std::nullopt;
+  auto frame = client.readFrame(timeout);
+  if (!frame || frame->id != id) return std::nullopt;
+  return std::move(frame->body);
+}
+
+uint64_t EkdProcess::notificationGeneration(std::string_view name) const {
+  std::ifstream in(root_.path() / "run" / "notifications" / std::string(name));
+  uint64_t generation = 0;
+  if (!(in >> generation)) return 0;
+  return generation;
+}
+
+std::string EkdProcess::annotationFile() const {
+  for (size_t i = 0; i + 1 < extraArgs_.size(); ++i) {
+    if (extraArgs_[i] == "-d") return extraArgs_[i + 1];
+  }
+  return (root_.path() / "state" / "Ekora-Annotations").string();
+}
+
+std::string ekctlWithEntitlements(const fs::path& dir,
+                                  const std::vector<std::string>& entitlements) {
+  fs::create_directories(dir);
+  fs::path program = dir / "ekctl";
+  fs::copy_file(ekctlPath(), program, fs::copy_options::overwrite_existing);
+  std::string text = "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<dmap version=\"1.0\">\n<dict>\n";
+  for (const auto& name : entitlements) text += "\t<key>" + name + "</key>\n\t<true/>\n";
+  text += "</dict>\n</dmap>\n";
+  std::string path = program.string() + ".entitlements";
+  std::ofstream(path) << text;
+  chmod(path.c_str(), 0644);
+  return program.string();
+}
+
+int64_t replyErrorCode(const Value& reply) {
+  const uint64_t* code = reply.getUnsigned("errorcode");
+  if (code) return static_cast<int32_t>(static_cast<uint32_t>(*code));
+  const Value* value = reply.get("errorcode");
+  if (value && value->negativeNumber()) return *value->negativeNumber();
+  return 0;
+}
+
+std::string replyError(const Value& reply) {
+  const std::string* text = reply.getString("error");
+  return text ? *text : std::string();
 }
 
 }  // namespace ek::test

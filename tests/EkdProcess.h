@@ -2,10 +2,13 @@
 
 #include <sys/types.h>
 
+#include <chrono>
+#include <cstdint>
 #include <filesystem>
 #include <map>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/value/Value.h"
@@ -59,16 +62,42 @@ class EkdProcess {
 
   // Runs ekctl against this daemon.
   CommandResult ekctl(std::vector<std::string> args, const std::string& input = "") const;
+  // Runs another ekctl binary (a copy with its own entitlements) against this daemon.
+  CommandResult ekctlAs(const std::string& program, std::vector<std::string> args) const;
+
+  // An environment variable for the daemon, set after the defaults (EKORA_LOG among them) at
+  // every later start.
+  void setEnvironment(const std::string& name, const std::string& value);
+  // Sends one request on a fresh connection and answers the reply's body; nothing when no
+  // reply came within the timeout.
+  std::optional<Value> ask(const Value& request,
+                           std::chrono::milliseconds timeout = std::chrono::seconds(30)) const;
+  // The last generation posted for a notification in this daemon's runtime directory (0 when
+  // never posted).
+  uint64_t notificationGeneration(std::string_view name) const;
+  // The annotation file: the argument of -d when given, else $EKORA_STATE_DIR/Ekora-Annotations.
+  std::string annotationFile() const;
 
   const TempDir& root() const { return root_; }
 
  private:
   TempDir root_;
   std::vector<std::string> extraArgs_;
+  std::map<std::string, std::string> extraEnvironment_;
   std::string service_;
   pid_t pid_ = -1;
   int exitStatus_ = -1;
 };
+
+// A copy of ekctl in dir with an entitlements file beside it granting each name (owned by this
+// user, mode 0644, so the daemon honours it); answers the copy's path.
+std::string ekctlWithEntitlements(const std::filesystem::path& dir,
+                                  const std::vector<std::string>& entitlements);
+
+// The "errorcode" of a reply as the signed 32-bit code it carries (0 when absent), and its
+// "error" text (empty when absent).
+int64_t replyErrorCode(const Value& reply);
+std::string replyError(const Value& reply);
 
 // The paths of the built programs.
 std::string ekdPath();

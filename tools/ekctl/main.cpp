@@ -1,10 +1,15 @@
 // ekctl: the command-line client of the plug-in daemon.
 #include <fmt/format.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/signalfd.h>
 #include <unistd.h>
 #include <CLI/CLI.hpp>
 
+#include <cerrno>
 #include <chrono>
 #include <cstdio>
+#include <cstring>
 #include <future>
 #include <iostream>
 #include <iterator>
@@ -15,6 +20,7 @@
 #include "Ekora/EkDaemonClient.h"
 #include "Ekora/EkProtocol.h"
 #include "platform/json/WireJson.h"
+#include "platform/notify/Notifications.h"
 #include "tools/ekctl/Output.h"
 
 namespace {
@@ -124,6 +130,52 @@ int run(const Options& options, std::string_view command, const Sender& sender) 
   return kSuccess;
 }
 
+// Prints "NAME GENERATION" per post until SIGINT or SIGTERM, which end it successfully.
+int watch(const std::vector<std::string>& names) {
+  for (const std::string& name : names) {
+    if (auto valid = notify::checkName(name); !valid) {
+      usageError(
+          fmt::format("watch: invalid notification name \"{}\": {}", name, valid.error().message));
+    }
+  }
+  // The signals arrive on a descriptor polled beside the watcher, so a post and a signal
+  // never race and the output already flushed stays complete.
+  sigset_t stopSignals;
+  sigemptyset(&stopSignals);
+  sigaddset(&stopSignals, SIGINT);
+  sigaddset(&stopSignals, SIGTERM);
+  pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
+  int signalFd = signalfd(-1, &stopSignals, SFD_CLOEXEC | SFD_NONBLOCK);
+  if (signalFd < 0) {
+    std::fprintf(stderr, "ekctl: watch: signalfd: %s\n", std::strerror(errno));
+    return kTransport;
+  }
+  auto watcher = notify::Watcher::create(names);
+  if (!watcher) {
+    std::fprintf(stderr, "ekctl: watch: %s\n", watcher.error().message.c_str());
+    return kTransport;
+  }
+  while (true) {
+    struct pollfd fds[2] = {{(*watcher)->fd(), POLLIN, 0}, {signalFd, POLLIN, 0}};
+    if (poll(fds, 2, -1) < 0) {
+      if (errno == EINTR) continue;
+      std::fprintf(stderr, "ekctl: watch: poll: %s\n", std::strerror(errno));
+      return kTransport;
+    }
+    if (fds[1].revents != 0) return kSuccess;
+    if (fds[0].revents == 0) continue;
+    auto entries = (*watcher)->next(std::chrono::milliseconds(0));
+    if (!entries) {
+      std::fprintf(stderr, "ekctl: watch: %s\n", entries.error().message.c_str());
+      return kTransport;
+    }
+    for (const auto& [name, generation] : *entries) {
+      std::fprintf(stdout, "%s %llu\n", name.c_str(), static_cast<unsigned long long>(generation));
+      if (std::fflush(stdout) != 0) return kTransport;
+    }
+  }
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -171,6 +223,9 @@ int main(int argc, char** argv) {
   hold->add_option("PATH", paths)->required();
   auto* release = app.add_subcommand("release", "release a hold");
   release->add_option("UUID", uuidText)->required();
+  std::vector<std::string> notificationNames;
+  auto* watchCommand = app.add_subcommand("watch", "print notifications as they are posted");
+  watchCommand->add_option("NAME", notificationNames, "notification names")->required();
 
   try {
     app.parse(argc, argv);
@@ -263,5 +318,6 @@ int main(int argc, char** argv) {
       c.releaseHold(uuid, std::move(r));
     });
   }
+  if (watchCommand->parsed()) return watch(notificationNames);
   return kUsage;
 }

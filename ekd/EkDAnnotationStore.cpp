@@ -1,0 +1,336 @@
+#include "ekd/EkDAnnotationStore.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cmath>
+#include <cstdio>
+#include <cstdlib>
+#include <ctime>
+#include <filesystem>
+#include <utility>
+
+#include "ekd/EkDPlugIn.h"
+#include "platform/dmap/Dmap.h"
+#include "platform/log/Log.h"
+#include "platform/paths/Directories.h"
+#include "platform/trace/Probes.h"
+
+namespace ek {
+
+namespace {
+
+constexpr std::string_view kVersionKey = "version";
+constexpr std::string_view kDataKey = "data";
+constexpr std::string_view kAnnotationsFileName = "Ekora-Annotations";
+constexpr std::string_view kContainersDirName = "containers";
+constexpr std::string_view kContainerIdentifier = "com.corvane.ekd";
+constexpr std::string_view kBadFileInfix = ".bad-";
+
+constexpr int32_t kWrongVersionCode = 7;
+constexpr std::string_view kWrongVersionMessage = "found database version %d needed version %d";
+
+constexpr std::string_view kLogLoadFailed =
+    "unable to load annotation database:%{public}@ error:%{public}@ (resetting)";
+constexpr std::string_view kLogMigrating = "migrating shared annotations";
+constexpr std::string_view kLogMigratedSaveFailed =
+    "unable to save migrated annotations to %{public}@ error:%{public}@";
+constexpr std::string_view kLogSaveFailed =
+    "unable to save annotations:%{public}@ error:%{public}@";
+constexpr std::string_view kLogNoContainer = "failed to get storage container: error=%llu";
+constexpr std::string_view kFatalNoContainer = "unable to locate user container: error %llu";
+constexpr std::string_view kLogKeptBadFile = "kept unusable annotation database %{public}@ as %@";
+constexpr std::string_view kLogKeepBadFileFailed =
+    "unable to keep unusable annotation database:%{public}@ aside error:%{public}@ (not "
+    "overwriting it)";
+
+// Backup names tried for one timestamp before giving up: "<file>.bad-<stamp>", then "-1" ...
+constexpr int kMaxBackupNames = 100;
+constexpr size_t kCopyChunk = 64 * 1024;
+
+// "version" as an integer, 0 when absent or not a number, as its 64-bit two's complement so
+// that every stored number converts without overflow.
+uint64_t versionBits(const Value& root) {
+  const Value* version = root.get(kVersionKey);
+  if (version == nullptr) return 0;
+  if (const uint64_t* number = version->unsignedNumber()) return *number;
+  if (const int64_t* number = version->negativeNumber()) return static_cast<uint64_t>(*number);
+  if (const double* number = version->doubleNumber()) {
+    // Outside int64's range the truncation would be undefined.
+    if (!std::isfinite(*number) || *number >= 0x1p63 || *number < -0x1p63) return 0;
+    return static_cast<uint64_t>(static_cast<int64_t>(*number));
+  }
+  return 0;
+}
+
+// The number as %d shows it: the low 32 bits, signed.
+int32_t asPrintedInt(uint64_t bits) {
+  return static_cast<int32_t>(static_cast<uint32_t>(bits));
+}
+
+std::string utcStamp() {
+  std::time_t now = std::time(nullptr);
+  std::tm utc{};
+  gmtime_r(&now, &utc);
+  char text[32];
+  size_t length = std::strftime(text, sizeof text, "%Y%m%dT%H%M%SZ", &utc);
+  return std::string(text, length);
+}
+
+class FileDescriptor {
+ public:
+  explicit FileDescriptor(int fd) : fd_(fd) {}
+  FileDescriptor(const FileDescriptor&) = delete;
+  FileDescriptor& operator=(const FileDescriptor&) = delete;
+  ~FileDescriptor() {
+    if (fd_ >= 0) ::close(fd_);
+  }
+  int get() const { return fd_; }
+  // Closes now, answering close's errno (0 on success).
+  int close() {
+    int fd = fd_;
+    fd_ = -1;
+    return ::close(fd) == 0 ? 0 : errno;
+  }
+
+ private:
+  int fd_;
+};
+
+Result<void> copyBytes(int from, int to, const std::string& source, const std::string& target) {
+  char buffer[kCopyChunk];
+  while (true) {
+    ssize_t got = ::read(from, buffer, sizeof buffer);
+    if (got < 0) {
+      if (errno == EINTR) continue;
+      return EkError::fromErrno(errno, "reading " + source);
+    }
+    if (got == 0) return {};
+    for (ssize_t done = 0; done < got;) {
+      ssize_t put = ::write(to, buffer + done, static_cast<size_t>(got - done));
+      if (put < 0) {
+        if (errno == EINTR) continue;
+        return EkError::fromErrno(errno, "writing " + target);
+      }
+      done += put;
+    }
+  }
+}
+
+// Copies the regular file source to a new file target (same mode) and syncs it. False when
+// target already exists; a partial copy is removed.
+Result<bool> copyToNewFile(const std::string& source, const std::string& target) {
+  FileDescriptor in(::open(source.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
+  if (in.get() < 0) return EkError::fromErrno(errno, "opening " + source);
+  struct stat st {};
+  if (::fstat(in.get(), &st) != 0) return EkError::fromErrno(errno, "examining " + source);
+  if (!S_ISREG(st.st_mode)) return EkError::posix(EINVAL, source + ": not a regular file");
+
+  FileDescriptor out(::open(target.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
+  if (out.get() < 0) {
+    if (errno == EEXIST) return false;
+    return EkError::fromErrno(errno, "creating " + target);
+  }
+  Result<void> copied = copyBytes(in.get(), out.get(), source, target);
+  if (copied.ok() && ::fchmod(out.get(), st.st_mode & 0777) != 0) {
+    copied = EkError::fromErrno(errno, "setting the mode of " + target);
+  }
+  if (copied.ok() && ::fsync(out.get()) != 0) {
+    copied = EkError::fromErrno(errno, "syncing " + target);
+  }
+  if (copied.ok()) {
+    if (int error = out.close(); error != 0)
+      copied = EkError::fromErrno(error, "closing " + target);
+  }
+  if (!copied.ok()) {
+    ::unlink(target.c_str());
+    return copied.error();
+  }
+  return true;
+}
+
+}  // namespace
+
+std::unique_ptr<EkDAnnotationStore> EkDAnnotationStore::initWithDatabase(
+    std::optional<std::string> path) {
+  std::unique_ptr<EkDAnnotationStore> store(new EkDAnnotationStore());
+  store->annotationsURL_ = path ? std::move(*path) : defaultDatabaseURL();
+
+  bool dataUsable = true;
+  Result<void> loaded = store->load(store->annotationsURL_, dataUsable);
+  if (loaded.ok()) {
+    // Whatever the file held under "data" is gone from the table; keep it for a person.
+    if (!dataUsable) store->keepBadFile_ = true;
+    return store;
+  }
+  if (!loaded.error().isPosix(ENOENT)) {
+    log::ops().error(kLogLoadFailed, store->annotationsURL_, loaded.error());
+    store->keepBadFile_ = true;
+  }
+
+  // The container is a directory, so this fails today; it is where older annotations lived.
+  Result<std::string> container = containerURL();
+  if (container.ok()) {
+    bool migratedUsable = true;
+    if (store->load(*container, migratedUsable).ok()) {
+      log::ops().info(kLogMigrating);
+      Result<void> saved = store->saveDb();
+      if (!saved.ok()) {
+        log::ops().error(kLogMigratedSaveFailed, store->annotationsURL_, saved.error());
+      }
+    }
+  }
+  return store;
+}
+
+std::optional<Dictionary> EkDAnnotationStore::annotationForIdentifier(std::string_view key) const {
+  auto it = annotations_.find(key);
+  if (it == annotations_.end()) return std::nullopt;
+  const Dictionary* annotation = it->second.dictionary();
+  if (annotation == nullptr) return std::nullopt;
+  return *annotation;
+}
+
+std::optional<Dictionary> EkDAnnotationStore::annotationForPlugIn(const EkDPlugIn& plugIn) const {
+  return annotationForIdentifier(plugIn.annotationKey());
+}
+
+void EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
+                                       const EkDPlugIn& plugIn) {
+  setAnnotation(annotation, plugIn.annotationKey());
+}
+
+void EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
+                                       const std::string& key) {
+  if (annotation) {
+    Dictionary merged = annotationForIdentifier(key).value_or(Dictionary{});
+    for (const auto& [name, value] : *annotation) merged.insert_or_assign(name, value);
+    annotations_.insert_or_assign(key, Value(std::move(merged)));
+  } else {
+    annotations_.erase(key);
+  }
+  if (deferring_) {
+    pendingSave_ = true;
+    return;
+  }
+  Result<void> saved = saveDb();
+  if (!saved.ok()) log::ops().error(kLogSaveFailed, annotationsURL_, saved.error());
+}
+
+void EkDAnnotationStore::deferSaves() {
+  deferring_ = true;
+}
+
+void EkDAnnotationStore::saveDeferred() {
+  deferring_ = false;
+  if (!std::exchange(pendingSave_, false)) return;
+  Result<void> saved = saveDb();
+  if (!saved.ok()) log::ops().error(kLogSaveFailed, annotationsURL_, saved.error());
+}
+
+Result<void> EkDAnnotationStore::loadDb(const std::string& path) {
+  bool dataUsable = true;
+  return load(path, dataUsable);
+}
+
+Result<void> EkDAnnotationStore::load(const std::string& path, bool& dataUsable) {
+  Result<Value> root = dmap::readFile(path);
+  std::optional<EkError> failure;
+  if (!root.ok()) {
+    failure = root.error();
+  } else if (uint64_t version = versionBits(*root); version != static_cast<uint64_t>(kVersion)) {
+    failure = EkError::ekora(kWrongVersionCode,
+                             log::format(kWrongVersionMessage, asPrintedInt(version), kVersion));
+  }
+  if (failure) {
+    EK_PROBE2(db_load, failure->domain.c_str(), static_cast<uint64_t>(failure->code));
+    return *failure;
+  }
+
+  Dictionary* data = nullptr;
+  if (Dictionary* top = root->dictionary()) {
+    auto it = top->find(kDataKey);
+    if (it != top->end()) {
+      data = it->second.dictionary();
+      dataUsable = data != nullptr;
+    }
+  }
+  annotations_ = data != nullptr ? std::move(*data) : Dictionary{};
+  return {};
+}
+
+Result<void> EkDAnnotationStore::saveDb() {
+  Dictionary root;
+  root.emplace(kVersionKey, Value(kVersion));
+  root.emplace(kDataKey, Value(annotations_));
+  std::string bytes = EK_TRY(dmap::write(Value(std::move(root))));
+
+  std::filesystem::path directory = std::filesystem::path(annotationsURL_).parent_path();
+  if (!directory.empty()) EK_TRY(paths::ensureDirectory(directory.string()));
+
+  if (keepBadFile_) {
+    Result<void> kept = keepBadFileAside();
+    if (!kept.ok()) {
+      log::ops().error(kLogKeepBadFileFailed, annotationsURL_, kept.error());
+      return kept;
+    }
+    keepBadFile_ = false;
+  }
+  return dmap::writeBytesAtomically(annotationsURL_, bytes);
+}
+
+Result<void> EkDAnnotationStore::keepBadFileAside() const {
+  const std::string base = annotationsURL_ + std::string(kBadFileInfix) + utcStamp();
+  for (int attempt = 0; attempt < kMaxBackupNames; ++attempt) {
+    std::string backup = attempt == 0 ? base : base + "-" + std::to_string(attempt);
+    // A second name for the same bytes: the file stays where it is until the rename of the
+    // save replaces it, and the directory sync of that save makes both names durable.
+    if (::link(annotationsURL_.c_str(), backup.c_str()) == 0) {
+      log::ops().defaultLevel(kLogKeptBadFile, annotationsURL_, backup);
+      return {};
+    }
+    int error = errno;
+    if (error == EEXIST) continue;
+    if (error == ENOENT) {
+      struct stat st {};
+      // Gone since it failed to load: nothing is left to keep.
+      if (::lstat(annotationsURL_.c_str(), &st) != 0 && errno == ENOENT) return {};
+      return EkError::fromErrno(error, "linking " + annotationsURL_ + " to " + backup);
+    }
+    // Some file systems refuse hard links: copy the bytes instead.
+    Result<bool> copied = copyToNewFile(annotationsURL_, backup);
+    if (!copied.ok()) return copied.error();
+    if (*copied) {
+      log::ops().defaultLevel(kLogKeptBadFile, annotationsURL_, backup);
+      return {};
+    }
+  }
+  return EkError::posix(EEXIST, "no free name to keep " + annotationsURL_ + " aside");
+}
+
+std::string EkDAnnotationStore::defaultDatabaseURL() {
+  return globalURL();
+}
+
+std::string EkDAnnotationStore::globalURL() {
+  return paths::join(paths::stateDir(), kAnnotationsFileName);
+}
+
+Result<std::string> EkDAnnotationStore::containerURL() {
+  std::string directory =
+      paths::join(paths::join(paths::stateDir(), kContainersDirName), kContainerIdentifier);
+  Result<void> made = paths::ensureDirectory(directory);
+  if (!made.ok()) {
+    // Without its own container the daemon's state is not what it relies on.
+    unsigned long long code = static_cast<uint32_t>(made.error().code);
+    log::ops().error(kLogNoContainer, code);
+    std::string message = log::format(kFatalNoContainer, code);
+    std::fprintf(stderr, "%s\n", message.c_str());
+    std::abort();
+  }
+  return directory + "/";
+}
+
+}  // namespace ek

@@ -1,0 +1,338 @@
+#include "ekd/EkDatabase.h"
+
+#include <cctype>
+#include <cstdio>
+#include <cstdlib>
+#include <unordered_set>
+
+#include "Ekora/EkProtocol.h"
+#include "platform/log/Log.h"
+
+namespace ek {
+namespace {
+
+constexpr std::string_view kUserElectionKey = "ZuUserElection";
+constexpr std::string_view kElectionKey = "election";
+
+// A list of proxies as "%@" shows an array.
+struct ProxyList {
+  const std::vector<vantor::PlugInProxyPtr>& proxies;
+  std::string description() const {
+    std::string text = "(";
+    for (size_t i = 0; i < proxies.size(); ++i) {
+      text += i ? ",\n    " : "\n    ";
+      text += proxies[i]->description();
+    }
+    text += proxies.empty() ? ")" : "\n)";
+    return text;
+  }
+};
+
+// The integer value of an election, when it is a number.
+std::optional<int64_t> electionValue(const Value& value) {
+  if (const uint64_t* u = value.unsignedNumber()) return static_cast<int64_t>(*u);
+  if (const int64_t* i = value.negativeNumber()) return *i;
+  if (const double* d = value.doubleNumber()) {
+    // NaN and values out of range have no integer value.
+    if (!(*d > -9.2e18 && *d < 9.2e18)) return int64_t{0};
+    return static_cast<int64_t>(*d);
+  }
+  if (const bool* b = value.boolean()) return *b ? 1 : 0;
+  return std::nullopt;
+}
+
+void requireOn(const SerialQueue& queue, const char* operation) {
+  if (!queue.isCurrent()) {
+    std::fprintf(stderr, "EkDatabase::%s called off the database queue\n", operation);
+    std::abort();
+  }
+}
+
+// Runs block synchronously on queue and answers its result.
+template <typename F>
+auto onQueue(SerialQueue& queue, F&& block) {
+  using R = decltype(block());
+  std::optional<R> result;
+  queue.sync([&] { result.emplace(block()); });
+  return std::move(*result);
+}
+
+}  // namespace
+
+EkDatabase::~EkDatabase() = default;
+
+bool EkDatabase::initWithDatabase(std::optional<std::string> path, EkDatabasePlatform platform) {
+  platform_ = std::move(platform);
+  annotations_ = EkDAnnotationStore::initWithDatabase(std::move(path));
+  if (!annotations_) return false;
+  sync_ = SerialQueue::make("EkDatabase");
+  // The registry holds observers weakly; the owner registers this database once it is shared
+  // (see EkDServer), since a base class cannot hand out its owner's reference.
+  return true;
+}
+
+EkDPlugInContext EkDatabase::recordContext() const {
+  return {platform_.registry, platform_.sandbox, platform_.systemRoot};
+}
+
+void EkDatabase::setDelegate(std::weak_ptr<EkDatabaseDelegate> delegate) {
+  delegate_ = std::move(delegate);
+}
+
+size_t EkDatabase::cacheCount() {
+  return onQueue(*sync_, [&] { return cache_.size(); });
+}
+
+EkDPlugInRef EkDatabase::plugInForProxy(const vantor::PlugInProxy& proxy) {
+  return onQueue(*sync_, [&]() -> EkDPlugInRef {
+    auto it = cache_.find(proxy.uuid);
+    if (it != cache_.end()) {
+      if (it->second->isStillValid()) return it->second;
+      cache_.erase(it);
+    }
+    return createPlugInForProxy(proxy);
+  });
+}
+
+EkDPlugInRef EkDatabase::createPlugInForProxy(const vantor::PlugInProxy& proxy) {
+  requireOn(*sync_, "createPlugInForProxy");
+  log::ops().defaultLevel("createPlugInForProxy");
+  auto plugIn = EkDPlugIn::createWithVRData(proxy, recordContext());
+  if (!plugIn) return nullptr;
+  if (plugIn->hasEntitlement(protocol::kEntitlementAutoElect)) autoElect(*plugIn);
+  purgeCachesToLimit(cacheLimit_.load());
+  cache_[plugIn->uuid()] = plugIn;
+  return plugIn;
+}
+
+void EkDatabase::purgeCachesToLimit(int64_t limit) {
+  requireOn(*sync_, "purgeCachesToLimit");
+  // Compared unsigned: a negative limit never purges.
+  if (static_cast<uint64_t>(cache_.size()) > static_cast<uint64_t>(limit)) {
+    log::ops().info("purging cache for %d > %d", cache_.size(), limit);
+    cache_.clear();
+    platform_.registry->clearCaches();
+  }
+}
+
+void EkDatabase::localeDidChange() {
+  log::ops().defaultLevel("locale change detected; purging cache");
+  sync_->async([this] { purgeCachesToLimit(0); });
+}
+
+std::optional<std::string> EkDatabase::normalizeElection(const Value& value) {
+  const std::string* text = value.string();
+  if (!text || text->empty()) return std::nullopt;
+  unsigned char first = static_cast<unsigned char>((*text)[0]);
+  if (first == '=') return text->substr(1);
+  if (std::isalnum(first)) return *text;
+  return std::nullopt;
+}
+
+std::optional<std::vector<std::string>> EkDatabase::electionList(const Dictionary& query) {
+  auto it = query.find(kUserElectionKey);
+  if (it == query.end()) return std::nullopt;
+  std::vector<std::string> elections;
+  if (const Array* array = it->second.array()) {
+    elections.reserve(array->size());
+    for (const Value& element : *array) {
+      auto normalized = normalizeElection(element);
+      if (!normalized) return std::nullopt;
+      elections.push_back(std::move(*normalized));
+    }
+    return elections;
+  }
+  if (it->second.string()) {
+    auto normalized = normalizeElection(it->second);
+    if (!normalized) return std::nullopt;
+    elections.push_back(std::move(*normalized));
+    return elections;
+  }
+  return std::nullopt;
+}
+
+bool EkDatabase::electionFilter(const std::vector<std::string>& elections,
+                                const vantor::PlugInProxy& proxy) {
+  std::string key = proxy.identifier;
+  auto replaces = proxy.entitlements.find(protocol::kEntitlementReplacePlugIn);
+  if (replaces != proxy.entitlements.end() && replaces->second.string()) {
+    key = *replaces->second.string();
+  }
+  std::optional<int64_t> election = onQueue(*sync_, [&]() -> std::optional<int64_t> {
+    auto annotation = annotations_->annotationForIdentifier(key);
+    if (!annotation) return std::nullopt;
+    auto field = annotation->find(kElectionKey);
+    if (field == annotation->end()) return std::nullopt;
+    return electionValue(field->second);
+  });
+  if (!election) {
+    election = 0;
+    auto autoElect = proxy.entitlements.find(protocol::kEntitlementAutoElect);
+    if (autoElect != proxy.entitlements.end()) {
+      // Only a number counts here, by its boolean value.
+      const Value& value = autoElect->second;
+      if (auto number = electionValue(value)) election = *number != 0 ? 1 : 0;
+    }
+  }
+  std::string text = std::to_string(static_cast<uint8_t>(*election & 0xff));
+  bool answer = false;
+  for (const std::string& candidate : elections) {
+    if (candidate == text) {
+      answer = true;
+      break;
+    }
+  }
+  log::ops().debug("vr filter %@ -> %d", key, answer ? 1 : 0);
+  return answer;
+}
+
+std::optional<std::vector<EkDPlugInRef>> EkDatabase::findPlugIns(const Dictionary& query) {
+  std::vector<vantor::PlugInProxyPtr> proxies;
+  if (query.empty()) {
+    proxies = platform_.registry->installedPlugIns();
+    log::vr().debug("%d installedPlugins: %@", proxies.size(), ProxyList{proxies});
+  } else {
+    auto elections = electionList(query);
+    vantor::PlugInFilter filter;
+    if (elections) {
+      filter = [this, elections = std::move(*elections)](const vantor::PlugInProxy& proxy) {
+        return electionFilter(elections, proxy);
+      };
+    }
+    proxies = platform_.registry->query(query, filter);
+    log::vr().debug("%d plugin(s) matching %@ = %@", proxies.size(), Value(query),
+                    ProxyList{proxies});
+  }
+  if (proxies.empty()) return std::nullopt;
+
+  size_t cachedBefore = cacheCount();
+  std::vector<EkDPlugInRef> result;
+  std::unordered_set<Uuid> seen;
+  for (const auto& proxy : proxies) {
+    if (proxy->url.empty()) {
+      log::ops().info("skipping vr proxy %@ with nil bundleURL", *proxy);
+      continue;
+    }
+    if (proxy->containingAppPath) {
+      auto application = platform_.registry->applicationByPath(*proxy->containingAppPath);
+      if (application && application->isPlaceholder) {
+        log::ops().info("skipping vr proxy %@ because its app is a placeholder", *proxy);
+        continue;
+      }
+    }
+    if (!seen.insert(proxy->uuid).second) continue;
+    if (auto plugIn = plugInForProxy(*proxy)) result.push_back(std::move(plugIn));
+  }
+  log::ops().debug("VR reported %u plug-ins (cache %u/%u)", result.size(), cachedBefore,
+                   cacheCount());
+  return result;
+}
+
+EkDPlugInRef EkDatabase::findPlugIn(const Uuid& uuid) {
+  EkDPlugInRef plugIn = onQueue(*sync_, [&]() -> EkDPlugInRef {
+    auto it = cache_.find(uuid);
+    if (it != cache_.end()) {
+      if (it->second->isStillValid()) return it->second;
+      cache_.erase(it);
+    }
+    auto proxy = platform_.registry->plugInByUuid(uuid);
+    if (!proxy) {
+      log::ops().info("Vantor cannot find plug-in with UUID:%{public}@", uuid);
+      return nullptr;
+    }
+    return createPlugInForProxy(*proxy);
+  });
+  return plugIn;
+}
+
+EkDPlugInRef EkDatabase::findPlugInAtPath(std::string_view url) {
+  auto proxy = platform_.registry->plugInByUrl(url);
+  if (!proxy) {
+    log::ops().info("Vantor cannot find plug-in at path:%@", url);
+    return nullptr;
+  }
+  return findPlugIn(proxy->uuid);
+}
+
+std::optional<std::vector<EkDPlugInRef>> EkDatabase::plugInsWithinApplication(
+    std::string_view appUrl) {
+  auto proxies = platform_.registry->plugInsOfApplication(appUrl);
+  if (proxies.empty()) return std::nullopt;
+  std::vector<EkDPlugInRef> result;
+  result.reserve(proxies.size());
+  for (const auto& proxy : proxies) {
+    if (auto plugIn = plugInForProxy(*proxy)) result.push_back(std::move(plugIn));
+  }
+  return result;
+}
+
+std::optional<EkError> EkDatabase::addPlugIn(std::string_view url) {
+  auto path = vantor::pathFromUrlOrPath(url);
+  if (path) {
+    if (platform_.registry->registerBundle(*path)) return std::nullopt;
+  }
+  return EkError::ekora(protocol::kErrorRegistry, "Vantor failed to register the plug-in");
+}
+
+std::optional<EkError> EkDatabase::removePlugIn(std::string_view url) {
+  auto path = vantor::pathFromUrlOrPath(url);
+  if (path) {
+    if (platform_.registry->unregisterBundle(*path)) return std::nullopt;
+  }
+  return EkError::ekora(protocol::kErrorRegistry, "Vantor failed to deregister the plug-in");
+}
+
+std::optional<Dictionary> EkDatabase::annotationForPlugIn(const EkDPlugIn& plugIn) {
+  return onQueue(*sync_, [&] { return annotations_->annotationForPlugIn(plugIn); });
+}
+
+void EkDatabase::setAnnotation(const std::optional<Dictionary>& annotation,
+                               const EkDPlugIn& plugIn) {
+  sync_->sync([&] { annotations_->setAnnotation(annotation, plugIn); });
+}
+
+void EkDatabase::beginAnnotationChanges() {
+  sync_->sync([&] { annotations_->deferSaves(); });
+}
+
+void EkDatabase::commitAnnotationChanges() {
+  sync_->sync([&] { annotations_->saveDeferred(); });
+}
+
+void EkDatabase::notifyAnnotationChange() {
+  platform_.notifier->post(protocol::kAnnotationChangeNotification);
+}
+
+void EkDatabase::autoElect(const EkDPlugIn& plugIn) {
+  requireOn(*sync_, "autoElect");
+  Dictionary annotation = annotations_->annotationForPlugIn(plugIn).value_or(Dictionary{});
+  auto it = annotation.find(kElectionKey);
+  if (it != annotation.end()) {
+    auto value = electionValue(it->second);
+    if (value && *value != 0) return;
+  }
+  annotation.insert_or_assign(std::string(kElectionKey), Value(uint64_t{1}));
+  annotations_->setAnnotation(annotation, plugIn);
+}
+
+void EkDatabase::pluginsDidInstall(const std::vector<vantor::PlugInProxyPtr>& plugIns) {
+  for (const auto& proxy : plugIns) {
+    log::ops().defaultLevel("plug-in INSTALLED:%@ %@(%@) %{public}@ %@", proxy->identifier,
+                            proxy->identifier, proxy->bundleVersion.value_or("(null)"), proxy->uuid,
+                            proxy->path);
+  }
+}
+
+void EkDatabase::pluginsWillUninstall(const std::vector<vantor::PlugInProxyPtr>& plugIns) {
+  sync_->sync([&] {
+    for (const auto& proxy : plugIns) {
+      log::ops().defaultLevel("plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", proxy->identifier,
+                              proxy->identifier, proxy->bundleVersion.value_or("(null)"),
+                              proxy->uuid.string(), proxy->path);
+      cache_.erase(proxy->uuid);
+    }
+  });
+  if (auto delegate = delegate_.lock()) delegate->removedPlugIns(plugIns);
+}
+
+}  // namespace ek

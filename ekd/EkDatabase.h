@@ -1,0 +1,133 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <vector>
+
+#include "ekd/EkDAnnotationStore.h"
+#include "ekd/EkDPlugIn.h"
+#include "platform/notify/Notifications.h"
+#include "platform/queue/SerialQueue.h"
+#include "platform/value/EkError.h"
+#include "platform/value/Uuid.h"
+#include "platform/value/Value.h"
+#include "platform/vantor/Registry.h"
+
+namespace ek {
+
+using EkDPlugInRef = std::shared_ptr<EkDPlugIn>;
+
+// Told when installed plug-ins are about to go away.
+class EkDatabaseDelegate {
+ public:
+  virtual ~EkDatabaseDelegate() = default;
+  // Called on the registry's notice thread, outside the database queue.
+  virtual void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) = 0;
+};
+
+// What the database needs from the platform.
+struct EkDatabasePlatform {
+  // Required.
+  std::shared_ptr<vantor::Registry> registry;
+  // The tokens added to forms; null means the process's sandbox.
+  std::shared_ptr<EkSandbox> sandbox;
+  // Empty means $EKORA_SYSTEM_ROOT.
+  std::string systemRoot;
+  // Required.
+  std::shared_ptr<notify::Notifier> notifier;
+};
+
+// The daemon's view of the installed plug-ins: records built from the registry's proxies,
+// cached by UUID, and the annotation store in front of which the cache sits.
+//
+// The queue "EkDatabase" (_sync) confines the cache and the annotation store. The synchronous
+// operations enter it and must not be called from it; findPlugIns runs on the caller's queue
+// and enters it per candidate.
+class EkDatabase : public vantor::RegistryObserver {
+ public:
+  ~EkDatabase() override;
+
+  // Fails only when the annotation store cannot be opened.
+  bool initWithDatabase(std::optional<std::string> path, EkDatabasePlatform platform);
+
+  // The cached record of the proxy's UUID, else a new one. nullptr when the proxy yields no
+  // record (the next request tries again).
+  EkDPlugInRef plugInForProxy(const vantor::PlugInProxy& proxy);
+  // Builds, auto-elects and caches a record. Runs on _sync only.
+  EkDPlugInRef createPlugInForProxy(const vantor::PlugInProxy& proxy);
+  // Empties the whole cache when it holds more than limit records (compared unsigned, so a
+  // negative limit never purges). Runs on _sync only.
+  void purgeCachesToLimit(int64_t limit);
+
+  // Records of the plug-ins the registry selects for query, its "ZuUserElection" applied as
+  // an election filter; each plug-in once, in the registry's order. Absent when the registry
+  // answers nothing.
+  std::optional<std::vector<EkDPlugInRef>> findPlugIns(const Dictionary& query);
+  EkDPlugInRef findPlugIn(const Uuid& uuid);
+  // A file URL (or absolute path) of a plug-in bundle.
+  EkDPlugInRef findPlugInAtPath(std::string_view url);
+  // Absent when the application is unknown or has no plug-ins.
+  std::optional<std::vector<EkDPlugInRef>> plugInsWithinApplication(std::string_view appUrl);
+
+  // Registers / unregisters a bundle with the registry: the Ekora error 2 when it refuses.
+  // The cache follows through the registry's notices.
+  std::optional<EkError> addPlugIn(std::string_view url);
+  std::optional<EkError> removePlugIn(std::string_view url);
+
+  std::optional<Dictionary> annotationForPlugIn(const EkDPlugIn& plugIn);
+  // Merges (or, when absent, removes) and saves at once. Posts nothing: the request handlers
+  // post once for all their changes with notifyAnnotationChange.
+  void setAnnotation(const std::optional<Dictionary>& annotation, const EkDPlugIn& plugIn);
+  void notifyAnnotationChange();
+  // Annotation changes from beginAnnotationChanges() until commitAnnotationChanges() reach
+  // memory at once and the file in one durable write at the commit. Run on the work queue.
+  void beginAnnotationChanges();
+  void commitAnnotationChanges();
+
+  // Elects a plug-in that holds the auto-elect entitlement unless a choice exists. Runs on
+  // _sync only.
+  void autoElect(const EkDPlugIn& plugIn);
+
+  // Registry notices.
+  void pluginsDidInstall(const std::vector<vantor::PlugInProxyPtr>& plugIns) override;
+  void pluginsWillUninstall(const std::vector<vantor::PlugInProxyPtr>& plugIns) override;
+  void localeDidChange() override;
+
+  void setDelegate(std::weak_ptr<EkDatabaseDelegate> delegate);
+  uint32_t cacheLimit() const { return cacheLimit_.load(); }
+  void setCacheLimit(uint32_t limit) { cacheLimit_ = limit; }
+  size_t cacheCount();
+
+  const std::shared_ptr<vantor::Registry>& workspace() const { return platform_.registry; }
+  const std::shared_ptr<notify::Notifier>& notifier() const { return platform_.notifier; }
+  const std::shared_ptr<SerialQueue>& databaseQueue() const { return sync_; }
+  // The store itself, for tests and the daemon's own checks; touch it only on _sync.
+  EkDAnnotationStore& annotations() { return *annotations_; }
+
+  // The election list of a query's "ZuUserElection": absent when there is none or a value
+  // does not normalise (then no election filter applies).
+  static std::optional<std::vector<std::string>> electionList(const Dictionary& query);
+  // "=1" and "1" give "1"; an empty value or one starting with an operator gives nothing.
+  static std::optional<std::string> normalizeElection(const Value& value);
+
+ protected:
+  EkDatabase() = default;
+
+ private:
+  bool electionFilter(const std::vector<std::string>& elections, const vantor::PlugInProxy& proxy);
+  EkDPlugInContext recordContext() const;
+
+  std::weak_ptr<EkDatabaseDelegate> delegate_;
+  std::atomic<uint32_t> cacheLimit_{1000000};
+  EkDatabasePlatform platform_;
+  std::unique_ptr<EkDAnnotationStore> annotations_;  // on _sync
+  std::shared_ptr<SerialQueue> sync_;
+  std::unordered_map<Uuid, EkDPlugInRef> cache_;  // on _sync
+};
+
+}  // namespace ek

@@ -1,0 +1,375 @@
+#include "ekd/EkDatabase.h"
+
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <filesystem>
+#include <future>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/dmap/Dmap.h"
+#include "platform/log/Log.h"
+#include "platform/vantor/FakeRegistry.h"
+
+namespace ek {
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr std::string_view kAutoElect = "com.corvane.developer.auto-elect-plugin";
+constexpr std::string_view kReplacePlugIn = "com.corvane.developer.replace-plugin";
+
+class TestDatabase : public EkDatabase, public EkDatabaseDelegate {
+ public:
+  TestDatabase() = default;
+  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) override {
+    std::lock_guard lock(mutex);
+    removed.push_back(plugIns);
+  }
+  std::mutex mutex;
+  std::vector<std::vector<vantor::PlugInProxyPtr>> removed;
+};
+
+// Log lines of one test.
+class CapturingSink : public log::Sink {
+ public:
+  void write(const log::Record& record) override {
+    std::lock_guard lock(mutex_);
+    lines_.emplace_back(record.message);
+  }
+  size_t count(std::string_view needle) const {
+    std::lock_guard lock(mutex_);
+    size_t n = 0;
+    for (const auto& line : lines_) n += line.find(needle) != std::string::npos;
+    return n;
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::vector<std::string> lines_;
+};
+
+class DatabaseTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    directory_ = fs::temp_directory_path() /
+                 ("ekdatabase-" + std::to_string(::getpid()) + "-" + Uuid::random().string());
+    fs::create_directories(directory_);
+    ::setenv("EKORA_STATE_DIR", directory_.c_str(), 1);
+    registry_ = std::make_shared<vantor::FakeRegistry>();
+    notifier_ = std::make_shared<notify::FakeNotifier>();
+    sink_ = std::make_shared<CapturingSink>();
+    log::setSink(sink_);
+    log::configure("debug");
+    open();
+  }
+  void TearDown() override {
+    log::configure("default");
+    log::setSink(nullptr);
+    database_.reset();
+    fs::remove_all(directory_);
+  }
+
+  void open() {
+    database_ = std::make_shared<TestDatabase>();
+    ASSERT_TRUE(
+        database_->initWithDatabase(annotationPath(), {registry_, nullptr, "/System", notifier_}));
+    database_->setDelegate(database_);
+    registry_->addObserver(database_);
+  }
+
+  std::string annotationPath() const { return (directory_ / "Annotations").string(); }
+
+  // Installs a plug-in inside an application (so it passes the record's checks).
+  vantor::PlugInProxy install(const std::string& identifier, Dictionary entitlements = {}) {
+    vantor::PlugInProxy proxy;
+    proxy.uuid = Uuid::random();
+    proxy.identifier = identifier;
+    proxy.originalIdentifier = identifier;
+    proxy.path = "/Applications/Host.app/PlugIns/" + identifier + ".appex";
+    proxy.url = vantor::fileUrlForPath(proxy.path);
+    proxy.containingAppPath = "/Applications/Host.app";
+    proxy.dataContainerPath = "/var/lib/ekora/containers/" + identifier;
+    proxy.entitlements = std::move(entitlements);
+    proxy.extensionPoint = "com.corvane.share";
+    proxy.info = Dictionary{
+        {"QvBundleIdentifier", Value(identifier)},
+        {"QvBundleVersion", Value("3")},
+        {"ZuExtension",
+         Value(Dictionary{
+             {"ZuExtensionPointIdentifier", Value("com.corvane.share")},
+             {"ZuExtensionAttributes",
+              Value(Dictionary{{"ZuExtensionPointIdentifier", Value("com.corvane.share")}})},
+         })},
+    };
+    registry_->install(proxy);
+    return proxy;
+  }
+
+  void drainRegistry() {
+    std::promise<void> drained;
+    registry_->queue()->async([&] { drained.set_value(); });
+    drained.get_future().wait();
+  }
+
+  std::optional<int64_t> storedElection(const std::string& key) {
+    std::optional<int64_t> election;
+    database_->databaseQueue()->sync([&] {
+      auto annotation = database_->annotations().annotationForIdentifier(key);
+      if (!annotation) return;
+      auto it = annotation->find("election");
+      if (it != annotation->end() && it->second.unsignedNumber()) {
+        election = static_cast<int64_t>(*it->second.unsignedNumber());
+      }
+    });
+    return election;
+  }
+
+  std::vector<std::string> identifiersOf(const std::optional<std::vector<EkDPlugInRef>>& found) {
+    std::vector<std::string> identifiers;
+    if (!found) return identifiers;
+    for (const auto& plugIn : *found) identifiers.push_back(plugIn->identifier().value_or(""));
+    std::sort(identifiers.begin(), identifiers.end());
+    return identifiers;
+  }
+
+  fs::path directory_;
+  std::shared_ptr<vantor::FakeRegistry> registry_;
+  std::shared_ptr<notify::FakeNotifier> notifier_;
+  std::shared_ptr<CapturingSink> sink_;
+  std::shared_ptr<TestDatabase> database_;
+};
+
+TEST_F(DatabaseTest, FindPlugInCachesTheRecordByUuid) {
+  auto proxy = install("com.example.a");
+  auto first = database_->findPlugIn(proxy.uuid);
+  ASSERT_NE(first, nullptr);
+  EXPECT_EQ(first->uuid(), proxy.uuid);
+  EXPECT_EQ(database_->findPlugIn(proxy.uuid), first);
+  EXPECT_EQ(database_->cacheCount(), 1u);
+  EXPECT_EQ(sink_->count("createPlugInForProxy"), 1u);
+}
+
+TEST_F(DatabaseTest, UnknownUuidAndPathAnswerNothingAndLog) {
+  EXPECT_EQ(database_->findPlugIn(Uuid::random()), nullptr);
+  EXPECT_EQ(sink_->count("Vantor cannot find plug-in with UUID:"), 1u);
+  EXPECT_EQ(database_->findPlugInAtPath("file:///nowhere/X.appex"), nullptr);
+  EXPECT_EQ(sink_->count("Vantor cannot find plug-in at path:file:///nowhere/X.appex"), 1u);
+  EXPECT_EQ(database_->cacheCount(), 0u);
+}
+
+TEST_F(DatabaseTest, FindPlugInAtPathUsesTheCache) {
+  auto proxy = install("com.example.a");
+  auto byUuid = database_->findPlugIn(proxy.uuid);
+  EXPECT_EQ(database_->findPlugInAtPath(proxy.url + "/"), byUuid);
+  EXPECT_EQ(database_->findPlugInAtPath(proxy.path), byUuid);
+}
+
+TEST_F(DatabaseTest, CacheLimitPurgesEverythingOnlyWhenExceeded) {
+  database_->setCacheLimit(2);
+  std::vector<vantor::PlugInProxy> proxies;
+  for (int i = 0; i < 4; ++i) proxies.push_back(install("com.example.p" + std::to_string(i)));
+  for (int i = 0; i < 3; ++i) ASSERT_NE(database_->findPlugIn(proxies[i].uuid), nullptr);
+  EXPECT_EQ(database_->cacheCount(), 3u);  // 2 is not greater than 2 when the third went in
+  EXPECT_EQ(registry_->clearCachesCount(), 0);
+  auto fourth = database_->findPlugIn(proxies[3].uuid);
+  EXPECT_EQ(database_->cacheCount(), 1u);
+  EXPECT_EQ(registry_->clearCachesCount(), 1);
+  EXPECT_EQ(sink_->count("purging cache for 3 > 2"), 1u);
+  EXPECT_EQ(database_->findPlugIn(proxies[3].uuid), fourth);
+}
+
+TEST_F(DatabaseTest, CacheLimitZeroKeepsOnlyTheNewestRecord) {
+  database_->setCacheLimit(0);
+  auto a = install("com.example.a");
+  auto b = install("com.example.b");
+  database_->findPlugIn(a.uuid);
+  database_->findPlugIn(b.uuid);
+  EXPECT_EQ(database_->cacheCount(), 1u);
+}
+
+TEST_F(DatabaseTest, LocaleChangeEmptiesTheCacheOnce) {
+  for (int i = 0; i < 10; ++i)
+    database_->findPlugIn(install("com.example.l" + std::to_string(i)).uuid);
+  ASSERT_EQ(database_->cacheCount(), 10u);
+  registry_->changeLocale();
+  drainRegistry();
+  EXPECT_EQ(database_->cacheCount(), 0u);  // the purge was queued before this sync
+  EXPECT_EQ(registry_->clearCachesCount(), 1);
+  EXPECT_EQ(sink_->count("locale change detected; purging cache"), 1u);
+}
+
+TEST_F(DatabaseTest, UninstallDropsTheCachedRecordAndTellsTheDelegateOnce) {
+  auto a = install("com.example.a");
+  auto b = install("com.example.b");
+  database_->findPlugIn(a.uuid);
+  drainRegistry();
+  ASSERT_TRUE(registry_->uninstall(a.uuid));
+  ASSERT_TRUE(registry_->uninstall(b.uuid));
+  EXPECT_EQ(database_->cacheCount(), 0u);
+  std::lock_guard lock(database_->mutex);
+  ASSERT_EQ(database_->removed.size(), 2u);
+  EXPECT_EQ(database_->removed[0].front()->uuid, a.uuid);
+  EXPECT_EQ(sink_->count("plug-in UNINSTALLED:com.example.a"), 1u);
+  EXPECT_EQ(sink_->count("plug-in INSTALLED:com.example.b"), 1u);
+}
+
+TEST_F(DatabaseTest, InstallNoticeLeavesTheCacheAlone) {
+  install("com.example.a");
+  drainRegistry();
+  EXPECT_EQ(database_->cacheCount(), 0u);
+  EXPECT_EQ(sink_->count("plug-in INSTALLED:com.example.a com.example.a(3)"), 0u);
+  EXPECT_EQ(sink_->count("plug-in INSTALLED:com.example.a com.example.a("), 1u);
+}
+
+TEST_F(DatabaseTest, AutoElectionElectsOnlyWithoutAChoice) {
+  Dictionary autoElect{{std::string(kAutoElect), Value(true)}};
+  auto fresh = install("com.example.fresh", autoElect);
+  auto two = install("com.example.two", autoElect);
+  auto zero = install("com.example.zero", autoElect);
+  auto off = install("com.example.off", Dictionary{{std::string(kAutoElect), Value(false)}});
+  database_->annotations();  // touched only on the queue below
+  database_->databaseQueue()->sync([&] {
+    database_->annotations().setAnnotation(
+        Dictionary{{"election", Value(uint64_t{2})}, {"extension", Value(Dictionary{})}},
+        "com.example.two");
+    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{0})}},
+                                           "com.example.zero");
+  });
+  for (const auto& proxy : {fresh, two, zero, off}) {
+    ASSERT_NE(database_->findPlugIn(proxy.uuid), nullptr);
+  }
+  EXPECT_EQ(storedElection("com.example.fresh"), 1);
+  EXPECT_EQ(storedElection("com.example.two"), 2);
+  EXPECT_EQ(storedElection("com.example.zero"), 1);
+  EXPECT_EQ(storedElection("com.example.off"), std::nullopt);
+  EXPECT_EQ(notifier_->posts().size(), 0u);  // auto-election posts nothing
+
+  // Written through: a fresh store on the same file sees the elections.
+  auto reopened = EkDAnnotationStore::initWithDatabase(annotationPath());
+  auto annotation = reopened->annotationForIdentifier("com.example.fresh");
+  ASSERT_TRUE(annotation.has_value());
+  EXPECT_EQ(annotation->at("election"), Value(uint64_t{1}));
+}
+
+TEST_F(DatabaseTest, ElectionValuesNormalise) {
+  EXPECT_EQ(EkDatabase::normalizeElection(Value("=1")), "1");
+  EXPECT_EQ(EkDatabase::normalizeElection(Value("1")), "1");
+  EXPECT_EQ(EkDatabase::normalizeElection(Value("a7")), "a7");
+  EXPECT_EQ(EkDatabase::normalizeElection(Value("<2")), std::nullopt);
+  EXPECT_EQ(EkDatabase::normalizeElection(Value("!1")), std::nullopt);
+  EXPECT_EQ(EkDatabase::normalizeElection(Value("")), std::nullopt);
+  EXPECT_EQ(EkDatabase::normalizeElection(Value(uint64_t{1})), std::nullopt);
+
+  auto list = [](Value value) {
+    return EkDatabase::electionList(Dictionary{{"ZuUserElection", std::move(value)}});
+  };
+  EXPECT_EQ(list(Value("=1")), (std::vector<std::string>{"1"}));
+  EXPECT_EQ(list(Value(Array{Value("1"), Value("=0")})), (std::vector<std::string>{"1", "0"}));
+  EXPECT_EQ(list(Value(Array{Value("1"), Value("<2")})), std::nullopt);
+  EXPECT_EQ(list(Value(uint64_t{1})), std::nullopt);
+  EXPECT_EQ(EkDatabase::electionList(Dictionary{}), std::nullopt);
+}
+
+TEST_F(DatabaseTest, QueryElectionFilterUsesStoredElectionsAutoElectAndReplacement) {
+  install("com.example.elected");
+  install("com.example.none");
+  install("com.example.wide");
+  install("com.example.auto", Dictionary{{std::string(kAutoElect), Value(uint64_t{1})}});
+  install("com.example.replacement",
+          Dictionary{{std::string(kReplacePlugIn), Value("com.example.elected")}});
+  database_->databaseQueue()->sync([&] {
+    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{1})}},
+                                           "com.example.elected");
+    // Only the low 8 bits take part: 257 counts as 1.
+    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{257})}},
+                                           "com.example.wide");
+  });
+  Dictionary elected{{"ZuExtensionPointIdentifier", Value("com.corvane.share")},
+                     {"ZuUserElection", Value("=1")}};
+  EXPECT_EQ(identifiersOf(database_->findPlugIns(elected)),
+            (std::vector<std::string>{"com.example.auto", "com.example.elected",
+                                      "com.example.replacement", "com.example.wide"}));
+
+  Dictionary unelected{{"ZuUserElection", Value("0")}};
+  EXPECT_EQ(identifiersOf(database_->findPlugIns(unelected)),
+            (std::vector<std::string>{"com.example.none"}));
+
+  // A value that does not normalise turns the filter off for the whole query.
+  Dictionary off{{"ZuUserElection", Value(Array{Value("1"), Value("<2")})}};
+  EXPECT_EQ(identifiersOf(database_->findPlugIns(off)).size(), 5u);
+  // Decimal text without leading zeros: "01" matches nothing.
+  Dictionary padded{{"ZuUserElection", Value("01")}};
+  EXPECT_EQ(database_->findPlugIns(padded), std::nullopt);
+}
+
+TEST_F(DatabaseTest, EmptyQueryAnswersEveryInstalledPlugInAndNothingWhenNoneIs) {
+  EXPECT_EQ(database_->findPlugIns({}), std::nullopt);
+  install("com.example.a");
+  install("com.example.b");
+  EXPECT_EQ(identifiersOf(database_->findPlugIns({})),
+            (std::vector<std::string>{"com.example.a", "com.example.b"}));
+}
+
+TEST_F(DatabaseTest, PlaceholderApplicationsPlugInsAreSkipped) {
+  vantor::ApplicationProxy app;
+  app.identifier = "com.example.host";
+  app.path = "/Applications/Host.app";
+  app.url = vantor::fileUrlForPath(app.path);
+  app.isPlaceholder = true;
+  registry_->addApplication(app);
+  install("com.example.a");
+  EXPECT_EQ(database_->findPlugIns({}).value_or(std::vector<EkDPlugInRef>{}).size(), 0u);
+  EXPECT_EQ(database_->cacheCount(), 0u);
+  EXPECT_EQ(sink_->count("because its app is a placeholder"), 1u);
+}
+
+TEST_F(DatabaseTest, PlugInsWithinApplication) {
+  EXPECT_EQ(database_->plugInsWithinApplication("/Applications/Empty.app"), std::nullopt);
+  vantor::ApplicationProxy app;
+  app.identifier = "com.example.host";
+  app.path = "/Applications/Host.app";
+  app.url = vantor::fileUrlForPath(app.path);
+  auto a = install("com.example.a");
+  auto b = install("com.example.b");
+  app.plugInUuids = {a.uuid, b.uuid};
+  registry_->addApplication(app);
+  auto found = database_->plugInsWithinApplication(app.url);
+  ASSERT_TRUE(found.has_value());
+  EXPECT_EQ(identifiersOf(found), (std::vector<std::string>{"com.example.a", "com.example.b"}));
+}
+
+TEST_F(DatabaseTest, RegistrationErrorsCarryCodeTwo) {
+  EXPECT_EQ(database_->addPlugIn("file:///Applications/X.app/PlugIns/Y.appex"), std::nullopt);
+  registry_->setRegisterResult(vantor::makeError(vantor::kMalformedBundle, "bad"));
+  registry_->setUnregisterResult(vantor::makeError(vantor::kNotRegistered, "unknown"));
+  auto added = database_->addPlugIn("file:///Applications/X.app/PlugIns/Y.appex");
+  ASSERT_TRUE(added.has_value());
+  EXPECT_EQ(added->code, 2);
+  EXPECT_EQ(added->message, "Vantor failed to register the plug-in");
+  auto removed = database_->removePlugIn("file:///Applications/X.app/PlugIns/Y.appex");
+  ASSERT_TRUE(removed.has_value());
+  EXPECT_EQ(removed->code, 2);
+  EXPECT_EQ(removed->message, "Vantor failed to deregister the plug-in");
+}
+
+TEST_F(DatabaseTest, AnnotationsMergeThroughTheDatabaseAndPostOnlyWhenAsked) {
+  auto proxy = install("com.example.a");
+  auto plugIn = database_->findPlugIn(proxy.uuid);
+  database_->setAnnotation(Dictionary{{"extension", Value(Dictionary{{"k", Value("v")}})}},
+                           *plugIn);
+  database_->setAnnotation(Dictionary{{"election", Value(uint64_t{1})}}, *plugIn);
+  auto annotation = database_->annotationForPlugIn(*plugIn);
+  ASSERT_TRUE(annotation.has_value());
+  EXPECT_EQ(annotation->size(), 2u);
+  EXPECT_EQ(notifier_->count("com.corvane.ekora.annotation-change"), 0u);
+  database_->notifyAnnotationChange();
+  EXPECT_EQ(notifier_->count("com.corvane.ekora.annotation-change"), 1u);
+  database_->setAnnotation(std::nullopt, *plugIn);
+  EXPECT_EQ(database_->annotationForPlugIn(*plugIn), std::nullopt);
+}
+
+}  // namespace
+}  // namespace ek

@@ -1,0 +1,59 @@
+// The "find" request, and the annotations every outgoing form carries.
+
+#include "Ekora/EkDaemonClient.h"
+#include "Ekora/EkFileURL.h"
+#include "Ekora/EkProtocol.h"
+#include "ekd/EkDPlugIn.h"
+#include "ekd/EkDServer.h"
+#include "ekd/Transaction.h"
+#include "platform/log/Log.h"
+
+namespace ek {
+
+std::shared_ptr<EkDPlugIn> Transaction::findPlugInByUUID(const Uuid& uuid) {
+  return server().findPlugIn(uuid);
+}
+
+std::shared_ptr<EkDPlugIn> Transaction::findPlugInByPathURL(const std::string& text) {
+  // A URL, not a bare path: text that does not parse as one locates nothing.
+  auto url = EkFileURL::parse(text);
+  if (!url) return nullptr;
+  return server().findPlugInAtPath(url->string());
+}
+
+void Transaction::addAnnotationForPlugIn(const EkDPlugIn& plugIn, Dictionary& form) {
+  auto annotation = server().annotationForPlugIn(plugIn);
+  form.insert_or_assign(std::string(protocol::kAnnotations),
+                        Value(annotation ? std::move(*annotation) : Dictionary{}));
+}
+
+void Transaction::findPlugIn() {
+  std::shared_ptr<EkDPlugIn> plugIn;
+  if (const Value* uuids = request_.body.get(protocol::kUuids)) {
+    if (const Uuid* uuid = uuids->uuid()) plugIn = findPlugInByUUID(*uuid);
+  }
+  if (const std::string* paths = request_.body.getString(protocol::kPaths)) {
+    // A usable location decides, also over a UUID that found something.
+    plugIn = findPlugInByPathURL(*paths);
+  }
+  if (!plugIn) {
+    log::ops().defaultLevel("plugin not found");
+    fail(protocol::kErrorNotFound, "Cannot locate PlugIn");
+    return;
+  }
+  log::ops().defaultLevel("plugin found %{public}@", *plugIn);
+  auto exported = plugIn->exportForm();
+  if (exported.error) {
+    log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(),
+                     *exported.error);
+  }
+  Dictionary form = std::move(exported.form);
+  addAnnotationForPlugIn(*plugIn, form);
+  plugIn->augmentForm(form);
+  if (auto converted = EkDaemonClient::convertToWyre(Value(std::move(form)), version())) {
+    reply_.insert_or_assign(std::string(protocol::kMatches), std::move(*converted));
+  }
+  done();
+}
+
+}  // namespace ek
