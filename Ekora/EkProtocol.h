@@ -40,6 +40,12 @@ inline constexpr std::string_view kBulkAnnotate = "bulk-annotate";
 inline constexpr std::string_view kLock = "lock";
 inline constexpr std::string_view kFind = "find";
 
+// Discovery flags of "match".
+inline constexpr uint64_t kDiscoverKeepVersions = 0x1;
+inline constexpr uint64_t kDiscoverKeepDuplicates = 0x4;
+inline constexpr uint64_t kDiscoverSystemOnly = 0x8;
+inline constexpr uint64_t kDiscoverAll = 0x200;
+
 // Error codes.
 inline constexpr int32_t kErrorUnresolved = -1;
 inline constexpr int32_t kErrorRegistry = 2;

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -15,6 +16,12 @@
 
 namespace ek {
 
+class EkDPlugIn;
+class EkDWyreClient;
+namespace types {
+class TypeSystem;
+}
+
 // What a daemon record needs from the daemon around it. The database that builds records hands
 // every record the same context.
 struct EkDPlugInContext {
@@ -27,6 +34,13 @@ struct EkDPlugInContext {
   // The system volume: plug-ins outside any application must lie below it. Empty means
   // $EKORA_SYSTEM_ROOT (else /System).
   std::string systemRoot;
+  // The plug-in's stored annotation (the database's annotationForPlugIn), read by matching on
+  // "ZuUserElection". Absent means no annotations are known. Must not be called from the
+  // database queue.
+  std::function<std::optional<Dictionary>(const EkDPlugIn&)> annotations;
+  // The type system that "?TY-CONFORMS:", "?TY-IS:" and activation rules consult; null means
+  // types::TypeSystem::system().
+  std::shared_ptr<types::TypeSystem> types;
 };
 
 // The daemon's record of one installed plug-in, built from the registry's proxy. Beside the
@@ -72,6 +86,21 @@ class EkDPlugIn : public EkPlugInCore {
   // "com.corvane.developer.replace-plugin" entitlement when that is a string, so a
   // replacement shares the elections of the plug-in it replaces; otherwise its own identifier.
   std::string annotationKey() const;
+
+  // Attribute matching. Never fails: anything that cannot be interpreted does not match.
+  // Every key/pattern pair of rules must match; absent or empty rules match every plug-in.
+  bool match(const Dictionary* rules) const;
+  bool matchKey(std::string_view key, const Value& pattern) const;
+  // A string pattern, or an array whose string elements are tried in turn.
+  bool matchValue(std::string_view value, const Value& patterns) const;
+  // One pattern string, with its leading operator ("?TY-CONFORMS:", "?TY-IS:", "<>", "<=",
+  // ">=", "=", "<", ">" or none).
+  bool matchValue(std::string_view value, std::string_view pattern) const;
+  // The plug-in's activation rule (value) against a host's item description.
+  bool matchDictionary(const Value& value, const Dictionary& pattern) const;
+
+  // Host permission: nothing when the host may use this plug-in, else the reason.
+  std::optional<std::string> allowForClient(const EkDWyreClient& client) const;
 
   // The base checks, then: a plug-in with code needs a data container, and a plug-in outside
   // any application must lie on the system volume. Code 12.

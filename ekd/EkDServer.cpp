@@ -4,6 +4,7 @@
 
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDPlugInHold.h"
+#include "ekd/EkDUserPrefs.h"
 #include "ekd/EkDWyreClient.h"
 #include "platform/log/Log.h"
 #include "platform/vantor/SqliteRegistry.h"
@@ -55,6 +56,7 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
   if (!server->initWithDatabase(server->databasePath_, std::move(databasePlatform))) {
     return nullptr;
   }
+  server->userPrefs_ = EkDUserPrefs::init(server->platform_.preferences);
   server->wyreQueue_ = SerialQueue::make("wyre");
   // Requests run on the thread that reads the sockets: a request then reaches its handler
   // without waking another thread, and handlers run one at a time all the same.

@@ -11,6 +11,7 @@
 #include "ekd/EkDatabase.h"
 #include "platform/codesign/CodeSigning.h"
 #include "platform/notify/Notifications.h"
+#include "platform/prefs/Preferences.h"
 #include "platform/queue/SerialQueue.h"
 #include "platform/sandbox/SandboxCheck.h"
 #include "platform/stard/ServiceManager.h"
@@ -20,6 +21,7 @@
 namespace ek {
 
 class EkDPlugInHold;
+class EkDUserPrefs;
 class EkDWyreClient;
 
 // The platform services the daemon reaches, replaceable by doubles in tests.
@@ -33,6 +35,10 @@ struct EkDPlatform {
   std::shared_ptr<notify::Notifier> notifier;
   // The tokens added to forms; null means the process's sandbox.
   std::shared_ptr<EkSandbox> extensions;
+  // The daemon user's preferences domains; null means the files of the state directory.
+  std::shared_ptr<prefs::Preferences> preferences;
+  // Null means the system's type hierarchy.
+  std::shared_ptr<types::TypeSystem> types;
 
   static EkDPlatform system();
 };
@@ -79,6 +85,7 @@ class EkDServer : public EkDatabase,
 
   const EkDPlatform& platform() const { return platform_; }
   const std::shared_ptr<vantor::Registry>& registry() const { return platform_.registry; }
+  const std::shared_ptr<EkDUserPrefs>& userPrefs() const { return userPrefs_; }
   const std::shared_ptr<SerialQueue>& mainQueue() const { return mainQueue_; }
   const std::shared_ptr<SerialQueue>& syncQueue() const { return syncQueue_; }
   const std::shared_ptr<wyre::Listener>& service() const { return service_; }
@@ -95,6 +102,7 @@ class EkDServer : public EkDatabase,
   std::shared_ptr<SerialQueue> syncQueue_;  // "serverSync": guards the hold list
   std::shared_ptr<wyre::Listener> service_;
   std::vector<std::shared_ptr<EkDPlugInHold>> holds_;  // on syncQueue_
+  std::shared_ptr<EkDUserPrefs> userPrefs_;
 };
 
 }  // namespace ek

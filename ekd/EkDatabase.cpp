@@ -71,8 +71,12 @@ bool EkDatabase::initWithDatabase(std::optional<std::string> path, EkDatabasePla
   return true;
 }
 
-EkDPlugInContext EkDatabase::recordContext() const {
-  return {platform_.registry, platform_.sandbox, platform_.systemRoot};
+EkDPlugInContext EkDatabase::recordContext() {
+  EkDPlugInContext context{platform_.registry, platform_.sandbox, platform_.systemRoot};
+  // The database outlives every record it builds.
+  context.annotations = [this](const EkDPlugIn& plugIn) { return annotationForPlugIn(plugIn); };
+  context.types = platform_.types;
+  return context;
 }
 
 void EkDatabase::setDelegate(std::weak_ptr<EkDatabaseDelegate> delegate) {

@@ -40,6 +40,8 @@ struct EkDatabasePlatform {
   std::string systemRoot;
   // Required.
   std::shared_ptr<notify::Notifier> notifier;
+  // Null means types::TypeSystem::system().
+  std::shared_ptr<types::TypeSystem> types;
 };
 
 // The daemon's view of the installed plug-ins: records built from the registry's proxies,
@@ -120,7 +122,7 @@ class EkDatabase : public vantor::RegistryObserver {
 
  private:
   bool electionFilter(const std::vector<std::string>& elections, const vantor::PlugInProxy& proxy);
-  EkDPlugInContext recordContext() const;
+  EkDPlugInContext recordContext();
 
   std::weak_ptr<EkDatabaseDelegate> delegate_;
   std::atomic<uint32_t> cacheLimit_{1000000};

@@ -200,9 +200,6 @@ void Transaction::notServed() {
 
 // Until the discovery, enabling and hold services join the daemon, these request types answer
 // with the frame's error reply.
-void Transaction::matchPlugIns() {
-  notServed();
-}
 void Transaction::readyPlugIns() {
   notServed();
 }

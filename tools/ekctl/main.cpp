@@ -21,6 +21,7 @@
 #include "Ekora/EkProtocol.h"
 #include "platform/json/WireJson.h"
 #include "platform/notify/Notifications.h"
+#include "platform/prefs/Preferences.h"
 #include "tools/ekctl/Output.h"
 
 namespace {
@@ -176,6 +177,54 @@ int watch(const std::vector<std::string>& names) {
   }
 }
 
+struct DefaultsArguments {
+  std::string domain;
+  std::string key;
+  bool hasKey = false;
+  std::string json;
+};
+
+// The current user's preferences domains, edited in place: no daemon is involved.
+int defaults(std::string_view action, const DefaultsArguments& args) {
+  if (auto valid = prefs::checkDomainName(args.domain); !valid) {
+    usageError(fmt::format("defaults: {}", valid.error().message));
+  }
+  std::optional<Value> newValue;
+  if (action == "write") newValue = parseJsonArgument(args.json, "the value");
+
+  auto opened = prefs::PreferencesDomain::open(args.domain);
+  if (!opened) {
+    std::fprintf(stderr, "ekctl: defaults: %s\n", opened.error().message.c_str());
+    return kReplyError;
+  }
+  prefs::PreferencesDomain& domain = **opened;
+  const auto fail = [&](const std::string& message) {
+    std::fprintf(stderr, "ekctl: defaults %.*s: %s\n", static_cast<int>(action.size()),
+                 action.data(), message.c_str());
+    return kReplyError;
+  };
+
+  if (action == "write") {
+    if (auto written = domain.set(args.key, std::move(*newValue)); !written) {
+      return fail(written.error().message);
+    }
+    return kSuccess;
+  }
+  if (auto error = domain.readError()) return fail(error->message);
+  if (!domain.exists()) return fail(fmt::format("domain {} does not exist", args.domain));
+  std::optional<Value> value = args.hasKey ? domain.value(args.key) : Value(domain.dictionary());
+  if (!value) {
+    return fail(fmt::format("key \"{}\" does not exist in domain {}", args.key, args.domain));
+  }
+  if (action == "read") {
+    std::cout << wirejson::write(*value, isatty(STDOUT_FILENO)) << "\n";
+    return kSuccess;
+  }
+  auto removed = args.hasKey ? domain.remove(args.key) : domain.removeAll();
+  if (!removed) return fail(removed.error().message);
+  return kSuccess;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -226,6 +275,20 @@ int main(int argc, char** argv) {
   std::vector<std::string> notificationNames;
   auto* watchCommand = app.add_subcommand("watch", "print notifications as they are posted");
   watchCommand->add_option("NAME", notificationNames, "notification names")->required();
+  DefaultsArguments defaultsArgs;
+  auto* defaultsCommand =
+      app.add_subcommand("defaults", "read and write the current user's preferences domains");
+  defaultsCommand->require_subcommand(1);
+  auto* defaultsRead = defaultsCommand->add_subcommand("read", "print a domain or one value");
+  defaultsRead->add_option("DOMAIN", defaultsArgs.domain)->required();
+  auto* readKey = defaultsRead->add_option("KEY", defaultsArgs.key);
+  auto* defaultsWrite = defaultsCommand->add_subcommand("write", "set one value, given as JSON");
+  defaultsWrite->add_option("DOMAIN", defaultsArgs.domain)->required();
+  defaultsWrite->add_option("KEY", defaultsArgs.key)->required();
+  defaultsWrite->add_option("JSON", defaultsArgs.json)->required();
+  auto* defaultsDelete = defaultsCommand->add_subcommand("delete", "remove a value or all of them");
+  defaultsDelete->add_option("DOMAIN", defaultsArgs.domain)->required();
+  auto* deleteKey = defaultsDelete->add_option("KEY", defaultsArgs.key);
 
   try {
     app.parse(argc, argv);
@@ -319,5 +382,14 @@ int main(int argc, char** argv) {
     });
   }
   if (watchCommand->parsed()) return watch(notificationNames);
+  if (defaultsCommand->parsed()) {
+    if (defaultsRead->parsed()) {
+      defaultsArgs.hasKey = readKey->count() > 0;
+      return defaults("read", defaultsArgs);
+    }
+    if (defaultsWrite->parsed()) return defaults("write", defaultsArgs);
+    defaultsArgs.hasKey = deleteKey->count() > 0;
+    return defaults("delete", defaultsArgs);
+  }
   return kUsage;
 }
