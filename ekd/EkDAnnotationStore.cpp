@@ -262,10 +262,13 @@ Result<void> EkDAnnotationStore::load(const std::string& path, bool& dataUsable)
 }
 
 Result<void> EkDAnnotationStore::saveDb() {
-  Dictionary root;
-  root.emplace(kVersionKey, Value(kVersion));
-  root.emplace(kDataKey, Value(annotations_));
-  std::string bytes = EK_TRY(dmap::write(Value(std::move(root))));
+  // The table is lent to the document and taken back: copying it at every change would cost
+  // more than writing it.
+  Value document(Dictionary{{std::string(kVersionKey), Value(kVersion)},
+                            {std::string(kDataKey), Value(std::move(annotations_))}});
+  Result<std::string> written = dmap::write(document);
+  annotations_ = std::move(*document.dictionary()->at(std::string(kDataKey)).dictionary());
+  std::string bytes = EK_TRY(std::move(written));
 
   std::filesystem::path directory = std::filesystem::path(annotationsURL_).parent_path();
   if (!directory.empty()) EK_TRY(paths::ensureDirectory(directory.string()));

@@ -6,6 +6,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "Ekora/EkPlugInCore.h"
 #include "Ekora/EkSandbox.h"
@@ -20,6 +21,12 @@ class EkDPlugIn;
 class EkDWyreClient;
 namespace types {
 class TypeSystem;
+}
+namespace stard {
+class ServiceManager;
+}
+namespace privo {
+class Consent;
 }
 
 // What a daemon record needs from the daemon around it. The database that builds records hands
@@ -41,6 +48,11 @@ struct EkDPlugInContext {
   // The type system that "?TY-CONFORMS:", "?TY-IS:" and activation rules consult; null means
   // types::TypeSystem::system().
   std::shared_ptr<types::TypeSystem> types;
+  // Where enableForClient declares the plug-in for a host and checkBusy finds its running
+  // instances; null means enabling fails (code 4) and nothing is busy.
+  std::shared_ptr<stard::ServiceManager> serviceManager;
+  // The privacy consent that allowedPrivoServices reads; null means nothing is granted.
+  std::shared_ptr<privo::Consent> consent;
 };
 
 // The daemon's record of one installed plug-in, built from the registry's proxy. Beside the
@@ -101,6 +113,20 @@ class EkDPlugIn : public EkPlugInCore {
 
   // Host permission: nothing when the host may use this plug-in, else the reason.
   std::optional<std::string> allowForClient(const EkDWyreClient& client) const;
+
+  // Declares the plug-in's executable to the service manager as an external service of the
+  // host, with its environment (the host's environment, then the data container's HOME,
+  // QVFIXED_USER_HOME and TMPDIR, then the plug-in's own "EnvironmentVariables") and its
+  // sandbox profile. Nothing on success, else code 4. Host entries that are not strings, or
+  // that no process environment could carry, are dropped.
+  std::optional<EkError> enableForClient(const EkDWyreClient& client,
+                                         const Dictionary* environment) const;
+  // The consent services the user granted to the containing application, sorted; empty for
+  // a plug-in outside any application.
+  std::vector<std::string> allowedPrivoServices() const;
+  // A description of the first busy instance of this plug-in ({kExtensionBundleIdentifierKey:
+  // its bundle identifier}), or nothing when none is busy.
+  std::optional<Dictionary> checkBusy() const;
 
   // The base checks, then: a plug-in with code needs a data container, and a plug-in outside
   // any application must lie on the system volume. Code 12.

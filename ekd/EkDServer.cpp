@@ -51,8 +51,13 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
   if (!server->platform_.notifier) {
     server->platform_.notifier = std::make_shared<notify::FileNotifier>();
   }
+  if (!server->platform_.consent) {
+    server->platform_.consent = std::make_shared<privo::FileConsent>();
+  }
   EkDatabasePlatform databasePlatform{
-      server->platform_.registry, server->platform_.extensions, {}, server->platform_.notifier};
+      server->platform_.registry, server->platform_.extensions, {},
+      server->platform_.notifier, server->platform_.types,      server->platform_.serviceManager,
+      server->platform_.consent};
   if (!server->initWithDatabase(server->databasePath_, std::move(databasePlatform))) {
     return nullptr;
   }

@@ -12,6 +12,7 @@
 #include "platform/codesign/CodeSigning.h"
 #include "platform/notify/Notifications.h"
 #include "platform/prefs/Preferences.h"
+#include "platform/privo/Consent.h"
 #include "platform/queue/SerialQueue.h"
 #include "platform/sandbox/SandboxCheck.h"
 #include "platform/stard/ServiceManager.h"
@@ -39,6 +40,8 @@ struct EkDPlatform {
   std::shared_ptr<prefs::Preferences> preferences;
   // Null means the system's type hierarchy.
   std::shared_ptr<types::TypeSystem> types;
+  // Null means the consent file of the state directory.
+  std::shared_ptr<privo::Consent> consent;
 
   static EkDPlatform system();
 };

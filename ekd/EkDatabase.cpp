@@ -76,6 +76,8 @@ EkDPlugInContext EkDatabase::recordContext() {
   // The database outlives every record it builds.
   context.annotations = [this](const EkDPlugIn& plugIn) { return annotationForPlugIn(plugIn); };
   context.types = platform_.types;
+  context.serviceManager = platform_.serviceManager;
+  context.consent = platform_.consent;
   return context;
 }
 

@@ -42,6 +42,10 @@ struct EkDatabasePlatform {
   std::shared_ptr<notify::Notifier> notifier;
   // Null means types::TypeSystem::system().
   std::shared_ptr<types::TypeSystem> types;
+  // Where records declare their services for hosts and find running instances.
+  std::shared_ptr<stard::ServiceManager> serviceManager;
+  // Null means nothing is granted.
+  std::shared_ptr<privo::Consent> consent;
 };
 
 // The daemon's view of the installed plug-ins: records built from the registry's proxies,

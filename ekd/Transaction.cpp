@@ -193,21 +193,4 @@ bool Transaction::processUuidList(const PlugInStep& step) {
   return true;
 }
 
-void Transaction::notServed() {
-  log::ops().info("client %d: request type not served by this daemon yet", client_->pid());
-  fail(protocol::kErrorInvalidRequest, protocol::kMsgUnrecognized);
-}
-
-// Until the discovery, enabling and hold services join the daemon, these request types answer
-// with the frame's error reply.
-void Transaction::readyPlugIns() {
-  notServed();
-}
-void Transaction::accessPlugIns() {
-  notServed();
-}
-void Transaction::lockDownPlugIns() {
-  notServed();
-}
-
 }  // namespace ek

@@ -81,8 +81,6 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
  private:
   Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client)
       : client_(std::move(client)), request_(std::move(request)) {}
-  // The answer of a request type whose service the daemon does not offer yet.
-  void notServed();
 
   std::shared_ptr<EkDWyreClient> client_;
   wyre::Message request_;

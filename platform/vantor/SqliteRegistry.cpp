@@ -948,6 +948,33 @@ void SqliteRegistry::reconcile() {
       log::vr().error("not registering system plug-in %s: %s", path, plugIn.error().message);
       continue;
     }
+    // A bundle registered exactly as it reads now is left alone: re-registering every system
+    // plug-in at each start would cost a commit, a knowledge change and notices per bundle.
+    bool unchanged = false;
+    {
+      std::lock_guard db(dbMutex_);
+      Use find(statements_->plugInByPath);
+      find.text(1, plugIn->path);
+      if (find.step() == SQLITE_ROW) {
+        sqlite3_stmt* row = find.get();
+        unchanged =
+            columnText(row, 2) == plugIn->identifier && columnText(row, 4) == plugIn->version &&
+            columnText(row, 5) == plugIn->appPath && columnText(row, 6) == plugIn->point &&
+            columnText(row, 11) == plugIn->container && columnDictionary(row, 7) == plugIn->info &&
+            columnDictionary(row, 8) == plugIn->sdk &&
+            columnDictionary(row, 9) == plugIn->entitlements &&
+            columnDictionary(row, 12) == plugIn->strings;
+      }
+    }
+    if (unchanged) {
+      if (plugIn->container) {
+        if (auto made = paths::ensureDirectory(paths::join(*plugIn->container, "tmp"));
+            !made.ok()) {
+          log::vr().error("cannot make the data container of %s: %s", path, made.error().message);
+        }
+      }
+      continue;
+    }
     plan.plugIns.push_back(std::move(plugIn).value());
     if (auto applied = applyPlan(plan); !applied.ok()) {
       log::vr().error("not registering system plug-in %s: %s", path, applied.error().message);
