@@ -92,8 +92,10 @@ std::vector<std::string> absolutePaths(const std::vector<std::string>& paths) {
 using Sender = std::function<void(EkDaemonClient&, EkDaemonClient::Reply)>;
 
 // Sends one request and waits for its reply.
-std::optional<Result<Value>> exchange(const Options& options, const Sender& sender) {
+std::optional<Result<Value>> exchange(const Options& options, const Sender& sender,
+                                      std::shared_ptr<EkDaemonClient>* keep = nullptr) {
   auto client = EkDaemonClient::initWithServiceName(options.service);
+  if (keep) *keep = client;
   auto promise = std::make_shared<std::promise<Result<Value>>>();
   auto future = promise->get_future();
   sender(*client, [promise](Result<Value> reply) { promise->set_value(std::move(reply)); });
@@ -103,8 +105,9 @@ std::optional<Result<Value>> exchange(const Options& options, const Sender& send
   return future.get();
 }
 
-int run(const Options& options, std::string_view command, const Sender& sender) {
-  auto reply = exchange(options, sender);
+int run(const Options& options, std::string_view command, const Sender& sender,
+        std::shared_ptr<EkDaemonClient>* keep = nullptr) {
+  auto reply = exchange(options, sender, keep);
   if (!reply) {
     std::fprintf(stderr, "ekctl: no reply from %s within %d s\n", options.service.c_str(),
                  options.timeoutSeconds);
@@ -267,7 +270,8 @@ int main(int argc, char** argv) {
   annotate->add_option("UUID", uuidTexts)->required();
   auto* bulkAnnotate = app.add_subcommand("bulk-annotate", "change annotations in bulk");
   bulkAnnotate->add_option("JSON", annotationsJson)->required();
-  auto* hold = app.add_subcommand("hold", "hold the plug-ins of bundles");
+  auto* hold = app.add_subcommand(
+      "hold", "hold the plug-ins of bundles until interrupted (SIGINT or SIGTERM releases them)");
   hold->add_option("--flags", flags);
   hold->add_option("PATH", paths)->required();
   auto* release = app.add_subcommand("release", "release a hold");
@@ -371,9 +375,19 @@ int main(int argc, char** argv) {
   }
   if (hold->parsed()) {
     auto absolute = absolutePaths(paths);
-    return run(options, "hold", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
-      c.holdPlugins(absolute, flags, std::move(r));
-    });
+    // A hold lasts as long as the connection that placed it: keep it open until interrupted.
+    std::shared_ptr<EkDaemonClient> connection;
+    int status = run(
+        options, "hold",
+        [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+          c.holdPlugins(absolute, flags, std::move(r));
+        },
+        &connection);
+    if (status != kSuccess) return status;
+    std::cout.flush();
+    ::signal(SIGINT, [](int) { _exit(kSuccess); });
+    ::signal(SIGTERM, [](int) { _exit(kSuccess); });
+    for (;;) ::pause();
   }
   if (release->parsed()) {
     Uuid uuid = parseUuid(uuidText);
