@@ -483,7 +483,8 @@ TEST_F(EnablingTest, MissingWyreServiceStartsFromAnEmptyService) {
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
   EXPECT_EQ(record->enableForClient(*client_, nullptr), std::nullopt);
-  const Dictionary& service = serviceOf(onlyOverlay());
+  const Dictionary overlay = onlyOverlay();
+  const Dictionary& service = serviceOf(overlay);
   EXPECT_EQ(service.size(), 3u);
   EXPECT_TRUE(sink_->has(log::Level::Info, "ops",
                          "no WyreService for plug-in; database returned not a dictionary"));
