@@ -59,7 +59,11 @@ const char* describe(FrameReader::Status status) {
 struct Worker {
   int fd = -1;
   FrameReader reader;
-  std::vector<uint8_t> frame;  // header + request body; only the id changes between sends
+  // The requests, sent in turn from next on; frame is header + the body being sent. With one
+  // request the frame is built once and only the id changes between sends.
+  std::span<const std::vector<uint8_t>> bodies;
+  size_t next = 0;
+  std::vector<uint8_t> frame;
   uint64_t nextId = 1;
   LoadResult result;
   Clock::time_point finished;
@@ -88,6 +92,12 @@ struct Worker {
   Outcome roundTrip(Clock::time_point& sent, Clock::time_point& received,
                     std::chrono::milliseconds timeout) {
     uint64_t id = nextId++;
+    if (bodies.size() > 1) {
+      const std::vector<uint8_t>& body = bodies[next];
+      next = next + 1 == bodies.size() ? 0 : next + 1;
+      frame.resize(wyre::kHeaderSize);
+      frame.insert(frame.end(), body.begin(), body.end());
+    }
     wyre::encodeHeader(
         {static_cast<uint32_t>(frame.size() - wyre::kHeaderSize), wyre::kFlagWantsReply, id},
         frame.data());
@@ -191,15 +201,35 @@ LoadResult combine(const std::vector<LoadResult>& runs) {
   return sum;
 }
 
+size_t firstRequestOf(unsigned connection, unsigned connections, size_t requests) {
+  if (connections == 0 || requests == 0) return 0;
+  // Both factors are bounded (connections and request lines), far from overflowing 64 bits.
+  return static_cast<size_t>(uint64_t{connection % connections} * requests / connections);
+}
+
 Result<LoadResult> runLoad(const LoadOptions& options, std::span<const uint8_t> body) {
+  std::vector<std::vector<uint8_t>> bodies{std::vector<uint8_t>(body.begin(), body.end())};
+  return runLoad(options, std::span<const std::vector<uint8_t>>(bodies));
+}
+
+Result<LoadResult> runLoad(const LoadOptions& options,
+                           std::span<const std::vector<uint8_t>> bodies) {
   if (options.connections == 0) return EkError::posix(EINVAL, "at least one connection is needed");
-  if (body.size() > wyre::kMaxBodySize) {
-    return EkError::posix(EMSGSIZE, "request body larger than a frame may carry");
+  if (bodies.empty()) return EkError::posix(EINVAL, "at least one request is needed");
+  for (const std::vector<uint8_t>& body : bodies) {
+    if (body.size() > wyre::kMaxBodySize) {
+      return EkError::posix(EMSGSIZE, "request body larger than a frame may carry");
+    }
   }
   std::vector<Worker> workers(options.connections);
-  for (Worker& worker : workers) {
+  for (size_t i = 0; i < workers.size(); ++i) {
+    Worker& worker = workers[i];
+    worker.bodies = bodies;
+    worker.next = firstRequestOf(static_cast<unsigned>(i), options.connections, bodies.size());
     worker.frame.resize(wyre::kHeaderSize);
-    worker.frame.insert(worker.frame.end(), body.begin(), body.end());
+    if (bodies.size() == 1) {
+      worker.frame.insert(worker.frame.end(), bodies[0].begin(), bodies[0].end());
+    }
     if (!worker.connect(options)) {
       EkError error = EkError::fromErrno(errno, "connecting to " + options.socketPath);
       for (Worker& opened : workers) opened.disconnect();

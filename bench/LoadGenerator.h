@@ -63,6 +63,15 @@ struct LoadResult {
 // connection cannot be opened at the start; everything after that is counted in the result.
 Result<LoadResult> runLoad(const LoadOptions& options, std::span<const uint8_t> body);
 
+// The same with several requests: each connection sends them in turn, wrapping around,
+// connection i of n starting at request i * bodies.size() / n, so that the connections do not
+// all ask for the same thing at once.
+Result<LoadResult> runLoad(const LoadOptions& options,
+                           std::span<const std::vector<uint8_t>> bodies);
+
+// The request connection `connection` of `connections` sends first among `requests`.
+size_t firstRequestOf(unsigned connection, unsigned connections, size_t requests);
+
 // Sums several runs: their requests, errors, failures, times and latencies.
 LoadResult combine(const std::vector<LoadResult>& runs);
 

@@ -4,9 +4,12 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <functional>
+#include <map>
 #include <mutex>
+#include <set>
 #include <thread>
 #include <tuple>
 
@@ -142,6 +145,87 @@ TEST(LoadGeneratorTest, RequestsWantRepliesCarryTheBodyAndIncreasingIds) {
   ASSERT_EQ(ids.size(), 20u);
   for (size_t i = 1; i < ids.size(); ++i) EXPECT_GT(ids[i], ids[i - 1]);
   for (const auto& received : bodies) EXPECT_EQ(received, body);
+}
+
+std::vector<std::vector<uint8_t>> numberedBodies(int count) {
+  std::vector<std::vector<uint8_t>> bodies;
+  for (int i = 0; i < count; ++i) {
+    bodies.push_back(cbor::encode(Value(Dictionary{{"request", "find"}, {"n", i}})));
+  }
+  return bodies;
+}
+
+TEST(LoadGeneratorTest, OneConnectionSendsSeveralRequestsInTurn) {
+  std::mutex mutex;
+  std::vector<std::vector<uint8_t>> received;
+  auto server = startServer([&](wyre::FrameHeader&, std::vector<uint8_t>& body) {
+    std::lock_guard lock(mutex);
+    received.push_back(body);
+    return Action::Reply;
+  });
+  ASSERT_TRUE(server);
+  std::vector<std::vector<uint8_t>> bodies = numberedBodies(3);
+  Result<LoadResult> result = runLoad(countedRun(*server, 7), bodies);
+  ASSERT_TRUE(result.ok()) << result.error().message;
+  EXPECT_EQ(result->requests, 7u);
+  EXPECT_EQ(result->failures, 0u);
+  std::lock_guard lock(mutex);
+  ASSERT_EQ(received.size(), 7u);
+  for (size_t i = 0; i < received.size(); ++i) EXPECT_EQ(received[i], bodies[i % 3]) << i;
+}
+
+TEST(LoadGeneratorTest, EachConnectionStartsAtItsOwnRequestAndWrapsAround) {
+  // The echo server serves each connection on its own thread.
+  std::mutex mutex;
+  std::map<std::thread::id, std::vector<std::vector<uint8_t>>> byConnection;
+  auto server = startServer([&](wyre::FrameHeader&, std::vector<uint8_t>& body) {
+    std::lock_guard lock(mutex);
+    byConnection[std::this_thread::get_id()].push_back(body);
+    return Action::Reply;
+  });
+  ASSERT_TRUE(server);
+  std::vector<std::vector<uint8_t>> bodies = numberedBodies(4);
+  Result<LoadResult> result = runLoad(countedRun(*server, 200, 2), bodies);
+  ASSERT_TRUE(result.ok()) << result.error().message;
+  EXPECT_EQ(result->failures, 0u);
+  std::lock_guard lock(mutex);
+  std::set<size_t> firsts;
+  for (const auto& [thread, sent] : byConnection) {
+    auto first = std::find(bodies.begin(), bodies.end(), sent.front());
+    ASSERT_NE(first, bodies.end());
+    size_t start = static_cast<size_t>(first - bodies.begin());
+    firsts.insert(start);
+    for (size_t i = 0; i < sent.size(); ++i) EXPECT_EQ(sent[i], bodies[(start + i) % 4]) << i;
+  }
+  EXPECT_EQ(byConnection.size(), firsts.size()) << "two connections began with the same request";
+  for (size_t start : firsts) EXPECT_TRUE(start == 0 || start == 2) << start;
+}
+
+TEST(LoadGeneratorTest, FirstRequestsSpreadOverTheList) {
+  const std::vector<std::tuple<unsigned, unsigned, size_t, size_t>> cases = {
+      {0, 1, 10, 0}, {0, 16, 10000, 0}, {1, 16, 10000, 625}, {15, 16, 10000, 9375}, {3, 4, 2, 1},
+      {1, 4, 2, 0},  {2, 3, 1, 0},      {0, 0, 5, 0},        {5, 4, 8, 2},          {7, 8, 0, 0},
+  };
+  for (const auto& [connection, connections, requests, expected] : cases) {
+    EXPECT_EQ(firstRequestOf(connection, connections, requests), expected)
+        << connection << " of " << connections << ", " << requests << " requests";
+  }
+}
+
+TEST(LoadGeneratorTest, NoRequestsIsAnError) {
+  auto server = startServer();
+  ASSERT_TRUE(server);
+  std::vector<std::vector<uint8_t>> none;
+  EXPECT_FALSE(runLoad(countedRun(*server, 1), none).ok());
+}
+
+TEST(LoadGeneratorTest, AnOversizedRequestAmongSeveralIsRefusedBeforeConnecting) {
+  auto server = startServer();
+  ASSERT_TRUE(server);
+  std::vector<std::vector<uint8_t>> bodies = numberedBodies(2);
+  bodies.emplace_back(wyre::kMaxBodySize + 1, 0);
+  EXPECT_FALSE(runLoad(countedRun(*server, 1), bodies).ok());
+  EXPECT_EQ(server->accepted(), 0u);
 }
 
 TEST(LoadGeneratorTest, EchoServerAnswersOnlyRequestsThatWantAReply) {

@@ -6,6 +6,7 @@
 
 #include <CLI/CLI.hpp>
 #include <cstdio>
+#include <fstream>
 #include <iostream>
 #include <memory>
 #include <nlohmann/json.hpp>
@@ -33,6 +34,10 @@ constexpr int kSetupFailed = 3;
 
 // With --count alone the run still ends by itself.
 constexpr double kCountTimeLimitSeconds = 600;
+// Bounds of a --requests file: lines, bytes per line, bytes in all.
+constexpr size_t kMaxRequestLines = size_t{1} << 20;
+constexpr size_t kMaxRequestLineBytes = 64 * 1024;
+constexpr size_t kMaxRequestFileBytes = size_t{256} << 20;
 // Used by --echo-self-test when no request is given: a typical small request map.
 constexpr const char* kSelfTestRequest =
     R"({"request":"find","version":3,"flags":0,"uuids":{"$uuid":"E621E1F8-C36C-495A-93FC-0C247A3E6E5F"},"paths":"/opt/Bench.app","environment":{}})";
@@ -50,6 +55,20 @@ struct Options {
   bool echoSelfTest = false;
   bool json = false;
   std::string request;
+  std::string requestsFile;
+};
+
+// The encoded requests, and what the report says about them.
+struct Requests {
+  std::vector<std::vector<uint8_t>> bodies;
+  size_t smallest = 0;
+  size_t largest = 0;
+
+  std::string describe(const Options& options) const {
+    if (bodies.size() == 1) return fmt::format("request of {} bytes (CBOR)", largest);
+    return fmt::format("{} requests of {} to {} bytes (CBOR) from {}", bodies.size(), smallest,
+                       largest, options.requestsFile);
+  }
 };
 
 struct Runs {
@@ -92,15 +111,15 @@ std::string row(const std::string& name, const LoadResult& run) {
       run.errorReplies, run.failures);
 }
 
-void printReadable(const Options& options, size_t bodySize, const std::vector<Runs>& all) {
+void printReadable(const Options& options, const Requests& requests, const std::vector<Runs>& all) {
   std::string bound =
       options.count ? fmt::format("{} requests (at most {:.0f} s)", options.count, options.duration)
                     : fmt::format("{:.1f} s", options.duration);
   fmt::print(
-      "ekbench: {} connection{}, {} measured after {:.1f} s warm-up, {} round{}, request of {} "
-      "bytes (CBOR); latencies in µs\n",
+      "ekbench: {} connection{}, {} measured after {:.1f} s warm-up, {} round{}, {}; latencies "
+      "in µs\n",
       options.connections, options.connections == 1 ? "" : "s", bound, options.warmup,
-      options.rounds, options.rounds == 1 ? "" : "s", bodySize);
+      options.rounds, options.rounds == 1 ? "" : "s", requests.describe(options));
   for (const Runs& runs : all) fmt::print("{:<12} {}\n", runs.label, runs.socket);
   fmt::print("{:<12} {:>10} {:>8} {:>10} {:>9} {:>9} {:>9} {:>9} {:>7} {:>8}\n", "run", "requests",
              "seconds", "req/s", "p50", "p90", "p99", "max", "errors", "failures");
@@ -131,14 +150,20 @@ void printReadable(const Options& options, size_t bodySize, const std::vector<Ru
   }
 }
 
-void printJson(const Options& options, size_t bodySize, const std::vector<Runs>& all) {
+void printJson(const Options& options, const Requests& requests, const std::vector<Runs>& all) {
   nlohmann::ordered_json out;
   out["connections"] = options.connections;
   out["duration_s"] = options.duration;
   out["warmup_s"] = options.warmup;
   if (options.count) out["count"] = options.count;
   out["rounds"] = options.rounds;
-  out["request_bytes"] = bodySize;
+  if (requests.bodies.size() == 1) {
+    out["request_bytes"] = requests.largest;
+  } else {
+    out["requests_file"] = options.requestsFile;
+    out["request_count"] = requests.bodies.size();
+    out["request_bytes"] = {{"min", requests.smallest}, {"max", requests.largest}};
+  }
   for (const Runs& runs : all) {
     nlohmann::ordered_json entry = toJson(ek::bench::combine(runs.rounds));
     entry["socket"] = runs.socket;
@@ -173,6 +198,67 @@ std::optional<std::string> readRequestText(const Options& options) {
   return std::nullopt;
 }
 
+// Parses and encodes one request; the error says what is wrong with it.
+ek::Result<std::vector<uint8_t>> encodeRequest(std::string_view text) {
+  ek::Result<ek::Value> request = ek::wirejson::parse(text);
+  if (!request) return request.error();
+  std::vector<uint8_t> body = ek::cbor::encode(*request);
+  if (body.size() > ek::wyre::kMaxBodySize) {
+    return ek::EkError::posix(EMSGSIZE, "the request is larger than a frame may carry");
+  }
+  return body;
+}
+
+void add(Requests& requests, std::vector<uint8_t> body) {
+  requests.smallest =
+      requests.bodies.empty() ? body.size() : std::min(requests.smallest, body.size());
+  requests.largest = std::max(requests.largest, body.size());
+  requests.bodies.push_back(std::move(body));
+}
+
+// One request in wire JSON per line; empty lines are skipped.
+ek::Result<Requests> readRequestsFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  if (!in) return ek::EkError::fromErrno(errno, "opening " + path);
+  Requests requests;
+  std::string line;
+  size_t number = 0;
+  size_t total = 0;
+  for (;;) {
+    line.clear();
+    char c;
+    while (in.get(c) && c != '\n') {
+      if (line.size() == kMaxRequestLineBytes) {
+        return ek::EkError::posix(EMSGSIZE, fmt::format("{}:{}: a line longer than {} bytes", path,
+                                                        number + 1, kMaxRequestLineBytes));
+      }
+      line += c;
+    }
+    if (line.empty() && !in) break;
+    ++number;
+    total += line.size() + 1;
+    if (total > kMaxRequestFileBytes) {
+      return ek::EkError::posix(EFBIG,
+                                fmt::format("{}: more than {} bytes", path, kMaxRequestFileBytes));
+    }
+    if (!line.empty() && line.back() == '\r') line.pop_back();
+    if (line.empty()) continue;
+    if (requests.bodies.size() == kMaxRequestLines) {
+      return ek::EkError::posix(E2BIG,
+                                fmt::format("{}: more than {} requests", path, kMaxRequestLines));
+    }
+    ek::Result<std::vector<uint8_t>> body = encodeRequest(line);
+    if (!body) {
+      return ek::EkError::posix(EINVAL,
+                                fmt::format("{}:{}: {}", path, number, body.error().message));
+    }
+    add(requests, std::move(body).value());
+  }
+  if (in.bad()) return ek::EkError::posix(EIO, "reading " + path);
+  if (requests.bodies.empty()) return ek::EkError::posix(EINVAL, path + ": no request in it");
+  return requests;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -201,7 +287,12 @@ int main(int argc, char** argv) {
                                 "measure only the in-process echo server");
   selfTest->excludes(baseline)->excludes(service)->excludes(socket);
   app.add_flag("--json", options.json, "print one JSON object");
-  app.add_option("REQUEST_JSON", options.request, "the request in wire JSON, or - for stdin");
+  auto* requestsFile = app.add_option(
+      "--requests", options.requestsFile,
+      "a file of requests in wire JSON, one per line, sent in turn (each connection starting "
+      "at a different one)");
+  app.add_option("REQUEST_JSON", options.request, "the request in wire JSON, or - for stdin")
+      ->excludes(requestsFile);
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -211,20 +302,26 @@ int main(int argc, char** argv) {
   if (options.count && duration->count() == 0) options.duration = kCountTimeLimitSeconds;
   if (options.rounds == 0) options.rounds = options.baseline ? 2 : 1;
 
-  std::optional<std::string> text = readRequestText(options);
-  if (!text) {
-    std::fprintf(stderr, "ekbench: a request in wire JSON is needed\n");
-    return kUsage;
-  }
-  ek::Result<ek::Value> request = ek::wirejson::parse(*text);
-  if (!request) {
-    std::fprintf(stderr, "ekbench: invalid request: %s\n", request.error().message.c_str());
-    return kUsage;
-  }
-  std::vector<uint8_t> body = ek::cbor::encode(*request);
-  if (body.size() > ek::wyre::kMaxBodySize) {
-    std::fprintf(stderr, "ekbench: the request is larger than a frame may carry\n");
-    return kUsage;
+  Requests requests;
+  if (!options.requestsFile.empty()) {
+    ek::Result<Requests> read = readRequestsFile(options.requestsFile);
+    if (!read) {
+      std::fprintf(stderr, "ekbench: %s\n", read.error().message.c_str());
+      return kUsage;
+    }
+    requests = std::move(read).value();
+  } else {
+    std::optional<std::string> text = readRequestText(options);
+    if (!text) {
+      std::fprintf(stderr, "ekbench: a request in wire JSON is needed\n");
+      return kUsage;
+    }
+    ek::Result<std::vector<uint8_t>> body = encodeRequest(*text);
+    if (!body) {
+      std::fprintf(stderr, "ekbench: invalid request: %s\n", body.error().message.c_str());
+      return kUsage;
+    }
+    add(requests, std::move(body).value());
   }
   if (!options.service.empty() && !ek::wyre::isValidServiceName(options.service)) {
     std::fprintf(stderr, "ekbench: invalid service name: %s\n", options.service.c_str());
@@ -261,7 +358,8 @@ int main(int argc, char** argv) {
       if (options.count) load.count = options.count;
       load.replyTimeout = std::chrono::milliseconds(
           std::max<int64_t>(1, static_cast<int64_t>(options.timeout * 1000)));
-      ek::Result<LoadResult> result = ek::bench::runLoad(load, body);
+      ek::Result<LoadResult> result =
+          ek::bench::runLoad(load, std::span<const std::vector<uint8_t>>(requests.bodies));
       if (!result) {
         std::fprintf(stderr, "ekbench: %s\n", result.error().message.c_str());
         return kSetupFailed;
@@ -271,9 +369,9 @@ int main(int argc, char** argv) {
   }
 
   if (options.json) {
-    printJson(options, body.size(), all);
+    printJson(options, requests, all);
   } else {
-    printReadable(options, body.size(), all);
+    printReadable(options, requests, all);
   }
 
   int status = kSuccess;
