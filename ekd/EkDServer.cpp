@@ -1,5 +1,7 @@
 #include "ekd/EkDServer.h"
 
+#include <malloc.h>
+
 #include <mutex>
 
 #include "Ekora/EkProtocol.h"
@@ -44,6 +46,9 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
       return nullptr;
     }
     server->platform_.registry = std::move(registry).value();
+    // The start-up scan reads every registered plug-in once; give that heap back rather than
+    // keep it for the daemon's life.
+    ::malloc_trim(0);
   }
   if (!server->platform_.serviceManager) {
     server->platform_.serviceManager = std::make_shared<stard::FileServiceManager>();

@@ -3,6 +3,7 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <fstream>
 #include <thread>
 
@@ -141,6 +142,34 @@ TEST_F(DaemonFaults, ClientThatNeverReadsIsCutOffWithoutStallingOthers) {
       << "the daemon kept a connection that never reads";
   expectServed();
   EXPECT_NE(daemon_.log().find("does not read its replies"), std::string::npos) << daemon_.log();
+}
+
+TEST_F(DaemonFaults, AnswerLargerThanTheBoundOnUnsentRepliesIsStillSent) {
+  // A form carrying a 9 MiB annotation: one reply above the 8 MiB bound, from a client that
+  // reads it. Only what piles up behind an unread reply is bounded.
+  namespace fs = std::filesystem;
+  fs::path app = daemon_.root().path() / "Notes.app";
+  fs::copy(fs::path(EXAMPLES_DIR) / "Applications" / "Notes.app", app, fs::copy_options::recursive);
+  auto added = daemon_.ask(request("add", {{"paths", Value(Array{Value(app.string())})}}));
+  ASSERT_TRUE(added && replyErrorCode(*added) == 0);
+  auto found = daemon_.ask(
+      request("find", {{"paths", Value("file://" + (app / "PlugIns/Share.appex").string())}}));
+  ASSERT_TRUE(found && found->get("matches"));
+  Uuid uuid = *Uuid::parse(*found->get("matches")->getString("uuid"));
+  std::string blob(9u << 20, 'x');
+  auto annotated = daemon_.ask(request(
+      "annotate", {{"annotations", Value(Dictionary{{"extension", Dictionary{{"blob", blob}}}})},
+                   {"uuids", Value(Array{Value(uuid)})}}));
+  ASSERT_TRUE(annotated && replyErrorCode(*annotated) == 0);
+
+  auto big = daemon_.ask(request("find", {{"uuids", Value(uuid)}}), std::chrono::seconds(120));
+  ASSERT_TRUE(big.has_value()) << daemon_.log();
+  const Value* form = big->get("matches");
+  ASSERT_TRUE(form);
+  const Dictionary* annotations = form->getDictionary("annotations");
+  ASSERT_TRUE(annotations);
+  EXPECT_EQ(annotations->at("extension").getString("blob")->size(), blob.size());
+  expectServed();
 }
 
 TEST_F(DaemonFaults, ClientDyingWithQueuedRequestsDoesNotDisturbTheDaemon) {

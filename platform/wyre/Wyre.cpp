@@ -297,7 +297,9 @@ void Connection::enqueueOutput(std::vector<uint8_t> frame, bool answersRequest) 
         frame.erase(frame.begin(), frame.begin() + n);
       }
     }
-    if (!failNow && queuedBytes_ + frame.size() > kMaxQueuedOutput) {
+    // One frame of any size a frame may have is always taken: a large answer is not a peer
+    // that fails to read. What piles up behind it is bounded.
+    if (!failNow && queuedBytes_ > 0 && queuedBytes_ + frame.size() > kMaxQueuedOutput) {
       log::process().error("closing connection from pid=%d: it does not read its replies", pid());
       failNow = true;
     }

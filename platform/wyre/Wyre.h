@@ -29,7 +29,8 @@ inline constexpr size_t kHeaderSize = 16;
 inline constexpr uint32_t kMaxBodySize = 64u << 20;
 inline constexpr uint32_t kFlagWantsReply = 1u << 0;
 inline constexpr uint32_t kFlagReply = 1u << 1;
-// Replies a peer has not read yet beyond this close its connection.
+// Replies a peer has not read yet beyond this close its connection; a single frame larger than
+// this is still sent.
 inline constexpr size_t kMaxQueuedOutput = 8u << 20;
 // A connection stops reading while this many of its requests are unanswered.
 inline constexpr size_t kMaxUnansweredRequests = 256;
