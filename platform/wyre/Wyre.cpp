@@ -12,8 +12,11 @@
 #include <asio/read.hpp>
 #include <asio/write.hpp>
 
+#include <condition_variable>
+#include <cstdlib>
 #include <cstring>
 #include <future>
+#include <mutex>
 #include <thread>
 
 #include "platform/cbor/Cbor.h"
@@ -45,14 +48,52 @@ uint32_t getU32(const uint8_t* p) {
 
 }  // namespace
 
+namespace {
+
+// Threads still inside the I/O context's run loop.
+std::mutex gRunningMutex;
+std::condition_variable gRunningChanged;
+int gRunning = 0;
+
+void runIo(asio::io_context& context) {
+  context.run();
+  std::lock_guard lock(gRunningMutex);
+  --gRunning;
+  gRunningChanged.notify_all();
+}
+
+// At exit the I/O threads stop before static objects go: a socket failing during exit would
+// otherwise compare its error code against error categories already destroyed.
+void stopIoAtExit() {
+  asio::io_context& context = ioContext();
+  context.stop();
+  std::unique_lock lock(gRunningMutex);
+  // Bounded: exit called from an I/O thread itself, or a handler that never returns, must not
+  // keep the process from ending.
+  gRunningChanged.wait_for(lock, std::chrono::seconds(2), [] { return gRunning == 0; });
+}
+
+}  // namespace
+
 asio::io_context& ioContext() {
   // Never destroyed: sockets may still be served while the process exits.
   static asio::io_context* context = new asio::io_context(2);
   static auto* work = [] {
     auto* guard =
         new asio::executor_work_guard<asio::io_context::executor_type>(context->get_executor());
-    std::thread([] { context->run(); }).detach();
-    std::thread([] { context->run(); }).detach();
+    // The categories error codes compare against, made now so that they are destroyed only
+    // after stopIoAtExit has run (exit runs handlers and destructors in reverse order).
+    (void)asio::error::get_misc_category();
+    (void)asio::error::get_netdb_category();
+    (void)asio::error::get_addrinfo_category();
+    (void)asio::system_category();
+    {
+      std::lock_guard lock(gRunningMutex);
+      gRunning = 2;
+    }
+    std::thread([] { runIo(*context); }).detach();
+    std::thread([] { runIo(*context); }).detach();
+    std::atexit(stopIoAtExit);
     return guard;
   }();
   (void)work;
