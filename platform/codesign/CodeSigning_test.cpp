@@ -181,36 +181,24 @@ TEST_F(CodeSigningFiles, MissingExecutableHasNone) {
 }
 
 // The test binary itself stands in for a client: its entitlements file is placed next to it.
-class CodeSigningSelf : public ::testing::Test {
- protected:
-  void SetUp() override {
-    auto path = executablePathForPid(getpid());
-    ASSERT_TRUE(path);
-    entitlements_ = *path + ".entitlements";
-  }
-  void TearDown() override { std::filesystem::remove(entitlements_); }
-  std::string entitlements_;
-};
-
-TEST_F(CodeSigningSelf, TaskAnswersTheProcessEntitlements) {
-  writeFile(entitlements_, dmapText(Value(kEntitlements)), 0644);
+// CTest runs each case in its own process at the same time, so only one case may own that file.
+TEST(CodeSigningSelf, TaskAnswersTheProcessEntitlementsAsReadWhenMade) {
+  auto path = executablePathForPid(getpid());
+  ASSERT_TRUE(path);
+  const std::string entitlements = *path + ".entitlements";
+  writeFile(entitlements, dmapText(Value(kEntitlements)), 0644);
   auto task = CodeSigning::system()->taskForAuditToken(AuditToken::self());
+  std::filesystem::remove(entitlements);
   ASSERT_TRUE(task);
   auto value = task->entitlementValue("com.corvane.ekd.private");
   ASSERT_TRUE(value.ok());
   EXPECT_EQ(*value, std::optional<Value>(Value(true)));
+  auto level = task->entitlementValue("com.corvane.ekd.level");
+  ASSERT_TRUE(level.ok());
+  EXPECT_EQ(*level, std::optional<Value>(Value(3)));
   auto missing = task->entitlementValue("com.corvane.ekd.other");
   ASSERT_TRUE(missing.ok());
   EXPECT_FALSE(missing->has_value());
-}
-
-TEST_F(CodeSigningSelf, TaskKeepsWhatItReadWhenMade) {
-  writeFile(entitlements_, dmapText(Value(kEntitlements)), 0644);
-  auto task = CodeSigning::system()->taskForAuditToken(AuditToken::self());
-  std::filesystem::remove(entitlements_);
-  auto value = task->entitlementValue("com.corvane.ekd.level");
-  ASSERT_TRUE(value.ok());
-  EXPECT_EQ(*value, std::optional<Value>(Value(3)));
 }
 
 // Runs a copy of sleep from the test's directory and answers its pid once it has exec'd.
