@@ -1,0 +1,163 @@
+#!/usr/bin/env bash
+# Builds the Debian package from a build tree, unpacks it into a scratch root, checks what it
+# holds, then runs the packaged ekd on private directories and queries it with the packaged
+# ekctl.
+#
+# Usage: package_test.sh CPACK BUILD_DIR SOURCE_DIR
+set -euo pipefail
+
+if [[ $# -ne 3 ]]; then
+  echo "usage: $0 CPACK BUILD_DIR SOURCE_DIR" >&2
+  exit 2
+fi
+cpack=$1
+build=$2
+source=$3
+
+scratch=$(mktemp -d "${TMPDIR:-/tmp}/ekora-package-XXXXXX")
+ekd_pid=
+
+cleanup() {
+  if [[ -n $ekd_pid ]]; then
+    kill -KILL "$ekd_pid" 2>/dev/null || true
+    wait "$ekd_pid" 2>/dev/null || true
+  fi
+  rm -rf "$scratch"
+}
+trap cleanup EXIT
+trap 'exit 130' INT
+trap 'exit 143' TERM HUP
+
+fail() {
+  echo "package_test: FAILED: $*" >&2
+  if [[ -s $scratch/ekd.log ]]; then
+    echo "--- ekd log" >&2
+    tail -n 50 "$scratch/ekd.log" >&2
+  fi
+  exit 1
+}
+
+for tool in dpkg-deb groff timeout; do
+  command -v "$tool" >/dev/null || fail "$tool is not installed"
+done
+[[ -f $build/CPackConfig.cmake ]] || fail "no CPackConfig.cmake in $build"
+
+# --- Build the package -------------------------------------------------------------------
+echo "building the package"
+if ! timeout 45 "$cpack" -G DEB -B "$scratch/package" --config "$build/CPackConfig.cmake" \
+  >"$scratch/cpack.log" 2>&1; then
+  cat "$scratch/cpack.log" >&2
+  fail "cpack did not build the package"
+fi
+shopt -s nullglob
+debs=("$scratch"/package/*.deb)
+shopt -u nullglob
+[[ ${#debs[@]} -eq 1 ]] || fail "expected one .deb, found ${#debs[@]}"
+deb=${debs[0]}
+echo "built $(basename "$deb")"
+
+[[ $(dpkg-deb -f "$deb" Package) == ekora ]] || fail "package name is not ekora"
+depends=$(dpkg-deb -f "$deb" Depends)
+[[ $depends == *libc6* ]] || fail "Depends lacks libc6: '$depends'"
+[[ -n $(dpkg-deb -f "$deb" Maintainer) ]] || fail "no Maintainer"
+[[ -n $(dpkg-deb -f "$deb" Description) ]] || fail "no Description"
+
+# --- Contents ----------------------------------------------------------------------------
+root=$scratch/root
+dpkg-deb -x "$deb" "$root" || fail "dpkg-deb could not extract the package"
+
+expected="./usr/bin/ek-sandbox-exec
+./usr/bin/ekctl
+./usr/lib/systemd/system/ekd.service
+./usr/lib/systemd/system/ekd.socket
+./usr/sbin/ekd
+./usr/share/man/man1/ekctl.1
+./usr/share/man/man8/ekd.8"
+actual=$(cd "$root" && find . ! -type d | LC_ALL=C sort)
+if [[ $actual != "$expected" ]]; then
+  diff <(echo "$expected") <(echo "$actual") >&2 || true
+  fail "the package holds other files than the runtime programs, units and manual pages"
+fi
+for program in usr/sbin/ekd usr/bin/ekctl usr/bin/ek-sandbox-exec; do
+  [[ -x $root/$program ]] || fail "$program is not executable"
+done
+
+for page in "$root/usr/share/man/man8/ekd.8" "$root/usr/share/man/man1/ekctl.1"; do
+  warnings=$(LC_ALL=C.UTF-8 groff -man -Tutf8 -ww -z "$page" 2>&1) ||
+    fail "groff could not format $(basename "$page")"
+  [[ -z $warnings ]] || fail "$(basename "$page") formats with warnings: $warnings"
+done
+
+# Every command and global option that ekctl offers has an entry in its manual page.
+manual=$(LC_ALL=C.UTF-8 groff -man -Tutf8 -P-cbou "$root/usr/share/man/man1/ekctl.1")
+help=$(timeout 10 "$root/usr/bin/ekctl" --help) || fail "ekctl --help failed"
+commands=$(awk '/^Subcommands:/ { listing = 1; next } listing && NF { print $1 }' <<<"$help")
+[[ -n $commands ]] || fail "ekctl --help lists no commands"
+for entry in $commands -S --json --timeout; do
+  grep -qE -- "^ {7}${entry}( |$)" <<<"$manual" || fail "ekctl.1 does not document $entry"
+done
+
+# --- Run the packaged daemon ---------------------------------------------------------------
+run=$scratch/run
+state=$scratch/state
+system=$scratch/System
+mkdir -p "$run" "$state" "$system"
+# A system plug-in and an extension point, so that discovery has something to find.
+cp -R "$source/examples/System/Library" "$system/"
+service=com.corvane.ekora.test.package.$$
+export EKORA_RUNTIME_DIR=$run EKORA_STATE_DIR=$state EKORA_SYSTEM_ROOT=$system
+unset JOURNAL_STREAM LISTEN_FDS LISTEN_PID LISTEN_FDNAMES EKORA_LOG
+
+"$root/usr/sbin/ekd" -S "$service" </dev/null >/dev/null 2>"$scratch/ekd.log" &
+ekd_pid=$!
+
+ekctl() {
+  timeout 15 "$root/usr/bin/ekctl" -S "$service" --timeout 10 "$@"
+}
+
+match_request='{"request":"match","version":3}'
+reply=
+for ((attempt = 0; attempt < 200; attempt++)); do
+  kill -0 "$ekd_pid" 2>/dev/null || fail "ekd exited during start-up"
+  if [[ -S $run/$service ]] && reply=$(ekctl raw "$match_request" 2>/dev/null); then
+    break
+  fi
+  reply=
+  sleep 0.1
+done
+[[ -n $reply ]] || fail "ekd did not answer within 20 s"
+echo "raw match: $reply"
+[[ $reply == *'"matches"'* ]] || fail "the raw match reply has no matches"
+[[ $reply != *'"errorcode"'* ]] || fail "the raw match reply carries an error"
+[[ $reply == *com.corvane.spellcheck* ]] || fail "the raw match reply lacks the system plug-in"
+[[ -f $state/registry.db ]] || fail "ekd kept no registry in EKORA_STATE_DIR"
+
+output=$(ekctl match) || fail "ekctl match failed"
+[[ $output == *com.corvane.spellcheck* ]] || fail "ekctl match did not list the system plug-in"
+
+output=$(ekctl --json match '{"ZuExtensionPointIdentifier":"com.corvane.text-checking"}') ||
+  fail "ekctl match with rules failed"
+[[ $output == *com.corvane.spellcheck* ]] || fail "ekctl match with rules missed the plug-in"
+
+output=$(ekctl --json match '{"ZuExtensionPointIdentifier":"com.corvane.none"}') ||
+  fail "ekctl match with unmatched rules failed"
+[[ $output != *com.corvane.spellcheck* ]] || fail "ekctl match ignored its rules"
+
+status=0
+ekctl match --flags 512 >/dev/null 2>"$scratch/refused.err" || status=$?
+[[ $status -eq 1 ]] || fail "an unauthorized match exited $status, expected 1"
+grep -q '^ekctl: error 11: ' "$scratch/refused.err" || fail "no error line for the refused match"
+
+# --- Stop it -----------------------------------------------------------------------------
+kill -TERM "$ekd_pid"
+for ((attempt = 0; attempt < 100; attempt++)); do
+  kill -0 "$ekd_pid" 2>/dev/null || break
+  sleep 0.1
+done
+kill -0 "$ekd_pid" 2>/dev/null && fail "ekd did not exit within 10 s of SIGTERM"
+status=0
+wait "$ekd_pid" || status=$?
+ekd_pid=
+[[ $status -eq 0 ]] || fail "ekd exited with status $status after SIGTERM, expected 0"
+
+echo "package_test: passed"
