@@ -181,9 +181,9 @@ std::optional<EkError> EkDaemonClient::errorInReply(const Result<Value>& reply) 
   return EkError::ekora(code, text ? *text : std::string(protocol::kMsgUnknownError));
 }
 
-std::optional<Value> EkDaemonClient::convertToWyre(const Value& object, uint64_t version) {
+std::optional<Value> EkDaemonClient::convertToWyre(Value object, uint64_t version) {
   if (version != protocol::kCurrentVersion) return std::nullopt;
-  return object;
+  return std::optional<Value>(std::move(object));
 }
 
 std::optional<Value> EkDaemonClient::convertFromWyre(const Value& value) const {

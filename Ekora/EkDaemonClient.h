@@ -57,8 +57,9 @@ class EkDaemonClient {
 
   // The error a reply carries, or nothing on success.
   static std::optional<EkError> errorInReply(const Result<Value>& reply);
-  // The property-list conversion of "matches", defined for protocol version 3 only.
-  static std::optional<Value> convertToWyre(const Value& object, uint64_t version);
+  // The property-list conversion of "matches", defined for protocol version 3 only. Takes the
+  // object by value: a match of hundreds of forms is moved into the reply, not copied.
+  static std::optional<Value> convertToWyre(Value object, uint64_t version);
   std::optional<Value> convertFromWyre(const Value& value) const;
 
   int64_t protocolVersion() const { return protocolVersion_.load(); }

@@ -2,9 +2,10 @@
 
 #include <fmt/format.h>
 #include <limits.h>
+#include <openssl/core_names.h>
 #include <openssl/crypto.h>
 #include <openssl/evp.h>
-#include <openssl/hmac.h>
+#include <openssl/params.h>
 #include <openssl/rand.h>
 #include <stdlib.h>
 #include <sys/stat.h>
@@ -78,16 +79,56 @@ std::optional<uint32_t> parseFlags(std::string_view text) {
   return value;
 }
 
+// A MAC context keyed once per thread and key: the one-shot HMAC() looks up the algorithm and
+// sets the key up again for every tag, which dominated issuing the hundreds of tokens of one
+// match reply. Each tag works on a copy of the keyed context.
+class KeyedMac {
+ public:
+  ~KeyedMac() { reset(); }
+  EVP_MAC_CTX* contextFor(const EkSandboxKey& key) {
+    if (keyed_ && key_ == key) return keyed_;
+    reset();
+    mac_ = EVP_MAC_fetch(nullptr, "HMAC", nullptr);
+    if (mac_ == nullptr) return nullptr;
+    keyed_ = EVP_MAC_CTX_new(mac_);
+    char digest[] = "SHA256";
+    OSSL_PARAM params[] = {OSSL_PARAM_construct_utf8_string("digest", digest, 0),
+                           OSSL_PARAM_construct_end()};
+    if (keyed_ == nullptr || EVP_MAC_init(keyed_, key.data(), key.size(), params) != 1) {
+      reset();
+      return nullptr;
+    }
+    key_ = key;
+    return keyed_;
+  }
+
+ private:
+  void reset() {
+    EVP_MAC_CTX_free(keyed_);
+    EVP_MAC_free(mac_);
+    keyed_ = nullptr;
+    mac_ = nullptr;
+    OPENSSL_cleanse(key_.data(), key_.size());
+  }
+  EVP_MAC* mac_ = nullptr;
+  EVP_MAC_CTX* keyed_ = nullptr;
+  EkSandboxKey key_{};
+};
+
 std::optional<std::array<uint8_t, sandbox::kTagSize>> computeTag(const EkSandboxKey& key,
                                                                  std::string_view message) {
+  thread_local KeyedMac keyed;
+  EVP_MAC_CTX* base = keyed.contextFor(key);
+  if (base == nullptr) return std::nullopt;
+  EVP_MAC_CTX* context = EVP_MAC_CTX_dup(base);
+  if (context == nullptr) return std::nullopt;
   std::array<uint8_t, sandbox::kTagSize> tag;
-  unsigned int length = 0;
-  if (HMAC(EVP_sha256(), key.data(), static_cast<int>(key.size()),
-           reinterpret_cast<const unsigned char*>(message.data()), message.size(), tag.data(),
-           &length) == nullptr ||
-      length != tag.size()) {
-    return std::nullopt;
-  }
+  size_t length = 0;
+  bool ok = EVP_MAC_update(context, reinterpret_cast<const unsigned char*>(message.data()),
+                           message.size()) == 1 &&
+            EVP_MAC_final(context, tag.data(), &length, tag.size()) == 1 && length == tag.size();
+  EVP_MAC_CTX_free(context);
+  if (!ok) return std::nullopt;
   return tag;
 }
 

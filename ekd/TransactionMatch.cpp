@@ -139,9 +139,11 @@ void Transaction::matchPlugIns() {
   if (const auto& bundle = client_->bundle()) pluginsPath = bundle->plugInsPath();
 
   // Forms are shared with the override table: a replacing form removed from the results by a
-  // newer copy still marks the plug-ins it replaces.
+  // newer copy still marks the plug-ins it replaces. A removed form leaves an empty slot, so
+  // that the positions recorded per identifier stay valid.
   using FormRef = std::shared_ptr<Dictionary>;
   std::vector<FormRef> results;
+  std::unordered_map<std::string, std::vector<size_t>> accepted;
   std::unordered_map<std::string, FormRef> overrides;
   const Dictionary* matchRules = rules ? &*rules : nullptr;
   for (const auto& plugIn : candidates) {
@@ -181,56 +183,66 @@ void Transaction::matchPlugIns() {
     }
     Dictionary& form = exported.form;
 
-    // De-duplication against the forms accepted so far.
+    // De-duplication against the forms accepted so far with the same identifier, earliest
+    // first; the index keeps this linear in the number of candidates.
     const std::string identifier = plugIn->identifier().value_or("");
     const std::optional<std::string> version = plugIn->versionString();
     bool dropped = false;
-    for (size_t i = 0; i < results.size(); ++i) {
-      const Dictionary& earlier = *results[i];
-      const std::string* other = stringIn(earlier, form::kIdentifier);
-      if (!other || *other != identifier) continue;
-      const std::string* otherVersion = stringIn(earlier, form::kVersion);
-      auto order = compareVersionString(version ? &*version : nullptr,
-                                        otherVersion ? std::string_view(*otherVersion) : "");
-      bool removeEarlier = false;
-      bool stop = true;
-      if (!(flags & protocol::kDiscoverKeepVersions)) {
-        if (order > 0) {
-          removeEarlier = true;
-        } else if (order < 0) {
-          dropped = true;
+    auto sameIdentifier = accepted.find(identifier);
+    if (sameIdentifier != accepted.end()) {
+      std::vector<size_t>& positions = sameIdentifier->second;
+      for (auto position = positions.begin(); position != positions.end(); ++position) {
+        const Dictionary& earlier = *results[*position];
+        const std::string* otherVersion = stringIn(earlier, form::kVersion);
+        auto order = compareVersionString(version ? &*version : nullptr,
+                                          otherVersion ? std::string_view(*otherVersion) : "");
+        bool removeEarlier = false;
+        bool stop = true;
+        if (!(flags & protocol::kDiscoverKeepVersions)) {
+          if (order > 0) {
+            removeEarlier = true;
+          } else if (order < 0) {
+            dropped = true;
+          } else if (candidateWins(*plugIn, earlier)) {
+            removeEarlier = true;
+          } else {
+            dropped = true;
+          }
+        } else if (order != 0 || (flags & protocol::kDiscoverKeepDuplicates)) {
+          stop = false;
         } else if (candidateWins(*plugIn, earlier)) {
           removeEarlier = true;
         } else {
           dropped = true;
         }
-      } else if (order != 0 || (flags & protocol::kDiscoverKeepDuplicates)) {
-        stop = false;
-      } else if (candidateWins(*plugIn, earlier)) {
-        removeEarlier = true;
-      } else {
-        dropped = true;
+        if (removeEarlier) {
+          results[*position] = nullptr;
+          positions.erase(position);
+        }
+        if (stop) break;
       }
-      if (removeEarlier) results.erase(results.begin() + static_cast<std::ptrdiff_t>(i));
-      if (stop) break;
     }
     if (dropped) continue;
 
     addAnnotationForPlugIn(*plugIn, form);
     plugIn->augmentForm(form);
-    auto accepted = std::make_shared<Dictionary>(std::move(form));
-    results.push_back(accepted);
+    if (const std::string* formIdentifier = stringIn(form, form::kIdentifier)) {
+      accepted[*formIdentifier].push_back(results.size());
+    }
+    auto kept = std::make_shared<Dictionary>(std::move(form));
+    results.push_back(kept);
     if (auto replaces = plugIn->valueForEntitlement(protocol::kEntitlementReplacePlugIn)) {
       if (const std::string* name = replaces->string()) {
-        overrides[*name] = accepted;
+        overrides[*name] = kept;
       } else if (const Array* names = replaces->array()) {
         for (const Value& element : *names) {
-          if (const std::string* name = element.string()) overrides[*name] = accepted;
+          if (const std::string* name = element.string()) overrides[*name] = kept;
         }
       }
     }
   }
 
+  std::erase(results, nullptr);
   for (const FormRef& result : results) {
     if (overrides.empty()) break;
     Dictionary& replaced = *result;

@@ -152,6 +152,48 @@ void encodeInto(const Value& value, std::vector<uint8_t>& out) {
   }
 }
 
+// An upper bound of what encodeInto writes for value: a large reply is then written into one
+// allocation instead of a score of doublings, each copying all of it into fresh pages.
+size_t headBound(uint64_t argument) {
+  if (argument < 24) return 1;
+  if (argument <= 0xFF) return 2;
+  if (argument <= 0xFFFF) return 3;
+  if (argument <= 0xFFFFFFFF) return 5;
+  return kMaxHead;
+}
+
+size_t sizeBound(const Value& value) {
+  switch (value.type()) {
+    case ValueType::String:
+      return headBound(value.string()->size()) + value.string()->size();
+    case ValueType::Unsigned:
+    case ValueType::Negative:
+    case ValueType::Double:
+      return kMaxHead;
+    case ValueType::Bool:
+      return 1;
+    case ValueType::Data:
+      return headBound(value.data()->size()) + value.data()->size();
+    case ValueType::Uuid:
+      return headBound(kTagUuid) + headBound(kUuidSize) + kUuidSize;
+    case ValueType::Date:
+      return headBound(kTagEpochDate) + kMaxHead;
+    case ValueType::Array: {
+      size_t size = headBound(value.array()->size());
+      for (const Value& element : *value.array()) size += sizeBound(element);
+      return size;
+    }
+    case ValueType::Dictionary: {
+      size_t size = headBound(value.dictionary()->size());
+      for (const auto& [key, member] : *value.dictionary()) {
+        size += headBound(key.size()) + key.size() + sizeBound(member);
+      }
+      return size;
+    }
+  }
+  return kMaxHead;
+}
+
 // ---- Decoding -------------------------------------------------------------------------------
 
 // RFC 3629: no overlong forms, no surrogates, nothing above U+10FFFF.
@@ -551,11 +593,13 @@ class Decoder {
 }  // namespace
 
 void encode(const Value& value, std::vector<uint8_t>& out) {
+  out.reserve(out.size() + sizeBound(value));
   encodeInto(value, out);
 }
 
 std::vector<uint8_t> encode(const Value& value) {
   std::vector<uint8_t> out;
+  out.reserve(sizeBound(value));
   encodeInto(value, out);
   return out;
 }
