@@ -815,12 +815,15 @@ Result<std::string> write(const Value& value) {
   return Writer().run(value);
 }
 
-Result<void> writeFileAtomically(const std::string& path, const Value& value, mode_t mode) {
+Result<void> writeFileAtomically(const std::string& path, const Value& value, mode_t mode,
+                                 Durability durability) {
   const std::string bytes = EK_TRY(write(value));
-  return writeBytesAtomically(path, bytes, mode);
+  return writeBytesAtomically(path, bytes, mode, durability);
 }
 
-Result<void> writeBytesAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
+Result<void> writeBytesAtomically(const std::string& path, std::string_view bytes, mode_t mode,
+                                  Durability durability) {
+  const bool durable = durability == Durability::Durable;
   const size_t slash = path.rfind('/');
   const std::string directory = slash == std::string::npos ? "."
                                 : slash == 0               ? "/"
@@ -845,9 +848,10 @@ Result<void> writeBytesAtomically(const std::string& path, std::string_view byte
   };
   if (!writeAll(fd.get(), bytes)) return failAndRemove("write");
   if (::fchmod(fd.get(), mode) != 0) return failAndRemove("chmod");
-  if (::fsync(fd.get()) != 0) return failAndRemove("fsync");
+  if (durable && ::fsync(fd.get()) != 0) return failAndRemove("fsync");
   if (fd.close() != 0) return failAndRemove("close");
   if (::rename(temporary.c_str(), path.c_str()) != 0) return failAndRemove("rename over");
+  if (!durable) return {};
 
   // The rename is durable only once the directory is.
   FileDescriptor directoryFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));

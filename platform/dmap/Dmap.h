@@ -56,9 +56,15 @@ Result<std::string> write(const Value& value);
 // (only a failure to sync the directory comes after the rename: the new file is then in
 // place). A symbolic link at path is replaced, not followed. A value write() refuses is its
 // Format error, and nothing is touched.
-Result<void> writeFileAtomically(const std::string& path, const Value& value, mode_t mode = 0644);
+//
+// Files of the runtime directory do not outlive a reboot (it is a tmpfs in production): they
+// need the atomic replacement, which readers rely on, but not the two fsyncs, which are most of
+// the cost on a disk. Durability::RuntimeOnly skips them.
+enum class Durability { Durable, RuntimeOnly };
+Result<void> writeFileAtomically(const std::string& path, const Value& value, mode_t mode = 0644,
+                                 Durability durability = Durability::Durable);
 // The same for raw bytes.
 Result<void> writeBytesAtomically(const std::string& path, std::string_view bytes,
-                                  mode_t mode = 0644);
+                                  mode_t mode = 0644, Durability durability = Durability::Durable);
 
 }  // namespace ek::dmap

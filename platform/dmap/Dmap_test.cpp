@@ -528,6 +528,26 @@ TEST(DmapFile, AtomicWriteReplacesTheFileWithTheGivenMode) {
   EXPECT_EQ(dir.entries(), std::vector<std::string>{"prefs.dmap"});
 }
 
+TEST(DmapFile, RuntimeOnlyWriteStillReplacesAtomicallyWithTheGivenMode) {
+  TempDir dir;
+  const std::string path = dir.file("declaration.dmap");
+  spit(path, "old");
+  ASSERT_TRUE(
+      writeFileAtomically(path, Value(Dictionary{{"k", Value(1)}}), 0640, Durability::RuntimeOnly)
+          .ok());
+  Result<Value> read = readFile(path);
+  ASSERT_TRUE(read.ok()) << read.error().message;
+  EXPECT_EQ(*read, Value(Dictionary{{"k", Value(1)}}));
+  struct stat status;
+  ASSERT_EQ(::stat(path.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0640u);
+  EXPECT_EQ(dir.entries(), std::vector<std::string>{"declaration.dmap"});
+  Result<void> missing =
+      writeBytesAtomically(dir.file("missing/x.dmap"), "x", 0644, Durability::RuntimeOnly);
+  ASSERT_FALSE(missing.ok());
+  EXPECT_TRUE(missing.error().isPosix(ENOENT)) << missing.error().message;
+}
+
 TEST(DmapFile, AtomicWriteInAReadOnlyDirectoryKeepsTheOldFile) {
   if (::geteuid() == 0) GTEST_SKIP() << "root bypasses directory permissions";
   TempDir dir;

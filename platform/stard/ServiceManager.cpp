@@ -331,7 +331,7 @@ int FileServiceManager::addExternalService(pid_t hostPid, std::string_view hostP
   auto made = paths::ensureDirectory(
       paths::join(servicesDirectory(runtimeDirectory_), std::to_string(hostPid)), 0755);
   if (!made.ok()) return errnoOf(made.error());
-  auto written = dmap::writeBytesAtomically(path, *bytes, 0644);
+  auto written = dmap::writeBytesAtomically(path, *bytes, 0644, dmap::Durability::RuntimeOnly);
   if (!written.ok()) return errnoOf(written.error());
   return kSuccess;
 }
@@ -490,8 +490,9 @@ Result<pid_t> FileServiceManager::launch(pid_t hostPid, std::string_view bundleI
   const std::string directory = instancesDirectory(runtimeDirectory_, bundleIdentifier);
   auto made = paths::ensureDirectory(directory, 0755);
   if (!made.ok()) return fail(std::move(made).error());
-  auto written = dmap::writeFileAtomically(
-      paths::join(directory, fmt::format("{}{}", pid, kExtension)), Value(std::move(entry)), 0644);
+  auto written =
+      dmap::writeFileAtomically(paths::join(directory, fmt::format("{}{}", pid, kExtension)),
+                                Value(std::move(entry)), 0644, dmap::Durability::RuntimeOnly);
   if (!written.ok()) return fail(std::move(written).error());
   log::ops().debug("launched %s for host %d: pid %d", bundleIdentifier, hostPid, pid);
   return pid;
