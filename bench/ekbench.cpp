@@ -16,6 +16,7 @@
 
 #include "Ekora/EkProtocol.h"
 #include "bench/EchoServer.h"
+#include "bench/FrameIo.h"
 #include "bench/LoadGenerator.h"
 #include "platform/cbor/Cbor.h"
 #include "platform/json/WireJson.h"
@@ -54,6 +55,7 @@ struct Options {
   bool baseline = false;
   bool echoSelfTest = false;
   bool json = false;
+  bool encodeReply = false;
   std::string request;
   std::string requestsFile;
 };
@@ -136,7 +138,7 @@ void printReadable(const Options& options, const Requests& requests, const std::
   if (all.size() == 2) {
     LoadResult daemon = ek::bench::combine(all[0].rounds);
     LoadResult echo = ek::bench::combine(all[1].rounds);
-    fmt::print("daemon / echo: p50 {:.2f}x, req/s {:.2f}x\n",
+    fmt::print("daemon / {}: p50 {:.2f}x, req/s {:.2f}x\n", all[1].label,
                ratio(daemon.latency().p50, echo.latency().p50),
                ratio(daemon.requestsPerSecond(), echo.requestsPerSecond()));
   }
@@ -259,6 +261,53 @@ ek::Result<Requests> readRequestsFile(const std::string& path) {
   return requests;
 }
 
+// The daemon's reply to body, asked for once on a connection of its own.
+ek::Result<ek::Value> fetchReply(const std::string& socket, const std::vector<uint8_t>& body,
+                                 const Options& options) {
+  int fd = ek::bench::connectUnix(socket);
+  if (fd < 0) return ek::EkError::fromErrno(errno, "connecting to " + socket);
+  std::vector<uint8_t> frame(ek::wyre::kHeaderSize);
+  frame.insert(frame.end(), body.begin(), body.end());
+  ek::wyre::encodeHeader({static_cast<uint32_t>(body.size()), ek::wyre::kFlagWantsReply, 1},
+                         frame.data());
+  ek::bench::FrameReader reader;
+  ek::wyre::FrameHeader header;
+  std::span<const uint8_t> bytes;
+  auto timeout = std::chrono::milliseconds(static_cast<int64_t>(options.timeout * 1000));
+  bool answered = ek::bench::setIoTimeout(fd, timeout) &&
+                  ek::bench::writeAll(fd, frame.data(), frame.size()) &&
+                  reader.next(fd, header, bytes) == ek::bench::FrameReader::Status::Frame;
+  ek::Result<ek::Value> reply = answered
+                                    ? ek::cbor::decode(bytes)
+                                    : ek::Result<ek::Value>(ek::EkError::posix(
+                                          EIO, "no reply to the first request from " + socket));
+  ::close(fd);
+  return reply;
+}
+
+// Encodes reply again and again with the daemon's own encoder for as long as a measured run
+// lasts: the floor under a request whose reply is large, such as a match of hundreds of forms.
+LoadResult timeEncoding(const ek::Value& reply, const Options& options) {
+  using Clock = std::chrono::steady_clock;
+  LoadResult result;
+  size_t bytes = 0;
+  Clock::time_point start = Clock::now();
+  Clock::time_point end =
+      start + std::chrono::duration_cast<Clock::duration>(ek::bench::Seconds(options.duration));
+  for (Clock::time_point now = start; now < end;) {
+    // A fresh buffer each time, as the daemon's every reply needs one.
+    bytes += ek::cbor::encode(reply).size();
+    Clock::time_point done = Clock::now();
+    result.latenciesNs.push_back(static_cast<uint64_t>(
+        std::chrono::duration_cast<std::chrono::nanoseconds>(done - now).count()));
+    ++result.requests;
+    now = done;
+  }
+  result.seconds = ek::bench::Seconds(Clock::now() - start).count();
+  if (bytes == 0) ++result.failures;
+  return result;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -286,6 +335,11 @@ int main(int argc, char** argv) {
   auto* selfTest = app.add_flag("--echo-self-test", options.echoSelfTest,
                                 "measure only the in-process echo server");
   selfTest->excludes(baseline)->excludes(service)->excludes(socket);
+  app.add_flag("--encode-reply", options.encodeReply,
+               "also time encoding the daemon's reply to the first request, alone, and print "
+               "the daemon's ratio to it")
+      ->excludes(baseline)
+      ->excludes(selfTest);
   app.add_flag("--json", options.json, "print one JSON object");
   auto* requestsFile = app.add_option(
       "--requests", options.requestsFile,
@@ -347,9 +401,27 @@ int main(int argc, char** argv) {
     all.push_back({"echo", echo->socketPath(), {}});
   }
 
+  std::optional<ek::Value> reply;
+  if (options.encodeReply) {
+    ek::Result<ek::Value> fetched = fetchReply(all[0].socket, requests.bodies[0], options);
+    if (!fetched) {
+      std::fprintf(stderr, "ekbench: %s\n", fetched.error().message.c_str());
+      return kSetupFailed;
+    }
+    reply = std::move(fetched).value();
+    all.push_back({"encode",
+                   fmt::format("the reply to the first request, {} bytes of CBOR",
+                               ek::cbor::encode(*reply).size()),
+                   {}});
+  }
+
   // Alternating the targets spreads the machine's drift over both of them.
   for (unsigned round = 0; round < options.rounds; ++round) {
     for (Runs& runs : all) {
+      if (reply && &runs == &all.back()) {
+        runs.rounds.push_back(timeEncoding(*reply, options));
+        continue;
+      }
       LoadOptions load;
       load.socketPath = runs.socket;
       load.connections = options.connections;
