@@ -79,6 +79,7 @@ class ListingServiceManager final : public stard::ServiceManager {
     asked.push_back(identifiers);
     return listed;
   }
+  void pruneDeclarations() override {}
   std::vector<stard::Instance> listed;
   std::vector<std::vector<std::string>> asked;
 };

@@ -1,5 +1,6 @@
 #include "ekd/EkDServer.h"
 
+#include <fcntl.h>
 #include <malloc.h>
 
 #include <mutex>
@@ -132,6 +133,38 @@ void EkDServer::stop() {
     released.swap(holds_);
     notifier()->post(protocol::kAnnotationChangeNotification);
   });
+}
+
+void EkDServer::watchHostExit(const AuditToken& host) {
+  if (!host.pidfd || !host.pidfd->valid()) return;
+  syncQueue_->sync([&] {
+    if (hostWatches_.contains(host.pid)) return;
+    // A copy of the descriptor: the watch outlives the connection that brought the pidfd.
+    int fd = ::fcntl(host.pidfd->get(), F_DUPFD_CLOEXEC, 0);
+    if (fd < 0) {
+      log::ops().error("cannot watch host %d for its exit: %{errno}d", host.pid, errno);
+      return;
+    }
+    auto watch = std::make_shared<asio::posix::stream_descriptor>(wyre::ioContext(), fd);
+    hostWatches_.emplace(host.pid, watch);
+    // A pidfd becomes readable when its process has exited.
+    watch->async_wait(asio::posix::stream_descriptor::wait_read,
+                      [weak = weak_from_this(), pid = host.pid](const asio::error_code& error) {
+                        auto server = weak.lock();
+                        if (!server || error == asio::error::operation_aborted) return;
+                        server->syncQueue_->async([server, pid] {
+                          server->hostWatches_.erase(pid);
+                          log::ops().debug("host %d exited: pruning its service declarations", pid);
+                          server->platform_.serviceManager->pruneDeclarations();
+                        });
+                      });
+  });
+}
+
+size_t EkDServer::hostWatchCount() {
+  size_t count = 0;
+  syncQueue_->sync([&] { count = hostWatches_.size(); });
+  return count;
 }
 
 bool EkDServer::holdOnPlugIn(const EkDPlugIn& plugIn) {

@@ -6,7 +6,10 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_map>
 #include <vector>
+
+#include <asio/posix/stream_descriptor.hpp>
 
 #include "ekd/EkDatabase.h"
 #include "platform/codesign/CodeSigning.h"
@@ -81,6 +84,10 @@ class EkDServer : public EkDatabase,
   void terminatePlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns,
                         std::function<void()> reply);
   void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) override;
+  // Prunes the service declarations once this host has exited: one watch per host, on its
+  // pidfd. Without a pidfd they go at the next declaration or daemon start instead.
+  void watchHostExit(const AuditToken& host);
+  size_t hostWatchCount();
 
   uint32_t verbose() const { return verbose_; }
   void setVerbose(uint32_t verbose) { verbose_ = verbose; }
@@ -105,6 +112,8 @@ class EkDServer : public EkDatabase,
   std::shared_ptr<SerialQueue> syncQueue_;  // "serverSync": guards the hold list
   std::shared_ptr<wyre::Listener> service_;
   std::vector<std::shared_ptr<EkDPlugInHold>> holds_;  // on syncQueue_
+  std::unordered_map<pid_t, std::shared_ptr<asio::posix::stream_descriptor>>
+      hostWatches_;  // on syncQueue_
   std::shared_ptr<EkDUserPrefs> userPrefs_;
 };
 

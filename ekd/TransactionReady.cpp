@@ -59,6 +59,9 @@ void Transaction::readyPlugIns() {
     auto error = plugIn->enableForClient(*client_, environment ? &*environment : nullptr);
     if (error && !firstError) firstError = std::move(error);
   }
+  if (!accepted.empty()) {
+    if (auto connection = client_->connection()) server().watchHostExit(connection->auditToken());
+  }
   if (firstError) {
     fail(protocol::kErrorInvalidRequest, *firstError);
     return;

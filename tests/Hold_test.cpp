@@ -218,6 +218,47 @@ TEST_F(HoldRequests, ReadyDeclaresThePlugInForTheHost) {
             "com.corvane.developer.ekora.provide-environment host entitlement");
 }
 
+TEST_F(HoldRequests, DeclarationsOfAnExitedHostArePrunedAndALiveHostsStay) {
+  Uuid share = uuidOf(notesShare());
+  Value ours = ask(request("ready", {{"uuids", Value(Array{Value(share)})}}));
+  ASSERT_EQ(replyErrorCode(ours), 0) << ours.description();
+  // ekctl is a host that exits as soon as it has its answer.
+  auto ready = daemon_.ekctl({"ready", share.string()});
+  ASSERT_EQ(ready.status, 0) << ready.err;
+
+  fs::path services = fs::path(daemon_.environment().at("EKORA_RUNTIME_DIR")) / "services";
+  const std::string declaration = std::string(kNotesShare) + ".dmap";
+  auto otherHostsDeclaring = [&] {
+    std::vector<std::string> hosts;
+    for (const auto& host : fs::directory_iterator(services)) {
+      if (host.path().filename() == std::to_string(getpid())) continue;
+      if (fs::exists(host.path() / declaration)) hosts.push_back(host.path().filename());
+    }
+    return hosts;
+  };
+  for (int i = 0; i < 1000 && !otherHostsDeclaring().empty(); ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  EXPECT_EQ(otherHostsDeclaring(), std::vector<std::string>{}) << daemon_.log();
+  EXPECT_NE(daemon_.log().find("exited: pruning its service declarations"), std::string::npos)
+      << daemon_.log();
+  EXPECT_TRUE(fs::exists(services / std::to_string(getpid()) / declaration));
+}
+
+TEST_F(HoldRequests, TerminationReleasesHoldsAndTellsWatchers) {
+  Value held = lock({Value(app("Notes"))});
+  ASSERT_EQ(replyErrorCode(held), 0) << held.description();
+  const Value* token = held.get("uuids");
+  ASSERT_TRUE(token && token->uuid()) << held.description();
+  uint64_t posts = daemon_.notificationGeneration(kChange);
+  EXPECT_EQ(daemon_.terminate(), 0);
+  EXPECT_EQ(daemon_.notificationGeneration(kChange), posts + 1);
+  EXPECT_NE(daemon_.log().find("releasing plug-in hold " + token->uuid()->string() +
+                               " because server is stopping"),
+            std::string::npos)
+      << daemon_.log();
+}
+
 TEST_F(HoldRequests, AccessAnswersOneTokenPerUuidInOrder) {
   Uuid share = uuidOf(notesShare());
   Uuid thumbs = uuidOf(app("Viewer") + "/PlugIns/Thumbs.appex");

@@ -1,4 +1,5 @@
 #include <errno.h>
+#include <signal.h>
 
 #include <algorithm>
 #include <cstdlib>
@@ -15,6 +16,13 @@ int FakeServiceManager::addExternalService(pid_t hostPid, std::string_view hostP
   declarations_.push_back(Declaration{hostPid, std::string(hostPath), std::string(bundleIdentifier),
                                       std::string(program), overlay});
   return addResult;
+}
+
+void FakeServiceManager::pruneDeclarations() {
+  std::lock_guard lock(mutex_);
+  std::erase_if(declarations_, [](const Declaration& declaration) {
+    return ::kill(declaration.hostPid, 0) != 0 && errno == ESRCH;
+  });
 }
 
 void FakeServiceManager::removeExternalService(std::string_view bundleIdentifier,

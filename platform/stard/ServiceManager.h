@@ -66,6 +66,8 @@ class ServiceManager {
                                const std::vector<std::string>& arguments = {}) = 0;
   // The running instances of these bundle identifiers (grantd reports them as busy).
   virtual std::vector<Instance> instances(const std::vector<std::string>& bundleIdentifiers) = 0;
+  // Removes the declarations of hosts that have exited.
+  virtual void pruneDeclarations() = 0;
 
   // Keep-alive transactions: while the count is above 0 the daemon must not exit for idleness.
   void beginTransaction() { transactions_.fetch_add(1); }
@@ -92,8 +94,7 @@ class FileServiceManager final : public ServiceManager {
   Result<pid_t> launch(pid_t hostPid, std::string_view bundleIdentifier,
                        const std::vector<std::string>& arguments = {}) override;
   std::vector<Instance> instances(const std::vector<std::string>& bundleIdentifiers) override;
-  // Removes the declarations of hosts that have exited.
-  void pruneDeclarations();
+  void pruneDeclarations() override;
   // The declaration of a plug-in for a host, or absent.
   std::optional<Dictionary> declaration(pid_t hostPid, std::string_view bundleIdentifier) const;
 
@@ -128,6 +129,8 @@ class FakeServiceManager final : public ServiceManager {
   Result<pid_t> launch(pid_t hostPid, std::string_view bundleIdentifier,
                        const std::vector<std::string>& arguments = {}) override;
   std::vector<Instance> instances(const std::vector<std::string>& bundleIdentifiers) override;
+  // Drops the declarations of hosts that are no longer running.
+  void pruneDeclarations() override;
 
   // launch answers the POSIX error ENOTSUP: tests fill the table with addInstance.
   // The answer removeExternalService gives for a bundle identifier (default kNoSuchProcess);
