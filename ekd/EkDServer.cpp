@@ -15,6 +15,8 @@
 namespace ek {
 namespace {
 
+constexpr size_t kMaxHostWatches = 256;
+
 std::shared_ptr<EkDServer> gServer;
 std::mutex gServerMutex;
 
@@ -139,6 +141,14 @@ void EkDServer::watchHostExit(const AuditToken& host) {
   if (!host.pidfd || !host.pidfd->valid()) return;
   syncQueue_->sync([&] {
     if (hostWatches_.contains(host.pid)) return;
+    // Each watch keeps a descriptor open for as long as its host lives: bounded, so that hosts
+    // cannot run the daemon out of descriptors. Past the bound, declarations go at the next
+    // declaration instead.
+    if (hostWatches_.size() >= kMaxHostWatches) {
+      log::ops().info("not watching host %d for its exit: %zu hosts watched already", host.pid,
+                      hostWatches_.size());
+      return;
+    }
     // A copy of the descriptor: the watch outlives the connection that brought the pidfd.
     int fd = ::fcntl(host.pidfd->get(), F_DUPFD_CLOEXEC, 0);
     if (fd < 0) {
@@ -159,12 +169,6 @@ void EkDServer::watchHostExit(const AuditToken& host) {
                         });
                       });
   });
-}
-
-size_t EkDServer::hostWatchCount() {
-  size_t count = 0;
-  syncQueue_->sync([&] { count = hostWatches_.size(); });
-  return count;
 }
 
 bool EkDServer::holdOnPlugIn(const EkDPlugIn& plugIn) {

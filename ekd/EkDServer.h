@@ -87,7 +87,6 @@ class EkDServer : public EkDatabase,
   // Prunes the service declarations once this host has exited: one watch per host, on its
   // pidfd. Without a pidfd they go at the next declaration or daemon start instead.
   void watchHostExit(const AuditToken& host);
-  size_t hostWatchCount();
 
   uint32_t verbose() const { return verbose_; }
   void setVerbose(uint32_t verbose) { verbose_ = verbose; }
