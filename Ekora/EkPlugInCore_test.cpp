@@ -10,6 +10,7 @@
 
 #include "Ekora/EkPlugInKeys.h"
 #include "platform/log/Log.h"
+#include "platform/log/testing/CapturingSink.h"
 
 namespace ek {
 namespace {
@@ -68,34 +69,7 @@ std::shared_ptr<EkPlugInCore> fromPlugInDictionary(const Dictionary& plugIn,
                                       std::nullopt);
 }
 
-class CapturingSink : public log::Sink {
- public:
-  struct Line {
-    log::Level level;
-    std::string category;
-    std::string message;
-  };
-  void write(const log::Record& record) override {
-    std::lock_guard lock(mutex_);
-    lines_.push_back({record.level, std::string(record.category), std::string(record.message)});
-  }
-  std::vector<Line> lines() const {
-    std::lock_guard lock(mutex_);
-    return lines_;
-  }
-  bool has(log::Level level, std::string_view category, std::string_view message) const {
-    for (const Line& line : lines()) {
-      if (line.level == level && line.category == category && line.message == message) {
-        return true;
-      }
-    }
-    return false;
-  }
-
- private:
-  mutable std::mutex mutex_;
-  std::vector<Line> lines_;
-};
+using log::testing::CapturingSink;
 
 class EkPlugInCoreTest : public ::testing::Test {
  protected:

@@ -10,35 +10,12 @@
 #include <vector>
 
 #include "platform/log/Log.h"
+#include "platform/log/testing/CapturingSink.h"
 
 namespace ek {
 namespace {
 
-struct Line {
-  log::Level level;
-  std::string category;
-  std::string message;
-};
-
-class CapturingSink : public log::Sink {
- public:
-  void write(const log::Record& record) override {
-    std::lock_guard lock(mutex_);
-    lines_.push_back({record.level, std::string(record.category), std::string(record.message)});
-  }
-  std::vector<Line> lines() {
-    std::lock_guard lock(mutex_);
-    return lines_;
-  }
-  void clear() {
-    std::lock_guard lock(mutex_);
-    lines_.clear();
-  }
-
- private:
-  std::mutex mutex_;
-  std::vector<Line> lines_;
-};
+using log::testing::CapturingSink;
 
 class EkSandboxExtensionTest : public ::testing::Test {
  protected:

@@ -17,6 +17,7 @@
 #include "ekd/EkDPlugIn.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/log/Log.h"
+#include "platform/log/testing/CapturingSink.h"
 #include "platform/vantor/FakeRegistry.h"
 
 namespace ek {
@@ -27,33 +28,15 @@ using namespace std::string_literals;
 
 constexpr std::string_view kFileName = "Ekora-Annotations";
 
-class CapturingSink : public log::Sink {
+class CapturingSink : public log::testing::CapturingSink {
  public:
-  struct Line {
-    log::Level level;
-    std::string category;
-    std::string message;
-  };
-  void write(const log::Record& record) override {
-    std::lock_guard lock(mutex_);
-    lines_.push_back({record.level, std::string(record.category), std::string(record.message)});
-  }
   std::vector<std::string> messages(log::Level level) const {
-    std::lock_guard lock(mutex_);
     std::vector<std::string> found;
-    for (const Line& line : lines_) {
+    for (const Line& line : lines()) {
       if (line.level == level && line.category == "ops") found.push_back(line.message);
     }
     return found;
   }
-  void clear() {
-    std::lock_guard lock(mutex_);
-    lines_.clear();
-  }
-
- private:
-  mutable std::mutex mutex_;
-  std::vector<Line> lines_;
 };
 
 std::string readBytes(const fs::path& path) {

@@ -18,6 +18,7 @@
 #include "ekd/EkDWyreClient.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/log/Log.h"
+#include "platform/log/testing/CapturingSink.h"
 #include "platform/privo/Consent.h"
 #include "platform/stard/ServiceManager.h"
 #include "platform/vantor/FakeRegistry.h"
@@ -30,37 +31,14 @@ namespace fs = std::filesystem;
 constexpr std::string_view kHostIdentifier = "com.example.host";
 constexpr std::string_view kKeyboard = "com.corvane.keyboard-service";
 
-class CapturingSink : public log::Sink {
+class CapturingSink : public log::testing::CapturingSink {
  public:
-  struct Line {
-    log::Level level;
-    std::string category;
-    std::string message;
-  };
-  void write(const log::Record& record) override {
-    std::lock_guard lock(mutex_);
-    lines_.push_back({record.level, std::string(record.category), std::string(record.message)});
-  }
-  bool has(log::Level level, std::string_view category, std::string_view message) const {
-    std::lock_guard lock(mutex_);
-    for (const Line& line : lines_) {
-      if (line.level == level && line.category == category && line.message == message) return true;
-    }
-    return false;
-  }
   // Lines at level in category that begin with prefix.
   int countStarting(log::Level level, std::string_view category, std::string_view prefix) const {
-    std::lock_guard lock(mutex_);
-    int n = 0;
-    for (const Line& line : lines_) {
-      n += line.level == level && line.category == category && line.message.starts_with(prefix);
-    }
-    return n;
+    return countIf([&](const Line& line) {
+      return line.level == level && line.category == category && line.message.starts_with(prefix);
+    });
   }
-
- private:
-  mutable std::mutex mutex_;
-  std::vector<Line> lines_;
 };
 
 // Answers a fixed list of instances, whatever is asked; records what was asked.

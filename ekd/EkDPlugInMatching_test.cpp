@@ -18,6 +18,7 @@
 #include "ekd/EkDWyreClient.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/log/Log.h"
+#include "platform/log/testing/CapturingSink.h"
 #include "platform/types/TypeSystem.h"
 #include "platform/vantor/FakeRegistry.h"
 
@@ -30,43 +31,15 @@ constexpr std::string_view kIdentifier = "com.example.host.viewer";
 constexpr std::string_view kHostApp = "/Applications/Host.app";
 constexpr std::string_view kSystemRoot = "/System";
 
-class CapturingSink : public log::Sink {
+class CapturingSink : public log::testing::CapturingSink {
  public:
-  struct Line {
-    log::Level level;
-    std::string category;
-    std::string message;
-  };
-  void write(const log::Record& record) override {
-    std::lock_guard lock(mutex_);
-    lines_.push_back({record.level, std::string(record.category), std::string(record.message)});
-  }
-  int count(log::Level level, std::string_view category, std::string_view message) const {
-    std::lock_guard lock(mutex_);
-    int n = 0;
-    for (const Line& line : lines_) {
-      n += line.level == level && line.category == category && line.message == message;
-    }
-    return n;
-  }
   int countIn(std::string_view category) const {
-    std::lock_guard lock(mutex_);
-    int n = 0;
-    for (const Line& line : lines_) n += line.category == category;
-    return n;
-  }
-  void clear() {
-    std::lock_guard lock(mutex_);
-    lines_.clear();
+    return countIf([&](const Line& line) { return line.category == category; });
   }
   std::string lastLine() const {
-    std::lock_guard lock(mutex_);
-    return lines_.empty() ? std::string() : lines_.back().message;
+    std::vector<Line> all = lines();
+    return all.empty() ? std::string() : all.back().message;
   }
-
- private:
-  mutable std::mutex mutex_;
-  std::vector<Line> lines_;
 };
 
 // The attributes every test plug-in carries beside the ones a test adds.

@@ -17,6 +17,7 @@
 #include "Ekora/EkSandboxKey.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/log/Log.h"
+#include "platform/log/testing/CapturingSink.h"
 #include "platform/vantor/FakeRegistry.h"
 
 namespace ek {
@@ -89,44 +90,12 @@ class CountingRegistry : public vantor::FakeRegistry {
   std::atomic<int> byUrl{0};
 };
 
-class CapturingSink : public log::Sink {
+class CapturingSink : public log::testing::CapturingSink {
  public:
-  struct Line {
-    log::Level level;
-    std::string category;
-    std::string message;
-  };
-  void write(const log::Record& record) override {
-    std::lock_guard lock(mutex_);
-    lines_.push_back({record.level, std::string(record.category), std::string(record.message)});
-  }
-  int count(log::Level level, std::string_view category, std::string_view message) const {
-    std::lock_guard lock(mutex_);
-    int n = 0;
-    for (const Line& line : lines_) {
-      if (line.level == level && line.category == category && line.message == message) ++n;
-    }
-    return n;
-  }
-  bool has(log::Level level, std::string_view category, std::string_view message) const {
-    return count(level, category, message) > 0;
-  }
   int countIn(log::Level level, std::string_view category) const {
-    std::lock_guard lock(mutex_);
-    int n = 0;
-    for (const Line& line : lines_) {
-      if (line.level == level && line.category == category) ++n;
-    }
-    return n;
+    return countIf(
+        [&](const Line& line) { return line.level == level && line.category == category; });
   }
-  void clear() {
-    std::lock_guard lock(mutex_);
-    lines_.clear();
-  }
-
- private:
-  mutable std::mutex mutex_;
-  std::vector<Line> lines_;
 };
 
 class EkDPlugInTest : public ::testing::Test {
