@@ -11,6 +11,7 @@
 #include <cerrno>
 #include <stdexcept>
 
+#include "platform/io/UniqueFd.h"
 #include "platform/paths/Directories.h"
 
 namespace ek {
@@ -18,20 +19,6 @@ namespace ek {
 namespace {
 
 constexpr std::string_view kKeyFileName = "sandbox.key";
-
-class Descriptor {
- public:
-  explicit Descriptor(int fd) : fd_(fd) {}
-  Descriptor(const Descriptor&) = delete;
-  Descriptor& operator=(const Descriptor&) = delete;
-  ~Descriptor() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 std::string directoryOf(const std::string& path) {
   const size_t slash = path.rfind('/');
@@ -86,7 +73,7 @@ Result<EkSandboxKey> EkSandboxFileKeySource::key() {
 Result<EkSandboxKey> EkSandboxFileKeySource::load() {
   // A second round covers losing the creation race to another process.
   for (int attempt = 0; attempt < 2; ++attempt) {
-    Descriptor fd(::open(path_.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+    UniqueFd fd(::open(path_.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
     if (fd.get() < 0) {
       if (errno != ENOENT) return EkError::fromErrno(errno, path_);
       Result<EkSandboxKey> created = create();
@@ -129,7 +116,7 @@ Result<EkSandboxKey> EkSandboxFileKeySource::create() {
   }
   // mkostemp opens with O_EXCL and mode 0600.
   std::string temporary = path_ + ".XXXXXX";
-  Descriptor fd(::mkostemp(temporary.data(), O_CLOEXEC));
+  UniqueFd fd(::mkostemp(temporary.data(), O_CLOEXEC));
   if (fd.get() < 0) return EkError::fromErrno(errno, temporary);
   auto fail = [&](EkError error) -> Result<EkSandboxKey> {
     ::unlink(temporary.c_str());
@@ -146,7 +133,7 @@ Result<EkSandboxKey> EkSandboxFileKeySource::create() {
     return fail(EkError::fromErrno(errno, path_));
   }
   ::unlink(temporary.c_str());
-  Descriptor directoryFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  UniqueFd directoryFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (directoryFd.get() >= 0) ::fsync(directoryFd.get());
   return key;
 }

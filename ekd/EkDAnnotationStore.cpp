@@ -14,6 +14,7 @@
 
 #include "ekd/EkDPlugIn.h"
 #include "platform/dmap/Dmap.h"
+#include "platform/io/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/paths/Directories.h"
 #include "platform/trace/Probes.h"
@@ -79,26 +80,6 @@ std::string utcStamp() {
   return std::string(text, length);
 }
 
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd) : fd_(fd) {}
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  ~FileDescriptor() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  int get() const { return fd_; }
-  // Closes now, answering close's errno (0 on success).
-  int close() {
-    int fd = fd_;
-    fd_ = -1;
-    return ::close(fd) == 0 ? 0 : errno;
-  }
-
- private:
-  int fd_;
-};
-
 Result<void> copyBytes(int from, int to, const std::string& source, const std::string& target) {
   char buffer[kCopyChunk];
   while (true) {
@@ -122,13 +103,13 @@ Result<void> copyBytes(int from, int to, const std::string& source, const std::s
 // Copies the regular file source to a new file target (same mode) and syncs it. False when
 // target already exists; a partial copy is removed.
 Result<bool> copyToNewFile(const std::string& source, const std::string& target) {
-  FileDescriptor in(::open(source.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
+  UniqueFd in(::open(source.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
   if (in.get() < 0) return EkError::fromErrno(errno, "opening " + source);
   struct stat st {};
   if (::fstat(in.get(), &st) != 0) return EkError::fromErrno(errno, "examining " + source);
   if (!S_ISREG(st.st_mode)) return EkError::posix(EINVAL, source + ": not a regular file");
 
-  FileDescriptor out(::open(target.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
+  UniqueFd out(::open(target.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
   if (out.get() < 0) {
     if (errno == EEXIST) return false;
     return EkError::fromErrno(errno, "creating " + target);
@@ -141,8 +122,7 @@ Result<bool> copyToNewFile(const std::string& source, const std::string& target)
     copied = EkError::fromErrno(errno, "syncing " + target);
   }
   if (copied.ok()) {
-    if (int error = out.close(); error != 0)
-      copied = EkError::fromErrno(error, "closing " + target);
+    if (out.close() != 0) copied = EkError::fromErrno(errno, "closing " + target);
   }
   if (!copied.ok()) {
     ::unlink(target.c_str());

@@ -20,6 +20,8 @@
 
 #include <fmt/format.h>
 
+#include "platform/io/UniqueFd.h"
+
 namespace ek::dmap {
 namespace {
 
@@ -727,29 +729,9 @@ class Writer {
 // ---------------------------------------------------------------------------------------------
 // Files
 
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd) : fd_(fd) {}
-  ~FileDescriptor() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  int get() const { return fd_; }
-  // Closes now and reports the failure, which matters for files just written.
-  int close() {
-    const int result = ::close(fd_);
-    fd_ = -1;
-    return result;
-  }
-
- private:
-  int fd_;
-};
-
 Result<std::string> readRegularFile(const std::string& path) {
   // O_NONBLOCK keeps a FIFO planted at the path from blocking the open.
-  FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
   if (fd.get() < 0) return EkError::fromErrno(errno, path);
   struct stat status;
   if (::fstat(fd.get(), &status) != 0) return EkError::fromErrno(errno, path);
@@ -838,7 +820,7 @@ Result<void> writeBytesAtomically(const std::string& path, std::string_view byte
   const int rawFd = ::mkostemp(temporary.data(), O_CLOEXEC);
   if (rawFd < 0)
     return EkError::fromErrno(errno, fmt::format("create a temporary file for {}", path));
-  FileDescriptor fd(rawFd);
+  UniqueFd fd(rawFd);
 
   const auto failAndRemove = [&](std::string_view step) {
     const int saved = errno;
@@ -854,7 +836,7 @@ Result<void> writeBytesAtomically(const std::string& path, std::string_view byte
   if (!durable) return {};
 
   // The rename is durable only once the directory is.
-  FileDescriptor directoryFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  UniqueFd directoryFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (directoryFd.get() < 0) return EkError::fromErrno(errno, fmt::format("open {}", directory));
   if (::fsync(directoryFd.get()) != 0) {
     return EkError::fromErrno(errno, fmt::format("fsync {}", directory));

@@ -14,6 +14,7 @@
 #include <cstring>
 #include <limits>
 
+#include "platform/io/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/paths/Directories.h"
 
@@ -31,24 +32,6 @@ constexpr mode_t kFileMode = 0644;
 constexpr const char* kPostingName = ".posting";
 
 // Closes a descriptor on every path out of a function.
-class Fd {
- public:
-  explicit Fd(int fd = -1) : fd_(fd) {}
-  ~Fd() {
-    if (fd_ >= 0) close(fd_);
-  }
-  Fd(Fd&& other) noexcept : fd_(other.release()) {}
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  Fd& operator=(Fd&&) = delete;
-  int get() const { return fd_; }
-  int release() { return std::exchange(fd_, -1); }
-  explicit operator bool() const { return fd_ >= 0; }
-
- private:
-  int fd_;
-};
-
 std::string resolve(const std::string& directory) {
   return directory.empty() ? paths::notificationsDir() : directory;
 }
@@ -77,9 +60,9 @@ Result<void> ensureNotificationsDirectory(const std::string& directory) {
   return {};
 }
 
-Result<Fd> openDirectory(const std::string& directory) {
-  Fd fd(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!fd) return EkError::fromErrno(errno, fmt::format("opening {}", directory));
+Result<UniqueFd> openDirectory(const std::string& directory) {
+  UniqueFd fd(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!fd.valid()) return EkError::fromErrno(errno, fmt::format("opening {}", directory));
   return fd;
 }
 
@@ -96,8 +79,8 @@ std::optional<uint64_t> parseGeneration(std::string_view text) {
 // kMaxFileSize or not a decimal number.
 uint64_t readGeneration(int dirFd, const std::string& name) {
   // O_NONBLOCK: a FIFO planted under the name must not hang the reader.
-  Fd fd(openat(dirFd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-  if (!fd) return 0;
+  UniqueFd fd(openat(dirFd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  if (!fd.valid()) return 0;
   struct stat st {};
   if (fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode)) return 0;
   char buffer[kMaxFileSize + 1];
@@ -148,7 +131,7 @@ Result<uint64_t> post(std::string_view name, const std::string& directory) {
   const std::string dir = resolve(directory);
   const std::string file(name);
   EK_TRY(ensureNotificationsDirectory(dir));
-  Fd dirFd = EK_TRY(openDirectory(dir));
+  UniqueFd dirFd = EK_TRY(openDirectory(dir));
 
   // The directory itself is the lock: it cannot collide with a notification name, and every
   // poster of every process holds it around read-increment-write, so generations only grow.
@@ -167,9 +150,10 @@ Result<uint64_t> post(std::string_view name, const std::string& directory) {
   if (unlinkat(dirFd.get(), kPostingName, 0) != 0 && errno != ENOENT) {
     return EkError::fromErrno(errno, fmt::format("removing {}/{}", dir, kPostingName));
   }
-  Fd tmp(openat(dirFd.get(), kPostingName, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC,
-                kFileMode));
-  if (!tmp) return EkError::fromErrno(errno, fmt::format("creating {}/{}", dir, kPostingName));
+  UniqueFd tmp(openat(dirFd.get(), kPostingName,
+                      O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, kFileMode));
+  if (!tmp.valid())
+    return EkError::fromErrno(errno, fmt::format("creating {}/{}", dir, kPostingName));
   if (fchmod(tmp.get(), kFileMode) != 0) {
     return EkError::fromErrno(errno, fmt::format("setting the mode of {}/{}", dir, kPostingName));
   }
@@ -193,8 +177,8 @@ Result<uint64_t> post(std::string_view name, const std::string& directory) {
 
 uint64_t generation(std::string_view name, const std::string& directory) {
   if (!checkName(name).ok()) return 0;
-  Fd dirFd(open(resolve(directory).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!dirFd) return 0;
+  UniqueFd dirFd(open(resolve(directory).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!dirFd.valid()) return 0;
   return readGeneration(dirFd.get(), std::string(name));
 }
 

@@ -7,25 +7,12 @@
 #include <unistd.h>
 
 #include "platform/dmap/Dmap.h"
+#include "platform/io/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/paths/Directories.h"
 
 namespace ek::prefs {
 namespace {
-
-class Descriptor {
- public:
-  explicit Descriptor(int fd) : fd_(fd) {}
-  Descriptor(const Descriptor&) = delete;
-  Descriptor& operator=(const Descriptor&) = delete;
-  ~Descriptor() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 std::string directoryOf(const std::string& path) {
   return path.substr(0, path.rfind('/'));
@@ -147,7 +134,7 @@ void PreferencesDomain::reload(bool force) {
 
   // Read through one descriptor so the stamp kept is that of the bytes parsed, even when the
   // file is replaced meanwhile. O_NONBLOCK keeps a FIFO put here from stalling the reader.
-  Descriptor fd(::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+  UniqueFd fd(::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
   if (fd.get() < 0) {
     const int error = errno;
     if (error == ENOENT) {
@@ -218,7 +205,7 @@ Result<void> PreferencesDomain::modify(const std::function<bool(Dictionary&)>& c
   EK_TRY(paths::ensureDirectory(directory, 0755));
   // Writers of other processes hold the same lock while they read and replace a file, so
   // neither loses the keys the other set. The lock goes with the descriptor.
-  Descriptor lockFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  UniqueFd lockFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (lockFd.get() < 0) return EkError::fromErrno(errno, fmt::format("open {}", directory));
   while (::flock(lockFd.get(), LOCK_EX) != 0) {
     if (errno != EINTR) return EkError::fromErrno(errno, fmt::format("lock {}", directory));

@@ -9,6 +9,7 @@
 #include <system_error>
 
 #include "platform/dmap/Dmap.h"
+#include "platform/io/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/paths/Directories.h"
 
@@ -17,20 +18,6 @@ namespace ek::privo {
 namespace {
 
 constexpr std::string_view kLogUnusableFile = "ignoring unusable consent file %@: %{public}@";
-
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd) : fd_(fd) {}
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  ~FileDescriptor() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 std::string errnoText(int code) {
   return std::generic_category().message(code);
@@ -95,7 +82,7 @@ void FileConsent::synchronize() {
   };
 
   // Non-blocking, so a FIFO planted in place of the file cannot stall the caller.
-  FileDescriptor fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+  UniqueFd fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
   if (fd.get() < 0) {
     const int code = errno;
     if (code == ENOENT || code == ENOTDIR) {

@@ -13,26 +13,6 @@
 
 namespace ek {
 
-UniqueFd& UniqueFd::operator=(UniqueFd&& other) noexcept {
-  if (this != &other) reset(other.release());
-  return *this;
-}
-
-UniqueFd::~UniqueFd() {
-  reset();
-}
-
-int UniqueFd::release() {
-  int fd = fd_;
-  fd_ = -1;
-  return fd;
-}
-
-void UniqueFd::reset(int fd) {
-  if (fd_ >= 0) ::close(fd_);
-  fd_ = fd;
-}
-
 namespace {
 
 std::shared_ptr<UniqueFd> openPidfd(pid_t pid) {

@@ -6,27 +6,9 @@
 #include <optional>
 #include <string>
 
+#include "platform/io/UniqueFd.h"
+
 namespace ek {
-
-// An owned file descriptor, closed on destruction.
-class UniqueFd {
- public:
-  UniqueFd() = default;
-  explicit UniqueFd(int fd) : fd_(fd) {}
-  UniqueFd(UniqueFd&& other) noexcept : fd_(other.release()) {}
-  UniqueFd& operator=(UniqueFd&& other) noexcept;
-  UniqueFd(const UniqueFd&) = delete;
-  UniqueFd& operator=(const UniqueFd&) = delete;
-  ~UniqueFd();
-
-  int get() const { return fd_; }
-  bool valid() const { return fd_ >= 0; }
-  int release();
-  void reset(int fd = -1);
-
- private:
-  int fd_ = -1;
-};
 
 // A peer's identity, read once when its connection is accepted. The pidfd refers to that one
 // process: after reading anything about the pid from /proc, confirm with alive() that the
