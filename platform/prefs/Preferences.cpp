@@ -66,22 +66,6 @@ std::string domainPath(std::string_view domain, uid_t uid) {
       fmt::format("{}.dmap", domain));
 }
 
-bool PreferencesDomain::Stamp::operator==(const Stamp& other) const {
-  return device == other.device && inode == other.inode && size == other.size &&
-         modified.tv_sec == other.modified.tv_sec && modified.tv_nsec == other.modified.tv_nsec &&
-         changed.tv_sec == other.changed.tv_sec && changed.tv_nsec == other.changed.tv_nsec;
-}
-
-PreferencesDomain::Stamp PreferencesDomain::stampOf(const struct stat& status) {
-  Stamp stamp;
-  stamp.device = status.st_dev;
-  stamp.inode = status.st_ino;
-  stamp.size = status.st_size;
-  stamp.modified = status.st_mtim;
-  stamp.changed = status.st_ctim;
-  return stamp;
-}
-
 PreferencesDomain::PreferencesDomain(std::string domain, std::string path)
     : domain_(std::move(domain)), path_(std::move(path)) {}
 
@@ -130,7 +114,7 @@ void PreferencesDomain::reload(bool force) {
     noteFailure(EkError::fromErrno(error, fmt::format("stat {}", path_)));
     return;
   }
-  if (!force && current_ && stamp_ && *stamp_ == stampOf(status)) return;
+  if (!force && current_ && stamp_ && *stamp_ == FileStamp::of(status)) return;
 
   // Read through one descriptor so the stamp kept is that of the bytes parsed, even when the
   // file is replaced meanwhile. O_NONBLOCK keeps a FIFO put here from stalling the reader.
@@ -156,7 +140,7 @@ void PreferencesDomain::reload(bool force) {
     noteFailure(EkError::fromErrno(errno, fmt::format("fstat {}", path_)));
     return;
   }
-  stamp_ = stampOf(status);
+  stamp_ = FileStamp::of(status);
   current_ = true;
   Result<std::string> bytes = readAll(fd.get(), status, path_);
   if (!bytes) {
@@ -224,7 +208,7 @@ Result<void> PreferencesDomain::modify(const std::function<bool(Dictionary&)>& c
   readError_.reset();
   struct stat status {};
   if (::stat(path_.c_str(), &status) == 0) {
-    stamp_ = stampOf(status);
+    stamp_ = FileStamp::of(status);
     current_ = true;
   } else {
     current_ = false;

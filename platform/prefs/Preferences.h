@@ -12,6 +12,7 @@
 #include <string_view>
 #include <utility>
 
+#include "platform/io/FileStamp.h"
 #include "platform/value/Result.h"
 #include "platform/value/Value.h"
 
@@ -67,19 +68,7 @@ class PreferencesDomain {
   Result<void> removeAll();
 
  private:
-  // What identifies one version of the file.
-  struct Stamp {
-    dev_t device = 0;
-    ino_t inode = 0;
-    off_t size = 0;
-    struct timespec modified {};
-    struct timespec changed {};
-    bool operator==(const Stamp& other) const;
-  };
-
   PreferencesDomain(std::string domain, std::string path);
-
-  static Stamp stampOf(const struct stat& status);
 
   // REQUIRES: mutex_ held. Re-reads when the stamp changed, or always when force is set.
   void reload(bool force);
@@ -98,10 +87,10 @@ class PreferencesDomain {
   // Whether stamp_ describes the file read last (false before the first read and after a
   // failure to look at the file, so the next synchronize() reads again).
   bool current_ = false;
-  std::optional<Stamp> stamp_;  // of the file read last; nothing when it was missing
+  std::optional<FileStamp> stamp_;  // of the file read last; nothing when it was missing
   std::optional<EkError> readError_;
   // The version of the file and the failure logged last, so each is logged once.
-  std::optional<std::pair<std::optional<Stamp>, std::string>> logged_;
+  std::optional<std::pair<std::optional<FileStamp>, std::string>> logged_;
 };
 
 // The daemon's seam: one value of one domain, as it stands now.

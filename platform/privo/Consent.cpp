@@ -48,11 +48,6 @@ void insertSorted(std::vector<std::string>& services, std::string service) {
 
 }  // namespace
 
-bool FileConsent::Stamp::operator==(const Stamp& other) const {
-  return device == other.device && inode == other.inode && size == other.size &&
-         modified.tv_sec == other.modified.tv_sec && modified.tv_nsec == other.modified.tv_nsec;
-}
-
 FileConsent::FileConsent(std::string stateDirectory) : stateDirectory_(std::move(stateDirectory)) {}
 
 std::string FileConsent::path() const {
@@ -71,11 +66,11 @@ std::vector<std::string> FileConsent::grantedServices(
 
 void FileConsent::synchronize() {
   const std::string file = path();
-  auto fail = [&](std::optional<Stamp> stamp, std::string reason) {
+  auto fail = [&](std::optional<FileStamp> stamp, std::string reason) {
     granted_.clear();
     stamp_ = stamp;
     read_ = stamp.has_value();
-    std::pair<std::optional<Stamp>, std::string> failure{stamp, reason};
+    std::pair<std::optional<FileStamp>, std::string> failure{stamp, reason};
     if (logged_ == failure) return;
     logged_ = std::move(failure);
     log::ops().error(kLogUnusableFile, file, reason);
@@ -100,11 +95,7 @@ void FileConsent::synchronize() {
     fail(std::nullopt, errnoText(errno));
     return;
   }
-  Stamp stamp;
-  stamp.device = status.st_dev;
-  stamp.inode = status.st_ino;
-  stamp.size = status.st_size;
-  stamp.modified = status.st_mtim;
+  const FileStamp stamp = FileStamp::of(status);
   if (read_ && stamp_ == stamp) return;
 
   if (!S_ISREG(status.st_mode)) {

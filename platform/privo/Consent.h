@@ -11,6 +11,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/io/FileStamp.h"
 #include "platform/value/Value.h"
 
 // Privo, privacy consent: which consent services the user granted to each application.
@@ -48,14 +49,6 @@ class FileConsent final : public Consent {
   std::string path() const;
 
  private:
-  struct Stamp {
-    dev_t device = 0;
-    ino_t inode = 0;
-    off_t size = 0;
-    struct timespec modified {};
-    bool operator==(const Stamp& other) const;
-  };
-
   // REQUIRES: mutex_ held.
   void synchronize();
 
@@ -64,10 +57,10 @@ class FileConsent final : public Consent {
   // Guarded by mutex_: the granted services per application as of the file read last.
   std::map<std::string, std::vector<std::string>, std::less<>> granted_;
   // Of the file read last; nothing when it was missing or never looked at.
-  std::optional<Stamp> stamp_;
+  std::optional<FileStamp> stamp_;
   bool read_ = false;
   // The version of the file whose failure was logged last, so each is logged once.
-  std::optional<std::pair<std::optional<Stamp>, std::string>> logged_;
+  std::optional<std::pair<std::optional<FileStamp>, std::string>> logged_;
 };
 
 // In memory, set by tests.

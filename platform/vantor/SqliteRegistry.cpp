@@ -1211,21 +1211,16 @@ std::string SqliteRegistry::languageLocked() {
 void SqliteRegistry::checkLocale() {
   std::string file = paths::join(options_.stateDir, "locale");
   struct stat st {};
-  bool exists = ::stat(file.c_str(), &st) == 0;
+  std::optional<FileStamp> stamp;
+  if (::stat(file.c_str(), &st) == 0) stamp = FileStamp::of(st);
   bool changed = false;
   {
     std::lock_guard lock(localeMutex_);
-    bool same = localeSeen_ && exists == localeExists_ &&
-                (!exists || (st.st_ino == localeStat_.st_ino && st.st_dev == localeStat_.st_dev &&
-                             st.st_size == localeStat_.st_size &&
-                             st.st_mtim.tv_sec == localeStat_.st_mtim.tv_sec &&
-                             st.st_mtim.tv_nsec == localeStat_.st_mtim.tv_nsec));
-    if (same) return;
+    if (localeSeen_ && stamp == localeStamp_) return;
     changed = localeSeen_;
     localeSeen_ = true;
-    localeExists_ = exists;
-    localeStat_ = st;
-    fileLanguage_ = exists ? readLocaleFile(file) : std::nullopt;
+    localeStamp_ = stamp;
+    fileLanguage_ = stamp ? readLocaleFile(file) : std::nullopt;
   }
   if (changed) {
     log::vr().defaultLevel("locale file %s changed", file);

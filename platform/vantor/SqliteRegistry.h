@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/codesign/CodeSigning.h"
+#include "platform/io/FileStamp.h"
 #include "platform/queue/SerialQueue.h"
 #include "platform/vantor/Registry.h"
 
@@ -117,8 +118,7 @@ class SqliteRegistry : public Registry {
 
   std::mutex localeMutex_;
   bool localeSeen_ = false;
-  struct stat localeStat_ {};
-  bool localeExists_ = false;
+  std::optional<FileStamp> localeStamp_;     // nothing while the file is missing
   std::optional<std::string> fileLanguage_;  // the locale file's language as last seen
 };
 
