@@ -154,6 +154,10 @@ class SystemCodeSigning : public CodeSigning {
     return std::make_shared<ListedTask>(load(*path, named));
   }
 
+  std::optional<std::vector<std::string>> entitlementSources(const std::string& path) override {
+    return std::vector<std::string>{path, path + ".entitlements"};
+  }
+
   Dictionary entitlementsForExecutable(const std::string& path) override {
     struct stat st {};
     if (::stat(path.c_str(), &st) != 0) return {};

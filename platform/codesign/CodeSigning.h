@@ -6,6 +6,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/process/Process.h"
 #include "platform/value/Result.h"
@@ -31,6 +32,13 @@ class CodeSigning {
   virtual std::shared_ptr<CodeSigningTask> taskForAuditToken(const AuditToken& token) = 0;
   // The entitlements of a program file (empty when it has none or they are refused).
   virtual Dictionary entitlementsForExecutable(const std::string& path) = 0;
+  // The files whose state alone decides entitlementsForExecutable(path), so that a caller may
+  // keep its answer while none of them changes; absent when the answer does not come from
+  // files alone.
+  virtual std::optional<std::vector<std::string>> entitlementSources(const std::string& path) {
+    (void)path;
+    return std::nullopt;
+  }
 
   // The real implementation over the file system.
   static std::shared_ptr<CodeSigning> system();

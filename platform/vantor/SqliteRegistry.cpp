@@ -11,11 +11,14 @@
 #include <filesystem>
 #include <map>
 #include <set>
+#include <unordered_map>
+#include <unordered_set>
 
 #include "platform/cbor/Cbor.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/log/Log.h"
 #include "platform/paths/Directories.h"
+#include "platform/vantor/BundleSources.h"
 
 namespace ek::vantor {
 namespace {
@@ -24,7 +27,7 @@ namespace fs = std::filesystem;
 
 // Bumped whenever the tables change; a file with another version is set aside and rebuilt
 // (the registry is derived data: the installer and the start-up scan can always refill it).
-constexpr int kSchemaVersion = 1;
+constexpr int kSchemaVersion = 2;
 // Bounds on what one bundle may make the registry read.
 constexpr size_t kMaxPlugInsPerApplication = 4096;
 constexpr size_t kMaxLanguagesPerBundle = 512;
@@ -32,6 +35,14 @@ constexpr size_t kMaxSystemBundles = 65536;
 // Negative: KiB. Enough for the pages of tens of thousands of plug-ins, so that lookups are
 // answered from memory; the file belongs to this process alone (exclusive locking).
 constexpr int kCacheSizeKiB = 32 * 1024;
+
+// What each plug-in was read from (BundleSources), apart from the plug-ins' rows so that the
+// start-up scan reads only this.
+#define SOURCES_SCHEMA                                                                         \
+  "CREATE TABLE plugin_sources(path TEXT PRIMARY KEY, container TEXT, sources BLOB NOT NULL) " \
+  "WITHOUT ROWID; "                                                                            \
+  "CREATE TRIGGER plugins_forget_sources AFTER DELETE ON plugins BEGIN "                       \
+  "DELETE FROM plugin_sources WHERE path = old.path; END;"
 
 constexpr const char* kSchema = R"sql(
 CREATE TABLE meta(key TEXT PRIMARY KEY, value BLOB NOT NULL);
@@ -62,7 +73,7 @@ CREATE TABLE plugin_points(point TEXT NOT NULL, uuid BLOB NOT NULL, PRIMARY KEY(
   WITHOUT ROWID;
 CREATE INDEX plugin_points_uuid ON plugin_points(uuid);
 CREATE TABLE extension_points(identifier TEXT PRIMARY KEY, sdk BLOB NOT NULL);
-)sql";
+)sql" SOURCES_SCHEMA;
 
 constexpr const char* kPlugInColumns =
     "p.uuid, p.path, p.identifier, p.original_identifier, p.version, p.app_path, p.point, "
@@ -125,7 +136,9 @@ std::vector<std::string> subdirectories(const std::string& dir, std::string_view
     std::string name = it->path().filename().string();
     if (name.empty() || name.front() == '.') continue;
     if (!suffix.empty() && !endsWith(name, suffix)) continue;
-    if (!isDirectory(it->path().string())) continue;
+    // The entry's type from the directory itself where it has one (a symlink is followed).
+    std::error_code typeError;
+    if (!it->is_directory(typeError)) continue;
     if (names.size() == limit) {
       truncated = true;
       break;
@@ -136,7 +149,12 @@ std::vector<std::string> subdirectories(const std::string& dir, std::string_view
   return names;
 }
 
-Result<Dictionary> readInfo(const std::string& bundle) {
+// With sources, notes the files read (see BundleSources) before reading them.
+Result<Dictionary> readInfo(const std::string& bundle, BundleSources* sources = nullptr) {
+  if (sources) {
+    sources->note(bundle);
+    sources->note(paths::join(bundle, "Info.dmap"));
+  }
   if (!isDirectory(bundle)) {
     return makeError(kMalformedBundle, fmt::format("{} is not a bundle directory", bundle));
   }
@@ -154,12 +172,17 @@ Result<Dictionary> readInfo(const std::string& bundle) {
 
 // Every <language>.lproj/InfoDmap.strings of the bundle: language -> table. A malformed table
 // is logged and left out; it does not make the bundle malformed.
-Dictionary readInfoStrings(const std::string& bundle) {
+Dictionary readInfoStrings(const std::string& bundle, BundleSources* sources = nullptr) {
   Dictionary tables;
   bool truncated = false;
   for (const std::string& dir :
        subdirectories(bundle, ".lproj", kMaxLanguagesPerBundle, truncated)) {
     std::string file = paths::join(paths::join(bundle, dir), "InfoDmap.strings");
+    if (sources) {
+      // The directory too: a table created in it later changes the directory's stamp.
+      sources->note(paths::join(bundle, dir));
+      sources->note(file);
+    }
     auto value = dmap::readFile(file);
     if (!value.ok()) {
       if (!value.error().isPosix(ENOENT)) {
@@ -239,6 +262,7 @@ struct PlugInPlan {
   Dictionary entitlements;
   std::optional<std::string> container;
   Dictionary strings;
+  std::optional<std::vector<uint8_t>> sources;  // see BundleSources
 };
 
 struct SqliteRegistry::Plan {
@@ -273,13 +297,18 @@ struct SqliteRegistry::Statements {
   sqlite3_stmt* plugInsOfPoint = nullptr;
   sqlite3_stmt* upsertSdk = nullptr;
   sqlite3_stmt* sdkOf = nullptr;
+  sqlite3_stmt* setSources = nullptr;
+  sqlite3_stmt* forgetSources = nullptr;
+  sqlite3_stmt* allSources = nullptr;
+  sqlite3_stmt* allPlugInPaths = nullptr;
 
   std::vector<sqlite3_stmt**> all() {
     return {&begin,          &commit,       &rollback,     &setMeta,          &getMeta,
             &upsertApp,      &deleteApp,    &appByPath,    &appByIdentifier,  &appExists,
             &allApps,        &insertPlugIn, &deletePlugIn, &insertPoint,      &deletePoints,
             &plugInByUuid,   &plugInByPath, &plugInsOfApp, &plugInUuidsOfApp, &allPlugIns,
-            &plugInsOfPoint, &upsertSdk,    &sdkOf};
+            &plugInsOfPoint, &upsertSdk,    &sdkOf,        &setSources,       &allSources,
+            &allPlugInPaths, &forgetSources};
   }
   ~Statements() {
     for (sqlite3_stmt** statement : all()) sqlite3_finalize(*statement);
@@ -473,6 +502,15 @@ OpenResult openAndCheck(const std::string& path, sqlite3** out) {
       execute(db, "ROLLBACK");
       return result;
     }
+  } else if (version == "1") {
+    // Version 1 lacked the record of each plug-in's sources: without one, the next scan reads
+    // the bundle and records it.
+    const char* upgrade = "BEGIN; " SOURCES_SCHEMA " PRAGMA user_version=2; COMMIT;";
+    if ((rc = sqlite3_exec(db, upgrade, nullptr, nullptr, nullptr)) != SQLITE_OK) {
+      OpenResult result = failure(db, rc, "upgrading the registry schema");
+      execute(db, "ROLLBACK");
+      return result;
+    }
   } else if (version != std::to_string(kSchemaVersion)) {
     return {OpenOutcome::Corrupt,
             makeError(kDatabase,
@@ -480,7 +518,10 @@ OpenResult openAndCheck(const std::string& path, sqlite3** out) {
   }
   if ((rc = execute(db, fmt::format("PRAGMA cache_size=-{}", kCacheSizeKiB).c_str())) !=
           SQLITE_OK ||
-      (rc = execute(db, "PRAGMA synchronous=FULL")) != SQLITE_OK) {
+      (rc = execute(db, "PRAGMA synchronous=FULL")) != SQLITE_OK ||
+      // After a checkpoint the log is cut back to this, rather than keeping the size of the
+      // largest change ever made (a first registration of thousands of bundles).
+      (rc = execute(db, "PRAGMA journal_size_limit=8388608")) != SQLITE_OK) {
     return failure(db, rc, "configuring the registry database");
   }
   return {};
@@ -555,6 +596,14 @@ Result<void> SqliteRegistry::prepareSchema() {
        "INSERT INTO plugins(uuid, path, identifier, original_identifier, version, app_path, "
        "point, info, sdk, entitlements, registered, container, strings) "
        "VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, ?11, ?12, ?13)"},
+      {&s.setSources,
+       "INSERT OR REPLACE INTO plugin_sources(path, container, sources) VALUES(?1, ?2, ?3)"},
+      {&s.forgetSources, "DELETE FROM plugin_sources WHERE path = ?1"},
+      // Joined: a record is only good for a plug-in still registered at its path.
+      {&s.allSources,
+       "SELECT s.path, s.container, s.sources FROM plugin_sources s "
+       "JOIN plugins p ON p.path = s.path"},
+      {&s.allPlugInPaths, "SELECT path FROM plugins ORDER BY path"},
       {&s.deletePlugIn, "DELETE FROM plugins WHERE uuid = ?1"},
       {&s.insertPoint, "INSERT OR IGNORE INTO plugin_points(point, uuid) VALUES(?1, ?2)"},
       {&s.deletePoints, "DELETE FROM plugin_points WHERE uuid = ?1"},
@@ -617,13 +666,14 @@ struct BundleReader {
     return plan;
   }
 
-  std::optional<Dictionary> readSdk(const std::string& point) {
+  std::optional<Dictionary> readSdk(const std::string& point, BundleSources* sources) {
     if (!checkPlugInIdentifier(point).ok()) {
       log::vr().error("extension point \"%s\" cannot name an SDK file", point);
       return std::nullopt;
     }
     std::string file =
         paths::join(paths::join(options.systemRoot, "Library/ExtensionPoints"), point + ".dmap");
+    if (sources) sources->noteShared(file);
     auto value = dmap::readFile(file);
     if (!value.ok()) {
       if (value.error().isPosix(ENOENT)) {
@@ -640,8 +690,14 @@ struct BundleReader {
     return std::move(*value->dictionary());
   }
 
+  // What reading a bundle depends on besides its files.
+  std::string sourcesContext() const {
+    return fmt::format("{}\n{}\n{}", options.stateDir, options.systemRoot, ::geteuid());
+  }
+
   Result<PlugInPlan> readPlugIn(const std::string& path) {
-    Dictionary own = EK_TRY(readInfo(path));
+    BundleSources sources(sourcesContext(), options.settleSeconds);
+    Dictionary own = EK_TRY(readInfo(path, &sources));
     auto identifier = stringValue(own, kBundleIdentifierKey);
     if (!identifier) {
       return makeError(kMalformedBundle,
@@ -671,10 +727,16 @@ struct BundleReader {
         return makeError(kMalformedBundle,
                          fmt::format("{}: QvBundleExecutable is not a file name", path));
       }
-      plan.entitlements = options.codeSigning->entitlementsForExecutable(paths::join(path, *name));
+      std::string program = paths::join(path, *name);
+      if (auto files = options.codeSigning->entitlementSources(program)) {
+        for (const std::string& file : *files) sources.note(file);
+      } else {
+        sources.markUncheckable();
+      }
+      plan.entitlements = options.codeSigning->entitlementsForExecutable(program);
     }
     if (plan.point) {
-      if (auto sdk = readSdk(*plan.point)) plan.sdk = std::move(*sdk);
+      if (auto sdk = readSdk(*plan.point, &sources)) plan.sdk = std::move(*sdk);
     }
     plan.info = mergeSdk(plan.sdk, own);
     Dictionary* merged = plan.info[std::string(kExtensionKey)].dictionary();
@@ -691,7 +753,8 @@ struct BundleReader {
     if (!dataOnly) {
       plan.container = paths::join(paths::join(options.stateDir, "containers"), plan.identifier);
     }
-    plan.strings = readInfoStrings(path);
+    plan.strings = readInfoStrings(path, &sources);
+    plan.sources = sources.record();
     std::string parent = parentOf(path);
     if (baseName(parent) == "PlugIns" && endsWith(parentOf(parent), ".app")) {
       plan.appPath = parentOf(parent);
@@ -852,6 +915,15 @@ Result<void> SqliteRegistry::applyPlan(Plan& plan) {
           .optionalText(12, plugIn.container)
           .blob(13, encodeDictionary(plugIn.strings));
       if (insert.step() != SQLITE_DONE) return fail("registering a plug-in");
+      if (plugIn.sources) {
+        Use record(s.setSources);
+        record.text(1, plugIn.path).optionalText(2, plugIn.container).blob(3, *plugIn.sources);
+        if (record.step() != SQLITE_DONE) return fail("recording a plug-in's sources");
+      } else {
+        Use forget(s.forgetSources);
+        forget.text(1, plugIn.path);
+        if (forget.step() != SQLITE_DONE) return fail("recording a plug-in's sources");
+      }
       for (const std::string& value : extensionPointIndexValues(plugIn.info)) {
         Use point(s.insertPoint);
         point.text(1, extensionPointIndexKey(value)).uuid(2, uuid);
@@ -935,21 +1007,95 @@ Result<void> SqliteRegistry::unregisterLocked(const std::string& path) {
   return {};
 }
 
+// Records are only an optimisation: a failure to keep them costs the next scan time, nothing
+// else, and changes nothing anyone can see (no knowledge change, no notices).
+void SqliteRegistry::recordSources(const Plan& plan) {
+  std::lock_guard db(dbMutex_);
+  Statements& s = *statements_;
+  if (Use(s.begin).step() != SQLITE_DONE) {
+    log::vr().error("cannot record plug-ins' sources: %s", sqlite3_errmsg(db_));
+    return;
+  }
+  for (const PlugInPlan& plugIn : plan.plugIns) {
+    if (!plugIn.sources) continue;
+    Use record(s.setSources);
+    record.text(1, plugIn.path).optionalText(2, plugIn.container).blob(3, *plugIn.sources);
+    if (record.step() != SQLITE_DONE) {
+      log::vr().error("cannot record the sources of %s: %s", plugIn.path, sqlite3_errmsg(db_));
+      Use(s.rollback).step();
+      return;
+    }
+  }
+  if (Use(s.commit).step() != SQLITE_DONE) {
+    log::vr().error("cannot record plug-ins' sources: %s", sqlite3_errmsg(db_));
+    Use(s.rollback).step();
+  }
+}
+
+namespace {
+
+// A data container outlives registrations, but someone may have removed it.
+void ensureContainer(const std::string& container, const std::string& bundle) {
+  std::string tmp = paths::join(container, "tmp");
+  if (isDirectory(tmp)) return;
+  if (auto made = paths::ensureDirectory(tmp); !made.ok()) {
+    log::vr().error("cannot make the data container of %s: %s", bundle, made.error().message);
+  }
+}
+
+}  // namespace
+
 void SqliteRegistry::reconcile() {
   std::lock_guard change(changeMutex_);
   BundleReader reader{options_};
   std::string dir = paths::join(options_.systemRoot, "Library/PlugIns");
+
+  // What each plug-in was last read from: a bundle whose sources all stat as recorded reads
+  // the same as it did, so it is left alone without opening a file.
+  struct Recorded {
+    std::optional<std::string> container;
+    std::vector<uint8_t> sources;
+  };
+  std::unordered_map<std::string, Recorded> recorded;
+  {
+    std::lock_guard db(dbMutex_);
+    Use list(statements_->allSources);
+    while (list.step() == SQLITE_ROW) {
+      sqlite3_stmt* row = list.get();
+      auto path = columnText(row, 0);
+      if (!path) continue;
+      const auto* bytes = static_cast<const uint8_t*>(sqlite3_column_blob(row, 2));
+      int size = sqlite3_column_bytes(row, 2);
+      recorded.emplace(std::move(*path),
+                       Recorded{columnText(row, 1), std::vector<uint8_t>(bytes, bytes + size)});
+    }
+  }
+  BundleSources::Checker checker(reader.sourcesContext());
+
+  // Unchanged bundles read again: their new records, written together at the end.
+  Plan fresh;
   bool truncated = false;
-  for (const std::string& name : subdirectories(dir, "", kMaxSystemBundles, truncated)) {
+  std::vector<std::string> names = subdirectories(dir, "", kMaxSystemBundles, truncated);
+  std::unordered_set<std::string> present;
+  present.reserve(names.size());
+  size_t untouched = 0;
+  for (const std::string& name : names) {
     std::string path = paths::join(dir, name);
-    Plan plan;
+    present.insert(path);
+    if (auto known = recorded.find(path);
+        known != recorded.end() && checker.unchanged(known->second.sources)) {
+      if (known->second.container) ensureContainer(*known->second.container, path);
+      ++untouched;
+      continue;
+    }
     auto plugIn = reader.readPlugIn(path);
     if (!plugIn.ok()) {
       log::vr().error("not registering system plug-in %s: %s", path, plugIn.error().message);
       continue;
     }
-    // A bundle registered exactly as it reads now is left alone: re-registering every system
-    // plug-in at each start would cost a commit, a knowledge change and notices per bundle.
+    // A bundle registered exactly as it reads now is left alone: re-registering it would cost
+    // a commit, a knowledge change and notices. Its new record of sources is kept, so that
+    // the next scan need not read it.
     bool unchanged = false;
     {
       std::lock_guard db(dbMutex_);
@@ -967,27 +1113,28 @@ void SqliteRegistry::reconcile() {
       }
     }
     if (unchanged) {
-      if (plugIn->container) {
-        if (auto made = paths::ensureDirectory(paths::join(*plugIn->container, "tmp"));
-            !made.ok()) {
-          log::vr().error("cannot make the data container of %s: %s", path, made.error().message);
-        }
-      }
+      if (plugIn->container) ensureContainer(*plugIn->container, path);
+      if (plugIn->sources) fresh.plugIns.push_back(std::move(plugIn).value());
       continue;
     }
+    Plan plan;
     plan.plugIns.push_back(std::move(plugIn).value());
     if (auto applied = applyPlan(plan); !applied.ok()) {
       log::vr().error("not registering system plug-in %s: %s", path, applied.error().message);
     }
   }
   if (truncated) log::vr().error("%s: too many bundles; the rest ignored", dir);
+  log::vr().info("%zu system bundles: %zu unchanged since they were last read, %zu read",
+                 names.size(), untouched, names.size() - untouched);
+  if (!fresh.plugIns.empty()) recordSources(fresh);
 
   std::vector<std::string> gone;
   {
     std::lock_guard db(dbMutex_);
-    Use list(statements_->allPlugIns);
-    for (const PlugInProxyPtr& plugIn : readAllLocked(list.get())) {
-      if (isGone(plugIn->path)) gone.push_back(plugIn->path);
+    Use list(statements_->allPlugInPaths);
+    while (list.step() == SQLITE_ROW) {
+      auto path = columnText(list.get(), 0);
+      if (path && !present.contains(*path) && isGone(*path)) gone.push_back(*path);
     }
     Use apps(statements_->allApps);
     while (apps.step() == SQLITE_ROW) {

@@ -10,6 +10,7 @@
 #include "platform/codesign/CodeSigning.h"
 #include "platform/io/FileStamp.h"
 #include "platform/queue/SerialQueue.h"
+#include "platform/vantor/BundleSources.h"
 #include "platform/vantor/Registry.h"
 
 struct sqlite3;
@@ -40,6 +41,9 @@ class SqliteRegistry : public Registry {
     // Told about everything the start-up scan installs and uninstalls.
     std::vector<std::weak_ptr<RegistryObserver>> observers;
     bool scanOnOpen = true;
+    // How long a file must have been left alone before the scan trusts its stamp (see
+    // BundleSources); tests shorten it.
+    int64_t settleSeconds = BundleSources::kSettleSeconds;
   };
 
   static Result<std::shared_ptr<SqliteRegistry>> open(Options options);
@@ -66,7 +70,8 @@ class SqliteRegistry : public Registry {
 
   // The start-up scan: registers every bundle under <systemRoot>/Library/PlugIns/ and
   // unregisters every plug-in and application whose bundle directory no longer exists.
-  // A bundle that fails to register is logged and skipped.
+  // A bundle that fails to register is logged and skipped. A bundle none of whose files
+  // changed since it was last read (see BundleSources) is not read again.
   void reconcile();
 
   // Compares the locale file with what was seen last and, when it changed, raises the
@@ -87,6 +92,8 @@ class SqliteRegistry : public Registry {
 
   // Under changeMutex_.
   Result<void> applyPlan(Plan& plan);
+  // Under changeMutex_: keeps the plan's plug-ins' records of sources, in one transaction.
+  void recordSources(const Plan& plan);
   // REQUIRES: dbMutex_ held, inside a transaction. Rolls it back and answers the error.
   EkError rollback(std::string_view what);
   // REQUIRES: dbMutex_ held, inside a transaction. Changes the knowledge UUID and commits.

@@ -11,6 +11,7 @@
 #include <fstream>
 
 #include "platform/dmap/Dmap.h"
+#include "platform/log/testing/CapturingSink.h"
 #include "platform/paths/Directories.h"
 
 namespace ek::vantor {
@@ -117,7 +118,7 @@ class SqliteRegistryTest : public ::testing::Test {
     fs::remove_all(root_);
   }
 
-  SqliteRegistry::Options options() {
+  virtual SqliteRegistry::Options options() {
     SqliteRegistry::Options options;
     options.stateDir = state_;
     options.systemRoot = system_;
@@ -580,6 +581,142 @@ size_t asideDatabases(const std::string& dir) {
     if (!name.ends_with("-wal") && !name.ends_with("-shm")) ++count;
   }
   return count;
+}
+
+// The start-up scan with trusted stamps (no settling time) and entitlements from files, as in
+// the daemon: what it leaves alone and what it reads again.
+class StartUpScanTest : public SqliteRegistryTest {
+ protected:
+  void SetUp() override {
+    SqliteRegistryTest::SetUp();
+    log::configure("info");
+    log::setSink(sink_);
+    Dictionary info = plugInInfo("com.example.spell", "com.x.spell");
+    info["QvBundleExecutable"] = Value("spell");
+    spell_ = writePlugIn(system_ + "/Library/PlugIns/SpellCheck.bundle", info);
+    writeText(spell_ + "/spell", "#!/bin/sh\n");
+    writeDmap(spell_ + "/fr.lproj/InfoDmap.strings",
+              {{"QvBundleDisplayName", Value("Orthographe")}});
+    writeDmap(system_ + "/Library/ExtensionPoints/com.x.spell.dmap",
+              {{"ZuExtension", Value(Dictionary{{"ZuExtensionPrincipalClass", Value("A")}})}});
+  }
+  void TearDown() override {
+    log::setSink(nullptr);
+    SqliteRegistryTest::TearDown();
+  }
+  SqliteRegistry::Options options() override {
+    SqliteRegistry::Options options = SqliteRegistryTest::options();
+    options.codeSigning = CodeSigning::system();
+    options.settleSeconds = 0;
+    return options;
+  }
+  // Reopens and answers how many system bundles the scan read rather than left alone.
+  int reopenCountingReads() {
+    sink_->clear();
+    open();
+    for (const auto& line : sink_->lines()) {
+      int total = 0, unchanged = 0, read = 0;
+      if (std::sscanf(line.message.c_str(),
+                      "%d system bundles: %d unchanged since they were last read, %d read", &total,
+                      &unchanged, &read) == 3) {
+        return read;
+      }
+    }
+    ADD_FAILURE() << "the scan did not report what it read";
+    return -1;
+  }
+  std::shared_ptr<log::testing::CapturingSink> sink_ =
+      std::make_shared<log::testing::CapturingSink>();
+  std::string spell_;
+};
+
+TEST_F(StartUpScanTest, UnchangedBundlesAreNotReadAgainAndEveryChangedFileIsSeen) {
+  EXPECT_EQ(reopenCountingReads(), 1);
+  Uuid uuid = registry_->plugInByUrl(spell_)->uuid;
+  Uuid knowledge = registry_->knowledgeUuid();
+  EXPECT_EQ(reopenCountingReads(), 0);
+  EXPECT_EQ(registry_->plugInByUrl(spell_)->uuid, uuid);
+  EXPECT_EQ(registry_->knowledgeUuid(), knowledge);
+
+  // Each file the bundle was read from, changed in turn: the next start reads it again and
+  // registers what it now says.
+  Dictionary info = plugInInfo("com.example.spell", "com.x.spell");
+  info["QvBundleExecutable"] = Value("spell");
+  info["QvBundleVersion"] = Value("2.0");
+  writePlugIn(spell_, info);
+  EXPECT_EQ(reopenCountingReads(), 1);
+  EXPECT_EQ(registry_->plugInByUrl(spell_)->bundleVersion, "2.0");
+  EXPECT_EQ(registry_->plugInByUrl(spell_)->uuid, uuid);
+  EXPECT_EQ(reopenCountingReads(), 0);
+
+  writeDmap(spell_ + "/spell.entitlements", {{"com.example.granted", Value(true)}});
+  EXPECT_EQ(reopenCountingReads(), 1);
+  EXPECT_TRUE(registry_->plugInByUrl(spell_)->entitlements.contains("com.example.granted"));
+
+  // Rewritten in place, as an editor would.
+  writeText(spell_ + "/fr.lproj/InfoDmap.strings",
+            dmap::write(Value(Dictionary{{"QvBundleDisplayName", Value("Correcteur")}})).value());
+  EXPECT_EQ(reopenCountingReads(), 1);
+  setenv("EKORA_LOCALE", "fr", 1);
+  EXPECT_EQ(registry_->plugInByUrl(spell_)->localizedName, "Correcteur");
+
+  writeDmap(spell_ + "/de.lproj/InfoDmap.strings",
+            {{"QvBundleDisplayName", Value("Rechtschreibung")}});
+  EXPECT_EQ(reopenCountingReads(), 1);
+  setenv("EKORA_LOCALE", "de", 1);
+  EXPECT_EQ(registry_->plugInByUrl(spell_)->localizedName, "Rechtschreibung");
+
+  writeDmap(system_ + "/Library/ExtensionPoints/com.x.spell.dmap",
+            {{"ZuExtension", Value(Dictionary{{"ZuExtensionPrincipalClass", Value("B")}})}});
+  EXPECT_EQ(reopenCountingReads(), 1);
+  const Value* principal =
+      registry_->plugInByUrl(spell_)->info.at("ZuExtension").get("ZuExtensionPrincipalClass");
+  ASSERT_NE(principal, nullptr);
+  EXPECT_EQ(*principal->string(), "B");
+
+  ::chmod((spell_ + "/spell").c_str(), 0777);  // the entitlements are no longer trusted
+  EXPECT_EQ(reopenCountingReads(), 1);
+  EXPECT_TRUE(registry_->plugInByUrl(spell_)->entitlements.empty());
+}
+
+TEST_F(StartUpScanTest, BundlesAreReadAgainWhenTheirRecordCannotBeTrusted) {
+  open();
+  // Unregistered by hand: the next scan registers it again, unchanged files or not.
+  ASSERT_TRUE(registry_->unregisterBundle(spell_).ok());
+  EXPECT_EQ(reopenCountingReads(), 1);
+  ASSERT_TRUE(registry_->plugInByUrl(spell_));
+
+  // A removed container is made again by a scan that reads nothing.
+  fs::remove_all(containerOf("com.example.spell"));
+  EXPECT_EQ(reopenCountingReads(), 0);
+  EXPECT_TRUE(fs::is_directory(containerOf("com.example.spell") + "/tmp"));
+
+  // Files changed just now may change again unseen within the same tick of the file
+  // system's clock: their stamps are not trusted until they have settled.
+  registry_.reset();
+  SqliteRegistry::Options unsettled = options();
+  unsettled.settleSeconds = 3600;
+  writePlugIn(spell_, plugInInfo("com.example.spell", "com.x.spell"));
+  ASSERT_TRUE(SqliteRegistry::open(unsettled).ok());
+  EXPECT_EQ(reopenCountingReads(), 1);
+  EXPECT_EQ(reopenCountingReads(), 0);
+}
+
+TEST_F(StartUpScanTest, RegistryOfTheFirstSchemaIsUpgradedInPlace) {
+  Uuid uuid = open().plugInByUrl(spell_)->uuid;
+  registry_.reset();
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open(paths::join(state_, "registry.db").c_str(), &db), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(db,
+                         "DROP TRIGGER plugins_forget_sources; DROP TABLE plugin_sources; "
+                         "PRAGMA user_version=1;",
+                         nullptr, nullptr, nullptr),
+            SQLITE_OK);
+  sqlite3_close(db);
+  EXPECT_EQ(reopenCountingReads(), 1);
+  EXPECT_EQ(asideDatabases(state_), 0u);
+  EXPECT_EQ(registry_->plugInByUrl(spell_)->uuid, uuid);
+  EXPECT_EQ(reopenCountingReads(), 0);
 }
 
 TEST_F(SqliteRegistryTest, FileThatIsNotADatabaseIsMovedAsideAndRebuilt) {
