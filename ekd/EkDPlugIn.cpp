@@ -153,8 +153,11 @@ bool EkDPlugIn::initWithVRData(const vantor::PlugInProxy& proxy) {
 
   std::optional<std::string> identifier;
   if (!proxy.identifier.empty()) identifier = proxy.identifier;
-  if (!initWithName(std::move(identifier), url, nullptr, proxy.extensionDictionary(), proxy.uuid)) {
-    return false;
+  // One copy of the info dictionary: the plug-in dictionary is its "ZuExtension", shared.
+  auto info = std::make_shared<const Dictionary>(proxy.info);
+  if (!initWithName(std::move(identifier), url, nullptr, nullptr, proxy.uuid)) return false;
+  if (DictionaryRef plugIn = dictionaryMember(info, pk::kInfoPlugInDictionary)) {
+    setPlugInDictionary(std::move(plugIn));
   }
 
   setLastModified(secondsSince1970(proxy.registrationDate));
@@ -169,8 +172,10 @@ bool EkDPlugIn::initWithVRData(const vantor::PlugInProxy& proxy) {
   setEntitlements(std::make_shared<const Dictionary>(proxy.entitlements));
   setDataContainerURL(urlOfPath(proxy.dataContainerPath));
   {
+    // Current until the registry's knowledge changes, when the proxy says when it was read.
     std::lock_guard lock(infoMutex_);
-    infoDmap_ = std::make_shared<const Dictionary>(proxy.info);
+    infoDmap_ = std::move(info);
+    vrKnowledgeUUID_ = proxy.knowledge;
   }
 
   std::optional<uint32_t> hubProtocolVersion;

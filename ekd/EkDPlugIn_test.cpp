@@ -404,6 +404,32 @@ TEST_F(EkDPlugInTest, AnnotationKeyFollowsTheReplacementEntitlementOnlyWhenItIsA
 
 // ---- Info dictionary refresh -----------------------------------------------------------------
 
+TEST_F(EkDPlugInTest, ProxyThatSaysWhenItWasReadIsNotFetchedAgainUntilTheRegistryChanges) {
+  vantor::PlugInProxy proxy = thumbsProxy();
+  registry_->install(proxy);
+  proxy.knowledge = registry_->knowledgeUuid();
+  const int before = registry_->byUuid.load() + registry_->byUrl.load();
+  auto record = EkDPlugIn::createWithVRData(proxy, context());
+  ASSERT_NE(record, nullptr);
+  ASSERT_NE(record->attribute("ThumbnailMinimumDimension"), nullptr);
+  EXPECT_EQ(registry_->byUuid.load() + registry_->byUrl.load(), before);
+  // The plug-in dictionary of the form is the info dictionary's own.
+  ASSERT_NE(record->plugInDictionary(), nullptr);
+  EXPECT_EQ(record->plugInDictionary().get(), record->infoDmap()->at("ZuExtension").dictionary());
+
+  auto attributes = extensionOf(proxy.info)["ZuExtensionAttributes"].dictionary();
+  (*attributes)["ThumbnailMinimumDimension"] = 64;
+  registry_->install(proxy);
+  EXPECT_EQ(*record->attribute("ThumbnailMinimumDimension"), Value(64));
+  EXPECT_EQ(registry_->byUuid.load(), before + 1);
+
+  // A proxy read at another time than now is fetched again at the first read.
+  proxy.knowledge = Uuid::random();
+  auto stale = build(proxy);
+  ASSERT_NE(stale, nullptr);
+  EXPECT_EQ(registry_->byUuid.load(), before + 2);
+}
+
 TEST_F(EkDPlugInTest, InfoDictionaryIsFetchedAgainOnlyWhenTheRegistryChanges) {
   vantor::PlugInProxy proxy = thumbsProxy();
   auto record = build(proxy);

@@ -61,6 +61,9 @@ struct PlugInProxy {
   std::optional<std::string> localizedShortName;
   std::optional<std::string> extensionPoint;  // ZuExtension's ZuExtensionPointIdentifier
   bool onSystemVolume = false;                // path lies under $EKORA_SYSTEM_ROOT
+  // The registry's knowledge UUID when this proxy was read, so that a holder knows it is
+  // current until the knowledge changes; absent when the registry does not say.
+  std::optional<Uuid> knowledge;
 
   // info["ZuExtension"], or nullptr.
   const Dictionary* extensionDictionary() const;

@@ -1168,6 +1168,7 @@ PlugInProxyPtr SqliteRegistry::readPlugInLocked(void* raw) {
   proxy->entitlements = columnDictionary(statement, 9);
   proxy->registrationDate = Date{sqlite3_column_double(statement, 10)};
   proxy->dataContainerPath = columnText(statement, 11);
+  proxy->knowledge = knowledge_;
   Dictionary strings = columnDictionary(statement, 12);
   std::vector<std::string> languages = languageCandidates(languageLocked());
   proxy->localizedName = localizedName(proxy->info, strings, languages);
