@@ -191,6 +191,7 @@ void EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
   } else {
     annotations_.erase(key);
   }
+  written_.erase(key);
   if (deferring_) {
     pendingSave_ = true;
     return;
@@ -238,17 +239,28 @@ Result<void> EkDAnnotationStore::load(const std::string& path, bool& dataUsable)
     }
   }
   annotations_ = data != nullptr ? std::move(*data) : Dictionary{};
+  written_.clear();
   return {};
 }
 
 Result<void> EkDAnnotationStore::saveDb() {
-  // The table is lent to the document and taken back: copying it at every change would cost
-  // more than writing it.
-  Value document(Dictionary{{std::string(kVersionKey), Value(kVersion)},
-                            {std::string(kDataKey), Value(std::move(annotations_))}});
-  Result<std::string> written = dmap::write(document);
-  annotations_ = std::move(*document.dictionary()->at(std::string(kDataKey)).dictionary());
-  std::string bytes = EK_TRY(std::move(written));
+  // Every entry's text is kept from the save that first wrote it: a change writes its own
+  // entry again and copies the others' texts into the document.
+  std::vector<const std::string*> entries;
+  entries.reserve(annotations_.size());
+  auto text = written_.begin();
+  for (const auto& [key, annotation] : annotations_) {
+    while (text != written_.end() && text->first < key) text = written_.erase(text);
+    if (text == written_.end() || text->first != key) {
+      text = written_.emplace_hint(text, key, EK_TRY(dmap::writeEntry(key, annotation, 2)));
+    }
+    entries.push_back(&text->second);
+    ++text;
+  }
+  written_.erase(text, written_.end());
+  const Dictionary root{{std::string(kVersionKey), Value(kVersion)},
+                        {std::string(kDataKey), Value(Dictionary{})}};
+  std::string bytes = EK_TRY(dmap::writeAssembled(root, kDataKey, entries));
 
   std::filesystem::path directory = std::filesystem::path(annotationsURL_).parent_path();
   if (!directory.empty()) EK_TRY(paths::ensureDirectory(directory.string()));

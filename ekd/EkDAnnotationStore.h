@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -72,6 +73,8 @@ class EkDAnnotationStore {
 
   std::string annotationsURL_;
   Dictionary annotations_;
+  // The dmap text of each entry of annotations_ as last saved; a change drops its entry's.
+  std::map<std::string, std::string, std::less<>> written_;
   // Set when the file at annotationsURL_ exists but could not be used: it is kept aside
   // before the first save replaces it.
   bool keepBadFile_ = false;

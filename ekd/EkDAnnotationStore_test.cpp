@@ -316,6 +316,42 @@ TEST_F(EkDAnnotationStoreTest, DeferredChangesReachTheFileInOneSaveAtTheEnd) {
   EXPECT_EQ(tableIn(file), (Dictionary{{"com.example.two", Dictionary{{"election", 3}}}}));
 }
 
+TEST_F(EkDAnnotationStoreTest, FileAfterEveryKindOfChangeIsTheWholeTableWritten) {
+  fs::path file = fileWith(currentFile({{"com.example.b", Dictionary{{"election", 0}}},
+                                        {"com.example.d", Dictionary{{"election", 1}}}}));
+  auto store = EkDAnnotationStore::initWithDatabase(file.string());
+  ASSERT_NE(store, nullptr);
+  auto expectWholeTable = [&](const char* after) {
+    const Value document(Dictionary{{"data", Value(store->annotations())}, {"version", Value(16)}});
+    std::ifstream in(file, std::ios::binary);
+    std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    EXPECT_EQ(bytes, dmap::write(document).value()) << "after " << after;
+  };
+  store->setAnnotation(Dictionary{{"election", 1}}, "com.example.b");
+  expectWholeTable("a change");
+  store->setAnnotation(Dictionary{{"extension", Dictionary{{"k", "v"}}}}, "com.example.a");
+  expectWholeTable("an entry before the others");
+  store->setAnnotation(Dictionary{{"election", 2}}, "com.example.e");
+  expectWholeTable("an entry after the others");
+  store->setAnnotation(std::nullopt, "com.example.d");
+  expectWholeTable("a removal");
+  // Another file loaded, with another value under a key written before.
+  ASSERT_TRUE(store
+                  ->loadDb(fileWith(currentFile({{"com.example.b", Dictionary{{"election", 9}}},
+                                                 {"com.example.c", Dictionary{{"election", 3}}}}))
+                               .string())
+                  .ok());
+  store->setAnnotation(Dictionary{{"election", 4}}, "com.example.f");
+  EXPECT_EQ(tableIn(file), (Dictionary{{"com.example.b", Dictionary{{"election", 9}}},
+                                       {"com.example.c", Dictionary{{"election", 3}}},
+                                       {"com.example.f", Dictionary{{"election", 4}}}}));
+  expectWholeTable("a load");
+  store->setAnnotation(std::nullopt, "com.example.b");
+  store->setAnnotation(std::nullopt, "com.example.c");
+  store->setAnnotation(std::nullopt, "com.example.f");
+  expectWholeTable("removing everything");
+}
+
 TEST_F(EkDAnnotationStoreTest, ReloadRoundTripsEveryValueType) {
   const Dictionary annotation{
       {"election", 257},

@@ -637,7 +637,47 @@ class Writer {
     return std::move(out_);
   }
 
+  Result<std::string> runEntry(std::string_view key, const Value& value, size_t level) {
+    if (level == 0 || level > kMaxDepth) return tooDeep();
+    EK_TRY(writeKey(key, level));
+    EK_TRY(writeValue(value, level, level));
+    if (out_.size() > kMaxFileSize) return tooLarge();
+    return std::move(out_);
+  }
+
+  // The root dictionary's member under key is written from the given entry texts.
+  Result<std::string> runAssembled(const Dictionary& root, std::string_view key,
+                                   const std::vector<const std::string*>& entries) {
+    size_t size = 0;
+    for (const std::string* entry : entries) size += entry->size();
+    if (size > kMaxFileSize) return tooLarge();
+    out_.reserve(size + 4096);
+    splice_ = key;
+    entries_ = &entries;
+    return run(Value(root));
+  }
+
  private:
+  Result<void> writeKey(std::string_view key, size_t level) {
+    indent(level);
+    out_ += "<key>";
+    EK_TRY(appendEscaped(out_, key));
+    out_ += "</key>\n";
+    return {};
+  }
+
+  void writeSplice(size_t level) {
+    indent(level);
+    if (entries_->empty()) {
+      out_ += "<dict/>\n";
+      return;
+    }
+    out_ += "<dict>\n";
+    for (const std::string* entry : *entries_) out_ += *entry;
+    indent(level);
+    out_ += "</dict>\n";
+  }
+
   void indent(size_t level) { out_.append(level, '\t'); }
 
   Result<void> writeValue(const Value& value, size_t level, size_t depth) {
@@ -700,10 +740,11 @@ class Writer {
         }
         out_ += "<dict>\n";
         for (const auto& [key, item] : dictionary) {
-          indent(level + 1);
-          out_ += "<key>";
-          EK_TRY(appendEscaped(out_, key));
-          out_ += "</key>\n";
+          EK_TRY(writeKey(key, level + 1));
+          if (entries_ != nullptr && depth == 0 && key == splice_) {
+            writeSplice(level + 1);
+            continue;
+          }
           EK_TRY(writeValue(item, level + 1, depth + 1));
         }
         indent(level);
@@ -724,6 +765,8 @@ class Writer {
   }
 
   std::string out_;
+  std::string_view splice_;
+  const std::vector<const std::string*>* entries_ = nullptr;
 };
 
 // ---------------------------------------------------------------------------------------------
@@ -795,6 +838,15 @@ Result<Value> readFile(const std::string& path) {
 
 Result<std::string> write(const Value& value) {
   return Writer().run(value);
+}
+
+Result<std::string> writeEntry(std::string_view key, const Value& value, size_t level) {
+  return Writer().runEntry(key, value, level);
+}
+
+Result<std::string> writeAssembled(const Dictionary& root, std::string_view key,
+                                   const std::vector<const std::string*>& entries) {
+  return Writer().runAssembled(root, key, entries);
 }
 
 Result<void> writeFileAtomically(const std::string& path, const Value& value, mode_t mode,

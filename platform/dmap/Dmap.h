@@ -4,6 +4,7 @@
 
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/value/Result.h"
 #include "platform/value/Value.h"
@@ -49,6 +50,18 @@ Result<Value> readFile(const std::string& path);
 // Lossy on purpose: a UUID is written as its canonical string (and reads back as a string);
 // a date is written to the whole second, rounded down.
 Result<std::string> write(const Value& value);
+
+// For a document whose root dictionary holds one large dictionary that changes an entry at a
+// time: each entry is written once and kept, and the document is assembled from the kept
+// texts, byte for byte what write() gives for the whole value, without writing them again.
+//
+// The text write() gives one dictionary entry (its key and value) at an indentation level
+// (the root dictionary's entries are at level 1, those of a dictionary inside it at level 2).
+Result<std::string> writeEntry(std::string_view key, const Value& value, size_t level);
+// The document of root with root[key] a dictionary whose entries are entries, in key order,
+// each from writeEntry at level 2. root's own value under key is not read.
+Result<std::string> writeAssembled(const Dictionary& root, std::string_view key,
+                                   const std::vector<const std::string*>& entries);
 
 // Replaces path atomically and durably: a temporary file in the same directory, fchmod to
 // mode (exactly, the umask does not apply), fsync, rename, fsync of the directory. On failure

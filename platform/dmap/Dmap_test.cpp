@@ -235,6 +235,48 @@ TEST(Dmap, WriteRefusesDocumentsOverTheSizeLimit) {
   EXPECT_TRUE(write(Value(std::string(kMaxFileSize / 2, 'a'))).ok());
 }
 
+TEST(Dmap, AssembledDocumentIsWhatWriteGives) {
+  const std::vector<Dictionary> tables = {
+      {},
+      {{"com.example.one", Value(Dictionary{{"election", Value(1)}})}},
+      {{"a&b", Value(Dictionary{{"x<y", Value("tab\there")}, {"n", Value(Array{})}})},
+       {"com.example.two",
+        Value(Dictionary{{"extension", Value(Dictionary{{"deep", Value(Array{Value(2.5)})}})}})},
+       {"empty", Value(Dictionary{})},
+       {"z", Value(true)}},
+  };
+  for (const Dictionary& table : tables) {
+    std::vector<std::string> texts;
+    for (const auto& [key, value] : table) {
+      Result<std::string> entry = writeEntry(key, value, 2);
+      ASSERT_TRUE(entry.ok()) << key;
+      texts.push_back(std::move(entry).value());
+    }
+    std::vector<const std::string*> entries;
+    for (const std::string& text : texts) entries.push_back(&text);
+    const Dictionary root{{"data", Value(Dictionary{})}, {"version", Value(16)}};
+    Result<std::string> assembled = writeAssembled(root, "data", entries);
+    ASSERT_TRUE(assembled.ok());
+    Dictionary whole = root;
+    whole["data"] = Value(table);
+    EXPECT_EQ(*assembled, write(Value(whole)).value()) << table.size() << " entries";
+  }
+}
+
+TEST(Dmap, EntriesAreHeldToTheRulesOfWrite) {
+  EXPECT_FALSE(writeEntry("bad\x01key", Value(1), 2).ok());
+  EXPECT_FALSE(writeEntry("key", Value("\xff"), 2).ok());
+  EXPECT_FALSE(writeEntry("key", Value(1), 0).ok());
+  // The level counts towards the nesting limit as it would inside the document.
+  Value deep = Value(Array{});
+  for (size_t i = 1; i < kMaxDepth - 2; ++i) deep = Value(Array{std::move(deep)});
+  EXPECT_TRUE(writeEntry("key", deep, 2).ok());
+  EXPECT_FALSE(writeEntry("key", Value(Array{deep}), 2).ok());
+  const std::string big(kMaxFileSize / 2 + 1, 'a');
+  const std::vector<const std::string*> entries = {&big, &big};
+  EXPECT_FALSE(writeAssembled({{"data", Value(Dictionary{})}}, "data", entries).ok());
+}
+
 // ---------------------------------------------------------------------------------------------
 // Reading
 
