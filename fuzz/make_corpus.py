@@ -1,5 +1,6 @@
 #!/usr/bin/env python3
-"""Writes the seed corpora of cbor_fuzz, json_fuzz and dispatch_fuzz (valid and invalid inputs)."""
+"""Writes the seed corpora of cbor_fuzz, json_fuzz, dispatch_fuzz and bundle_sources_fuzz (valid
+and invalid inputs)."""
 import pathlib
 import struct
 import uuid
@@ -186,6 +187,19 @@ DISPATCH = {
     "bad_not_dictionary": ["match", 3],
 }
 
+# Records of a bundle's sources: [context, [[path, shared] or [path, shared, device, inode,
+# size, mtime s, mtime ns, ctime s, ctime ns], ...]].
+_ABSENT = ["/nonexistent/Info.dmap", False]
+_PRESENT = ["/", False, 2049, 2, 4096, 1700000000, 5, 1700000000, 6]
+_SHARED = ["/etc/hostname", True, 2049, 1234, 10, 1700000000, 0, 1700000000, 0]
+BUNDLE_SOURCES = {
+    "absent": ["ctx", [_ABSENT]],
+    "present": ["ctx", [_PRESENT, _ABSENT]],
+    "shared": ["ctx", [_SHARED, _SHARED]],
+    "other_context": ["another context", [_ABSENT]],
+    "empty_list": ["ctx", []],
+}
+
 
 def main():
     cbor_dir = HERE / "corpus" / "cbor"
@@ -200,6 +214,10 @@ def main():
     dispatch_dir.mkdir(parents=True, exist_ok=True)
     for name, message in DISPATCH.items():
         (dispatch_dir / name).write_bytes(cbor(message))
+    sources_dir = HERE / "corpus" / "bundle_sources"
+    sources_dir.mkdir(parents=True, exist_ok=True)
+    for name, record in BUNDLE_SOURCES.items():
+        (sources_dir / name).write_bytes(cbor(record))
 
 
 if __name__ == "__main__":
