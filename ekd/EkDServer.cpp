@@ -121,7 +121,9 @@ void EkDServer::run() {
 }
 
 void EkDServer::submitWork(std::function<void()> work) {
-  mainQueue_->async(std::move(work));
+  // Called as a connection's read handler hands over a request: the thread that read it runs
+  // it next, instead of waking the other I/O thread for it.
+  mainQueue_->asyncContinuation(std::move(work));
 }
 
 void EkDServer::stop() {

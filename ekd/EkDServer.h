@@ -67,7 +67,9 @@ class EkDServer : public EkDatabase,
 
   // Starts accepting connections. The caller then runs the main run loop.
   void run();
-  // Enqueues work on the work queue "service"; the only way request work reaches it.
+  // Enqueues work on the work queue "service"; the only way request work reaches it. From a
+  // connection's handler, the work runs on that thread once the handler returns, which must
+  // not wait for it (SerialQueue::asyncContinuation).
   void submitWork(std::function<void()> work);
   // Cancels the listener and releases every hold. Called just before the process exits.
   void stop();

@@ -1,5 +1,6 @@
 #include "platform/queue/SerialQueue.h"
 
+#include <asio/defer.hpp>
 #include <asio/post.hpp>
 
 #include <algorithm>
@@ -75,9 +76,22 @@ void SerialQueue::async(std::function<void()> block) {
   if (!owned_) scheduleLocked();
 }
 
-void SerialQueue::scheduleLocked() {
+void SerialQueue::asyncContinuation(std::function<void()> block) {
+  std::lock_guard lock(mutex_);
+  blocks_.push_back(std::move(block));
+  if (!owned_) scheduleLocked(context_.get_executor().running_in_this_thread());
+}
+
+void SerialQueue::scheduleLocked(bool continuation) {
   owned_ = true;
-  asio::post(context_, [self = shared_from_this()] { self->drain(); });
+  auto drain = [self = shared_from_this()] { self->drain(); };
+  // A deferred handler goes to this thread's own queue of the context and runs once the
+  // current handler returns; a posted one may wake another thread.
+  if (continuation) {
+    asio::defer(context_, std::move(drain));
+  } else {
+    asio::post(context_, std::move(drain));
+  }
 }
 
 void SerialQueue::drain() {

@@ -48,6 +48,11 @@ class SerialQueue : public std::enable_shared_from_this<SerialQueue> {
       std::string label, asio::io_context& context = QueuePool::shared().context());
 
   void async(std::function<void()> block);
+  // async for a block that continues the work of the handler the calling thread runs: from a
+  // thread of the queue's own context, an idle queue runs it on this thread right after that
+  // handler returns, rather than waking another thread for it. The handler must not wait for
+  // the block (nor enter this queue with sync) before it returns. From any other thread, async.
+  void asyncContinuation(std::function<void()> block);
   void sync(const std::function<void()>& block);
 
   // Whether the calling thread is running a block of this queue (also inside a sync).
@@ -60,7 +65,7 @@ class SerialQueue : public std::enable_shared_from_this<SerialQueue> {
  private:
   SerialQueue(std::string label, asio::io_context& context)
       : label_(std::move(label)), context_(context) {}
-  void scheduleLocked();
+  void scheduleLocked(bool continuation = false);
   void drain();
 
   struct Waiter;

@@ -2,8 +2,12 @@
 
 #include <gtest/gtest.h>
 
+#include <asio/post.hpp>
+
 #include <atomic>
 #include <future>
+#include <thread>
+#include <vector>
 
 namespace ek {
 namespace {
@@ -54,6 +58,42 @@ TEST(SerialQueue, NeverRunsTwoBlocksAtOnce) {
   flushed.get_future().wait();
   EXPECT_FALSE(overlapped);
   EXPECT_EQ(done.load(), 2000);
+}
+
+TEST(SerialQueue, ContinuationRunsOnTheHandlersThreadOnceItReturns) {
+  QueuePool pool(2);
+  auto queue = SerialQueue::make("continuation", pool.context());
+  struct Seen {
+    std::thread::id thread;
+    bool handlerReturned = false;
+  };
+  std::atomic<bool> handlerReturned{false};
+  std::promise<std::thread::id> handlerThread;
+  std::promise<Seen> continued;
+  asio::post(pool.context(), [&] {
+    handlerThread.set_value(std::this_thread::get_id());
+    queue->asyncContinuation([&] {
+      continued.set_value({std::this_thread::get_id(), handlerReturned.load()});
+    });
+    // Long enough for the pool's other, idle thread to take a posted block first.
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    handlerReturned = true;
+  });
+  Seen seen = continued.get_future().get();
+  EXPECT_EQ(seen.thread, handlerThread.get_future().get());
+  EXPECT_TRUE(seen.handlerReturned);
+
+  // From a thread outside the context it is async: run by the pool, in order with the rest.
+  std::vector<int> order;
+  std::promise<void> done;
+  queue->async([&] { order.push_back(1); });
+  queue->asyncContinuation([&] { order.push_back(2); });
+  queue->async([&] {
+    order.push_back(3);
+    done.set_value();
+  });
+  done.get_future().wait();
+  EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
 }
 
 TEST(SerialQueue, SyncRunsOnTheCallerAfterEarlierBlocks) {
