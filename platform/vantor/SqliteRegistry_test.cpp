@@ -669,8 +669,9 @@ TEST_F(StartUpScanTest, UnchangedBundlesAreNotReadAgainAndEveryChangedFileIsSeen
   writeDmap(system_ + "/Library/ExtensionPoints/com.x.spell.dmap",
             {{"ZuExtension", Value(Dictionary{{"ZuExtensionPrincipalClass", Value("B")}})}});
   EXPECT_EQ(reopenCountingReads(), 1);
-  const Value* principal =
-      registry_->plugInByUrl(spell_)->info.at("ZuExtension").get("ZuExtensionPrincipalClass");
+  PlugInProxyPtr proxy = registry_->plugInByUrl(spell_);
+  ASSERT_TRUE(proxy);
+  const Value* principal = proxy->info.at("ZuExtension").get("ZuExtensionPrincipalClass");
   ASSERT_NE(principal, nullptr);
   EXPECT_EQ(*principal->string(), "B");
 
@@ -693,6 +694,7 @@ TEST_F(StartUpScanTest, BundlesAreReadAgainWhenTheirRecordCannotBeTrusted) {
 
   // Files changed just now may change again unseen within the same tick of the file
   // system's clock: their stamps are not trusted until they have settled.
+  recorder_->attach(nullptr);
   registry_.reset();
   SqliteRegistry::Options unsettled = options();
   unsettled.settleSeconds = 3600;
