@@ -7,9 +7,11 @@
 #include <openssl/evp.h>
 #include <openssl/params.h>
 #include <openssl/rand.h>
+#include <pthread.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <array>
 #include <atomic>
 #include <cerrno>
@@ -24,6 +26,40 @@ constexpr size_t kMaxFlagsDigits = 10;
 
 // Handles are unique across every sandbox of the process.
 std::atomic<int64_t> nextHandle{1};
+
+// A "match" issues a token per plug-in it answers, and RAND_bytes takes the generator's lock and
+// reseed checks on every call: each thread draws its nonces from a block fetched at once. A
+// forked child drops the block it inherited, so no nonce is ever handed out twice.
+std::atomic<uint64_t> forkGeneration{0};
+
+bool randomNonce(std::array<uint8_t, sandbox::kNonceSize>& nonce) {
+  static constexpr size_t kBlock = 256 * sandbox::kNonceSize;
+  static const bool registered = [] {
+    pthread_atfork(nullptr, nullptr,
+                   [] { forkGeneration.fetch_add(1, std::memory_order_relaxed); });
+    return true;
+  }();
+  (void)registered;
+  struct Pool {
+    std::array<uint8_t, kBlock> bytes;
+    size_t used = kBlock;
+    uint64_t generation = 0;
+  };
+  thread_local Pool pool;
+  const uint64_t generation = forkGeneration.load(std::memory_order_relaxed);
+  if (pool.generation != generation) {
+    pool.used = kBlock;
+    pool.generation = generation;
+  }
+  if (pool.used == kBlock) {
+    if (RAND_bytes(pool.bytes.data(), static_cast<int>(kBlock)) != 1) return false;
+    pool.used = 0;
+  }
+  std::copy_n(pool.bytes.begin() + static_cast<std::ptrdiff_t>(pool.used), nonce.size(),
+              nonce.begin());
+  pool.used += nonce.size();
+  return true;
+}
 
 std::string toHex(std::string_view bytes) {
   static constexpr char kDigits[] = "0123456789abcdef";
@@ -210,7 +246,7 @@ Result<std::string> EkSandbox::issue(std::string_view extensionClass, uint32_t f
   Result<EkSandboxKey> key = keys_->key();
   if (!key) return std::move(key).error();
   std::array<uint8_t, sandbox::kNonceSize> nonce;
-  if (RAND_bytes(nonce.data(), static_cast<int>(nonce.size())) != 1) {
+  if (!randomNonce(nonce)) {
     return EkError::posix(EIO, "no random bytes for an extension nonce");
   }
   std::string token = fmt::format(

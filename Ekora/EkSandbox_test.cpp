@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <stdlib.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -129,11 +130,50 @@ TEST_F(EkSandboxTest, ServiceTokenRoundTrips) {
   EXPECT_EQ(sandbox_.grant(handle)->flags, 0u);
 }
 
-TEST_F(EkSandboxTest, TwoIssuesOfOneSubjectDifferByTheirNonce) {
-  const std::string first = issueFor(directory_.path());
-  const std::string second = issueFor(directory_.path());
-  EXPECT_NE(first, second);
-  EXPECT_NE(fieldsOf(first)[3], fieldsOf(second)[3]);
+// Nonces come from blocks of random bytes drawn ahead: many issues span several blocks, and a
+// forked child, which inherits the parent's block, must not hand out the parent's next nonces.
+TEST_F(EkSandboxTest, IssuesOfOneSubjectNeverShareANonceAcrossBlocksOrAFork) {
+  const std::string warmup = issueFor(directory_.path());
+  int fds[2];
+  ASSERT_EQ(pipe(fds), 0);
+  const pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    close(fds[0]);
+    std::string nonces;
+    for (int i = 0; i < 8; ++i) {
+      Result<std::string> token = sandbox_.issueFileExtension(directory_.path(), 0);
+      if (!token.ok()) _exit(1);
+      nonces += fieldsOf(*token)[3] + "\n";
+    }
+    const bool written =
+        write(fds[1], nonces.data(), nonces.size()) == static_cast<ssize_t>(nonces.size());
+    _exit(written ? 0 : 1);
+  }
+  close(fds[1]);
+  std::string fromChild;
+  char buffer[512];
+  for (ssize_t n; (n = read(fds[0], buffer, sizeof buffer)) > 0;) fromChild.append(buffer, n);
+  close(fds[0]);
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+
+  std::set<std::string> nonces{fieldsOf(warmup)[3]};
+  size_t issued = 1;
+  for (size_t start = 0, end; (end = fromChild.find('\n', start)) != std::string::npos;
+       start = end + 1) {
+    nonces.insert(fromChild.substr(start, end - start));
+    ++issued;
+  }
+  EXPECT_EQ(issued, 9u);
+  for (int i = 0; i < 1000; ++i) {
+    const std::string token = issueFor(directory_.path());
+    ASSERT_FALSE(token.empty());
+    nonces.insert(fieldsOf(token)[3]);
+    ++issued;
+  }
+  EXPECT_EQ(nonces.size(), issued);
 }
 
 TEST_F(EkSandboxTest, MissingPathCannotBeIssuedAndKeepsTheSystemError) {

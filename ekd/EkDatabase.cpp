@@ -158,10 +158,10 @@ std::optional<std::vector<std::string>> EkDatabase::electionList(const Dictionar
 }
 
 bool EkDatabase::electionFilter(const std::vector<std::string>& elections,
-                                const vantor::PlugInProxy& proxy) {
-  std::string key = proxy.identifier;
-  auto replaces = proxy.entitlements.find(protocol::kEntitlementReplacePlugIn);
-  if (replaces != proxy.entitlements.end() && replaces->second.string()) {
+                                const std::string& identifier, const Dictionary& entitlements) {
+  std::string key = identifier;
+  auto replaces = entitlements.find(protocol::kEntitlementReplacePlugIn);
+  if (replaces != entitlements.end() && replaces->second.string()) {
     key = *replaces->second.string();
   }
   std::optional<int64_t> election = onQueue(*sync_, [&]() -> std::optional<int64_t> {
@@ -173,8 +173,8 @@ bool EkDatabase::electionFilter(const std::vector<std::string>& elections,
   });
   if (!election) {
     election = 0;
-    auto autoElect = proxy.entitlements.find(protocol::kEntitlementAutoElect);
-    if (autoElect != proxy.entitlements.end()) {
+    auto autoElect = entitlements.find(protocol::kEntitlementAutoElect);
+    if (autoElect != entitlements.end()) {
       // Only a number counts here, by its boolean value.
       const Value& value = autoElect->second;
       if (auto number = electionValue(value)) election = *number != 0 ? 1 : 0;
@@ -192,43 +192,78 @@ bool EkDatabase::electionFilter(const std::vector<std::string>& elections,
   return answer;
 }
 
+// The registry names the candidates by UUID; only those without a cached record have their
+// registration read. A cached record follows the registry by itself, so it is what a proxy
+// read now would be turned into anyway, and a query of 500 plug-ins reads no rows.
 std::optional<std::vector<EkDPlugInRef>> EkDatabase::findPlugIns(const Dictionary& query) {
-  std::vector<vantor::PlugInProxyPtr> proxies;
-  if (query.empty()) {
-    proxies = platform_.registry->installedPlugIns();
-    log::vr().debug("%d installedPlugins: %@", proxies.size(), ProxyList{proxies});
-  } else {
-    auto elections = electionList(query);
-    vantor::PlugInFilter filter;
-    if (elections) {
-      filter = [this, elections = std::move(*elections)](const vantor::PlugInProxy& proxy) {
-        return electionFilter(elections, proxy);
-      };
+  std::optional<std::vector<std::string>> elections;
+  if (!query.empty()) elections = electionList(query);
+  const std::vector<Uuid> uuids = platform_.registry->queryUuids(query);
+  if (log::vr().enabled(log::Level::Debug)) {
+    // The line shows the registry's proxies, which only this log needs read.
+    if (query.empty()) {
+      auto proxies = platform_.registry->installedPlugIns();
+      log::vr().debug("%d installedPlugins: %@", proxies.size(), ProxyList{proxies});
+    } else {
+      vantor::PlugInFilter filter;
+      if (elections) {
+        filter = [this, &elections](const vantor::PlugInProxy& proxy) {
+          return electionFilter(*elections, proxy.identifier, proxy.entitlements);
+        };
+      }
+      auto proxies = platform_.registry->query(query, filter);
+      log::vr().debug("%d plugin(s) matching %@ = %@", proxies.size(), Value(query),
+                      ProxyList{proxies});
     }
-    proxies = platform_.registry->query(query, filter);
-    log::vr().debug("%d plugin(s) matching %@ = %@", proxies.size(), Value(query),
-                    ProxyList{proxies});
   }
-  if (proxies.empty()) return std::nullopt;
 
   size_t cachedBefore = cacheCount();
+  size_t selected = 0;
   std::vector<EkDPlugInRef> result;
+  result.reserve(uuids.size());
   std::unordered_set<Uuid> seen;
-  for (const auto& proxy : proxies) {
+  for (const Uuid& uuid : uuids) {
+    if (!seen.insert(uuid).second) continue;
+    EkDPlugInRef cached = onQueue(*sync_, [&]() -> EkDPlugInRef {
+      auto it = cache_.find(uuid);
+      return it != cache_.end() && it->second->isStillValid() ? it->second : nullptr;
+    });
+    if (cached) {
+      if (elections) {
+        DictionaryRef entitlements = cached->entitlements();
+        if (!electionFilter(*elections, cached->identifier().value_or(""),
+                            entitlements ? *entitlements : Dictionary{})) {
+          continue;
+        }
+      }
+      ++selected;
+      auto containing = cached->containingPath();
+      if (containing && platform_.registry->applicationIsPlaceholder(*containing)) {
+        vantor::PlugInProxyPtr proxy = cached->getProxy();
+        log::ops().info("skipping vr proxy %@ because its app is a placeholder",
+                        proxy ? proxy->description() : uuid.string());
+        continue;
+      }
+      result.push_back(std::move(cached));
+      continue;
+    }
+    // Gone since the registry named it: as if the query had run a moment later.
+    vantor::PlugInProxyPtr proxy = platform_.registry->plugInByUuid(uuid);
+    if (!proxy) continue;
+    if (elections && !electionFilter(*elections, proxy->identifier, proxy->entitlements)) continue;
+    ++selected;
     if (proxy->url.empty()) {
       log::ops().info("skipping vr proxy %@ with nil bundleURL", *proxy);
       continue;
     }
-    if (proxy->containingAppPath) {
-      auto application = platform_.registry->applicationByPath(*proxy->containingAppPath);
-      if (application && application->isPlaceholder) {
-        log::ops().info("skipping vr proxy %@ because its app is a placeholder", *proxy);
-        continue;
-      }
+    if (proxy->containingAppPath &&
+        platform_.registry->applicationIsPlaceholder(*proxy->containingAppPath)) {
+      log::ops().info("skipping vr proxy %@ because its app is a placeholder", *proxy);
+      continue;
     }
-    if (!seen.insert(proxy->uuid).second) continue;
     if (auto plugIn = plugInForProxy(*proxy)) result.push_back(std::move(plugIn));
   }
+  if (selected == 0) return std::nullopt;
   log::ops().debug("VR reported %u plug-ins (cache %u/%u)", result.size(), cachedBefore,
                    cacheCount());
   return result;

@@ -125,7 +125,9 @@ class EkDatabase : public vantor::RegistryObserver {
   EkDatabase() = default;
 
  private:
-  bool electionFilter(const std::vector<std::string>& elections, const vantor::PlugInProxy& proxy);
+  // Whether a candidate's election is one of elections.
+  bool electionFilter(const std::vector<std::string>& elections, const std::string& identifier,
+                      const Dictionary& entitlements);
   EkDPlugInContext recordContext();
 
   std::weak_ptr<EkDatabaseDelegate> delegate_;

@@ -303,6 +303,20 @@ TEST_F(DatabaseTest, QueryElectionFilterUsesStoredElectionsAutoElectAndReplaceme
   // Decimal text without leading zeros: "01" matches nothing.
   Dictionary padded{{"ZuUserElection", Value("01")}};
   EXPECT_EQ(database_->findPlugIns(padded), std::nullopt);
+
+  // Every record is cached now; the filter still reads the elections as they are.
+  EXPECT_EQ(database_->cacheCount(), 5u);
+  database_->databaseQueue()->sync([&] {
+    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{1})}},
+                                           "com.example.none");
+    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{0})}},
+                                           "com.example.auto");
+  });
+  EXPECT_EQ(identifiersOf(database_->findPlugIns(elected)),
+            (std::vector<std::string>{"com.example.elected", "com.example.none",
+                                      "com.example.replacement", "com.example.wide"}));
+  EXPECT_EQ(identifiersOf(database_->findPlugIns(unelected)),
+            (std::vector<std::string>{"com.example.auto"}));
 }
 
 TEST_F(DatabaseTest, EmptyQueryAnswersEveryInstalledPlugInAndNothingWhenNoneIs) {
@@ -324,6 +338,12 @@ TEST_F(DatabaseTest, PlaceholderApplicationsPlugInsAreSkipped) {
   EXPECT_EQ(database_->findPlugIns({}).value_or(std::vector<EkDPlugInRef>{}).size(), 0u);
   EXPECT_EQ(database_->cacheCount(), 0u);
   EXPECT_EQ(sink_->count("because its app is a placeholder"), 1u);
+
+  // A record cached by a lookup by UUID is still left out of queries.
+  auto other = install("com.example.b");
+  ASSERT_NE(database_->findPlugIn(other.uuid), nullptr);
+  EXPECT_EQ(database_->findPlugIns({}).value_or(std::vector<EkDPlugInRef>{}).size(), 0u);
+  EXPECT_EQ(sink_->count("because its app is a placeholder"), 3u);
 }
 
 TEST_F(DatabaseTest, PlugInsWithinApplication) {

@@ -43,6 +43,17 @@ const Dictionary* PlugInProxy::extensionDictionary() const {
   return it == info.end() ? nullptr : it->second.dictionary();
 }
 
+std::vector<Uuid> Registry::queryUuids(const Dictionary& rules) {
+  std::vector<Uuid> uuids;
+  for (const PlugInProxyPtr& proxy : query(rules, nullptr)) uuids.push_back(proxy->uuid);
+  return uuids;
+}
+
+bool Registry::applicationIsPlaceholder(std::string_view path) {
+  ApplicationProxyPtr application = applicationByPath(path);
+  return application && application->isPlaceholder;
+}
+
 std::string PlugInProxy::description() const {
   return fmt::format("<plug-in {} {} at {}>", identifier, uuid.string(), path);
 }

@@ -126,6 +126,11 @@ class Registry {
   // every other key is the caller's to match.
   virtual std::vector<PlugInProxyPtr> query(const Dictionary& rules,
                                             const PlugInFilter& filter) = 0;
+  // The UUIDs of the plug-ins query would pass to its filter, in the order it would, without
+  // reading their records: a caller holding current records for them needs nothing more.
+  virtual std::vector<Uuid> queryUuids(const Dictionary& rules);
+  // Whether the application at a path is known and only a placeholder.
+  virtual bool applicationIsPlaceholder(std::string_view path);
 
   // The SDK dictionary of an extension point, when one was read at registration.
   virtual std::optional<Dictionary> extensionPointSdk(std::string_view identifier) = 0;

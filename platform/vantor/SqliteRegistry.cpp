@@ -32,9 +32,11 @@ constexpr int kSchemaVersion = 2;
 constexpr size_t kMaxPlugInsPerApplication = 4096;
 constexpr size_t kMaxLanguagesPerBundle = 512;
 constexpr size_t kMaxSystemBundles = 65536;
-// Negative: KiB. Enough for the pages of tens of thousands of plug-ins, so that lookups are
-// answered from memory; the file belongs to this process alone (exclusive locking).
-constexpr int kCacheSizeKiB = 32 * 1024;
+// Negative: KiB. The daemon keeps its own records of the plug-ins it was asked about, so a
+// plug-in's pages are read about once: enough for the tree's inner pages, and the rest is left
+// to the kernel's page cache rather than kept twice. With 10,000 plug-ins a 32 MB cache held
+// 11 MB more once each had been looked up, for lookups of uncached records about 15 µs faster.
+constexpr int kCacheSizeKiB = 2 * 1024;
 
 // What each plug-in was read from (BundleSources), apart from the plug-ins' rows so that the
 // start-up scan reads only this.
@@ -295,6 +297,8 @@ struct SqliteRegistry::Statements {
   sqlite3_stmt* plugInUuidsOfApp = nullptr;
   sqlite3_stmt* allPlugIns = nullptr;
   sqlite3_stmt* plugInsOfPoint = nullptr;
+  sqlite3_stmt* allPlugInUuids = nullptr;
+  sqlite3_stmt* plugInUuidsOfPoint = nullptr;
   sqlite3_stmt* upsertSdk = nullptr;
   sqlite3_stmt* sdkOf = nullptr;
   sqlite3_stmt* setSources = nullptr;
@@ -303,12 +307,12 @@ struct SqliteRegistry::Statements {
   sqlite3_stmt* allPlugInPaths = nullptr;
 
   std::vector<sqlite3_stmt**> all() {
-    return {&begin,          &commit,       &rollback,     &setMeta,          &getMeta,
-            &upsertApp,      &deleteApp,    &appByPath,    &appByIdentifier,  &appExists,
-            &allApps,        &insertPlugIn, &deletePlugIn, &insertPoint,      &deletePoints,
-            &plugInByUuid,   &plugInByPath, &plugInsOfApp, &plugInUuidsOfApp, &allPlugIns,
-            &plugInsOfPoint, &upsertSdk,    &sdkOf,        &setSources,       &allSources,
-            &allPlugInPaths, &forgetSources};
+    return {&begin,          &commit,         &rollback,           &setMeta,          &getMeta,
+            &upsertApp,      &deleteApp,      &appByPath,          &appByIdentifier,  &appExists,
+            &allApps,        &insertPlugIn,   &deletePlugIn,       &insertPoint,      &deletePoints,
+            &plugInByUuid,   &plugInByPath,   &plugInsOfApp,       &plugInUuidsOfApp, &allPlugIns,
+            &plugInsOfPoint, &allPlugInUuids, &plugInUuidsOfPoint, &upsertSdk,        &sdkOf,
+            &setSources,     &allSources,     &allPlugInPaths,     &forgetSources};
   }
   ~Statements() {
     for (sqlite3_stmt** statement : all()) sqlite3_finalize(*statement);
@@ -615,6 +619,10 @@ Result<void> SqliteRegistry::prepareSchema() {
       {&s.plugInsOfPoint, fmt::format("SELECT {} FROM plugin_points pp JOIN plugins p "
                                       "ON p.uuid = pp.uuid WHERE pp.point = ?1 ORDER BY p.path",
                                       kPlugInColumns)},
+      {&s.allPlugInUuids, "SELECT uuid FROM plugins ORDER BY path"},
+      {&s.plugInUuidsOfPoint,
+       "SELECT p.uuid FROM plugin_points pp JOIN plugins p ON p.uuid = pp.uuid "
+       "WHERE pp.point = ?1 ORDER BY p.path"},
       {&s.upsertSdk, "INSERT OR REPLACE INTO extension_points(identifier, sdk) VALUES(?1, ?2)"},
       {&s.sdkOf, "SELECT sdk FROM extension_points WHERE identifier = ?1"},
   };
@@ -1301,6 +1309,32 @@ std::vector<PlugInProxyPtr> SqliteRegistry::query(const Dictionary& rules,
     if (filter(*candidate)) accepted.push_back(std::move(candidate));
   }
   return accepted;
+}
+
+std::vector<Uuid> SqliteRegistry::queryUuids(const Dictionary& rules) {
+  std::vector<Uuid> uuids;
+  std::lock_guard db(dbMutex_);
+  auto collect = [&](sqlite3_stmt* statement, std::set<Uuid>* seen) {
+    while (sqlite3_step(statement) == SQLITE_ROW) {
+      Uuid uuid = columnUuid(statement, 0);
+      if (!seen || seen->insert(uuid).second) uuids.push_back(uuid);
+    }
+  };
+  auto points = indexedExtensionPoints(rules);
+  if (!points) {
+    Use list(statements_->allPlugInUuids);
+    collect(list.get(), nullptr);
+    return uuids;
+  }
+  std::set<std::string> keys;
+  for (const std::string& point : *points) keys.insert(extensionPointIndexKey(point));
+  std::set<Uuid> seen;
+  for (const std::string& key : keys) {
+    Use list(statements_->plugInUuidsOfPoint);
+    list.text(1, key);
+    collect(list.get(), keys.size() > 1 ? &seen : nullptr);
+  }
+  return uuids;
 }
 
 std::optional<Dictionary> SqliteRegistry::extensionPointSdk(std::string_view identifier) {

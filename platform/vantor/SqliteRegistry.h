@@ -60,6 +60,9 @@ class SqliteRegistry : public Registry {
   ApplicationProxyPtr applicationByPath(std::string_view urlOrPath) override;
   ApplicationProxyPtr applicationByIdentifier(std::string_view identifier) override;
   std::vector<PlugInProxyPtr> query(const Dictionary& rules, const PlugInFilter& filter) override;
+  std::vector<Uuid> queryUuids(const Dictionary& rules) override;
+  // This registry never makes placeholders.
+  bool applicationIsPlaceholder(std::string_view) override { return false; }
   std::optional<Dictionary> extensionPointSdk(std::string_view identifier) override;
   Dictionary localizedStrings(const Uuid& plugIn, std::string_view table,
                               const std::vector<std::string>& keys) override;

@@ -867,7 +867,12 @@ class QueryTest : public SqliteRegistryTest {
     ASSERT_TRUE(open().registerBundle(apps_ + "/X.app").ok());
   }
 
+  // Also checks that queryUuids names the same candidates, in the same order, as an
+  // unfiltered query.
   std::vector<std::string> identifiers(const Dictionary& rules, const PlugInFilter& filter = {}) {
+    std::vector<Uuid> unfiltered;
+    for (const auto& proxy : registry_->query(rules, nullptr)) unfiltered.push_back(proxy->uuid);
+    EXPECT_EQ(registry_->queryUuids(rules), unfiltered) << Value(rules).description();
     std::vector<std::string> names;
     for (const auto& proxy : registry_->query(rules, filter)) names.push_back(proxy->identifier);
     std::sort(names.begin(), names.end());
