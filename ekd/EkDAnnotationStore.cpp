@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cmath>
 #include <cstdio>
@@ -191,7 +192,7 @@ void EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
   } else {
     annotations_.erase(key);
   }
-  written_.erase(key);
+  stale_.insert(key);
   if (deferring_) {
     pendingSave_ = true;
     return;
@@ -240,24 +241,47 @@ Result<void> EkDAnnotationStore::load(const std::string& path, bool& dataUsable)
   }
   annotations_ = data != nullptr ? std::move(*data) : Dictionary{};
   written_.clear();
+  stale_.clear();
+  allStale_ = true;
   return {};
 }
 
 Result<void> EkDAnnotationStore::saveDb() {
   // Every entry's text is kept from the save that first wrote it: a change writes its own
-  // entry again and copies the others' texts into the document.
-  std::vector<const std::string*> entries;
-  entries.reserve(annotations_.size());
-  auto text = written_.begin();
-  for (const auto& [key, annotation] : annotations_) {
-    while (text != written_.end() && text->first < key) text = written_.erase(text);
-    if (text == written_.end() || text->first != key) {
-      text = written_.emplace_hint(text, key, EK_TRY(dmap::writeEntry(key, annotation, 2)));
+  // entry again and copies the others' texts into the document, without visiting the other
+  // annotations (with 10,000 of them, walking both trees cost more than writing the change).
+  if (allStale_) {
+    written_.clear();
+    written_.reserve(annotations_.size());
+    for (const auto& [key, annotation] : annotations_) {
+      written_.push_back({key, EK_TRY(dmap::writeEntry(key, annotation, 2))});
     }
-    entries.push_back(&text->second);
-    ++text;
+    allStale_ = false;
+    stale_.clear();
   }
-  written_.erase(text, written_.end());
+  // A key leaves stale_ only once its text is current, so a failed save is retried in full.
+  while (!stale_.empty()) {
+    auto key = stale_.begin();
+    auto slot = std::lower_bound(
+        written_.begin(), written_.end(), *key,
+        [](const WrittenEntry& entry, std::string_view name) { return entry.key < name; });
+    const bool written = slot != written_.end() && slot->key == *key;
+    auto annotation = annotations_.find(*key);
+    if (annotation == annotations_.end()) {
+      if (written) written_.erase(slot);
+    } else {
+      std::string text = EK_TRY(dmap::writeEntry(*key, annotation->second, 2));
+      if (written) {
+        slot->text = std::move(text);
+      } else {
+        written_.insert(slot, {*key, std::move(text)});
+      }
+    }
+    stale_.erase(key);
+  }
+  std::vector<const std::string*> entries;
+  entries.reserve(written_.size());
+  for (const WrittenEntry& entry : written_) entries.push_back(&entry.text);
   const Dictionary root{{std::string(kVersionKey), Value(kVersion)},
                         {std::string(kDataKey), Value(Dictionary{})}};
   std::string bytes = EK_TRY(dmap::writeAssembled(root, kDataKey, entries));

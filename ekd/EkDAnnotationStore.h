@@ -4,8 +4,10 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/value/Result.h"
 #include "platform/value/Value.h"
@@ -73,8 +75,17 @@ class EkDAnnotationStore {
 
   std::string annotationsURL_;
   Dictionary annotations_;
-  // The dmap text of each entry of annotations_ as last saved; a change drops its entry's.
-  std::map<std::string, std::string, std::less<>> written_;
+  // The dmap text of each entry of annotations_ as last saved, but for the keys changed since
+  // (stale_), or all of them (allStale_, after a load).
+  // Sorted by key, and contiguous: a save walks every entry, which a tree made slower than
+  // the write itself.
+  struct WrittenEntry {
+    std::string key;
+    std::string text;
+  };
+  std::vector<WrittenEntry> written_;
+  std::set<std::string, std::less<>> stale_;
+  bool allStale_ = true;
   // Set when the file at annotationsURL_ exists but could not be used: it is kept aside
   // before the first save replaces it.
   bool keepBadFile_ = false;

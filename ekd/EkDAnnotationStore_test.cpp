@@ -346,6 +346,13 @@ TEST_F(EkDAnnotationStoreTest, FileAfterEveryKindOfChangeIsTheWholeTableWritten)
                                        {"com.example.c", Dictionary{{"election", 3}}},
                                        {"com.example.f", Dictionary{{"election", 4}}}}));
   expectWholeTable("a load");
+  // A value dmap cannot hold fails its save and the next ones, until it is gone again.
+  store->setAnnotation(Dictionary{{"name", "\xff"}}, "com.example.g");
+  store->setAnnotation(Dictionary{{"election", 5}}, "com.example.h");
+  EXPECT_FALSE(tableIn(file).contains("com.example.h"));
+  store->setAnnotation(std::nullopt, "com.example.g");
+  expectWholeTable("an entry that could not be written, removed");
+  EXPECT_TRUE(tableIn(file).contains("com.example.h"));
   store->setAnnotation(std::nullopt, "com.example.b");
   store->setAnnotation(std::nullopt, "com.example.c");
   store->setAnnotation(std::nullopt, "com.example.f");
