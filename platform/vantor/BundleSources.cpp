@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cerrno>
 #include <ctime>
+#include <string_view>
+#include <vector>
 
 #include "platform/cbor/Cbor.h"
 #include "platform/value/Value.h"
@@ -124,6 +126,15 @@ bool BundleSources::Checker::unchanged(std::span<const uint8_t> record) {
       entries->size() > kMaxSources) {
     return false;
   }
+  // A file recorded absent needs no look of its own when its directory was recorded present
+  // before it: creating the file since would have changed the directory's stamp, and the
+  // record holds only when the directory's entry does too.
+  std::vector<std::string_view> present;
+  auto directoryRecordedPresent = [&](std::string_view path) {
+    const size_t slash = path.rfind('/');
+    if (slash == std::string_view::npos || slash == 0) return false;
+    return std::find(present.begin(), present.end(), path.substr(0, slash)) != present.end();
+  };
   for (const Value& value : *entries) {
     const Array* entry = value.array();
     if (entry == nullptr || (entry->size() != 2 && entry->size() != 9)) return false;
@@ -131,7 +142,12 @@ bool BundleSources::Checker::unchanged(std::span<const uint8_t> record) {
     const bool* shared = (*entry)[1].boolean();
     if (path == nullptr || shared == nullptr) return false;
     std::optional<FileStamp> recorded;
-    if (entry->size() == 9) recorded = decodeStamp(*entry);
+    if (entry->size() == 9) {
+      recorded = decodeStamp(*entry);
+      present.push_back(*path);
+    } else if (directoryRecordedPresent(*path)) {
+      continue;
+    }
 
     std::optional<FileStamp> now;
     auto cached = *shared ? shared_.find(*path) : shared_.end();

@@ -1,5 +1,6 @@
 #include "platform/vantor/BundleSources.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
@@ -76,6 +77,31 @@ TEST_F(BundleSourcesTest, RecordHoldsUntilOneOfItsFilesChanges) {
     change.make();
     EXPECT_FALSE(unchanged(fresh)) << change.what;
   }
+}
+
+// With its directory recorded first, an absent file's creation shows in the directory's stamp.
+TEST_F(BundleSourcesTest, AbsentFileOfARecordedDirectoryIsSeenOnceCreated) {
+  // The directory's time is set back, so that a creation changes it even within the clock's
+  // granularity (files settled long ago, as the scan requires).
+  auto recordOfDirectory = [&] {
+    const struct timespec old[2] = {{time(nullptr) - 3600, 0}, {time(nullptr) - 3600, 0}};
+    EXPECT_EQ(utimensat(AT_FDCWD, dir_.c_str(), old, 0), 0);
+    BundleSources sources("ctx", 0);
+    sources.note(dir_);
+    sources.note(path("absent.entitlements"));
+    sources.note(path("absent.lproj/table.strings"));
+    return sources.record().value_or(std::vector<uint8_t>{});
+  };
+  auto bytes = recordOfDirectory();
+  ASSERT_TRUE(unchanged(bytes));
+  write("absent.entitlements", "<dmap/>");
+  EXPECT_FALSE(unchanged(bytes));
+
+  fs::remove(path("absent.entitlements"));
+  bytes = recordOfDirectory();
+  ASSERT_TRUE(unchanged(bytes));
+  fs::create_directory(path("absent.lproj"));
+  EXPECT_FALSE(unchanged(bytes));
 }
 
 TEST_F(BundleSourcesTest, NoRecordWhenAFileIsTooFreshOrNotAFileAtAll) {
