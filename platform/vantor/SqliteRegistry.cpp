@@ -27,7 +27,7 @@ namespace fs = std::filesystem;
 
 // Bumped whenever the tables change; a file with another version is set aside and rebuilt
 // (the registry is derived data: the installer and the start-up scan can always refill it).
-constexpr int kSchemaVersion = 2;
+constexpr int kSchemaVersion = 3;
 // Bounds on what one bundle may make the registry read.
 constexpr size_t kMaxPlugInsPerApplication = 4096;
 constexpr size_t kMaxLanguagesPerBundle = 512;
@@ -45,6 +45,10 @@ constexpr int kCacheSizeKiB = 2 * 1024;
   "WITHOUT ROWID; "                                                                            \
   "CREATE TRIGGER plugins_forget_sources AFTER DELETE ON plugins BEGIN "                       \
   "DELETE FROM plugin_sources WHERE path = old.path; END;"
+
+// Lets a query name its candidates in path order from an index alone, without reading the
+// plug-ins' rows, which the daemon's records already hold.
+#define UUID_PATH_SCHEMA "CREATE INDEX plugins_uuid_path ON plugins(uuid, path);"
 
 constexpr const char* kSchema = R"sql(
 CREATE TABLE meta(key TEXT PRIMARY KEY, value BLOB NOT NULL);
@@ -75,7 +79,7 @@ CREATE TABLE plugin_points(point TEXT NOT NULL, uuid BLOB NOT NULL, PRIMARY KEY(
   WITHOUT ROWID;
 CREATE INDEX plugin_points_uuid ON plugin_points(uuid);
 CREATE TABLE extension_points(identifier TEXT PRIMARY KEY, sdk BLOB NOT NULL);
-)sql" SOURCES_SCHEMA;
+)sql" SOURCES_SCHEMA " " UUID_PATH_SCHEMA;
 
 constexpr const char* kPlugInColumns =
     "p.uuid, p.path, p.identifier, p.original_identifier, p.version, p.app_path, p.point, "
@@ -506,10 +510,13 @@ OpenResult openAndCheck(const std::string& path, sqlite3** out) {
       execute(db, "ROLLBACK");
       return result;
     }
-  } else if (version == "1") {
-    // Version 1 lacked the record of each plug-in's sources: without one, the next scan reads
-    // the bundle and records it.
-    const char* upgrade = "BEGIN; " SOURCES_SCHEMA " PRAGMA user_version=2; COMMIT;";
+  } else if (version == "1" || version == "2") {
+    // Version 1 lacked the record of each plug-in's sources (without one, the next scan reads
+    // the bundle and records it), versions 1 and 2 the index of paths by UUID.
+    const char* upgrade = version == "1" ? "BEGIN; " SOURCES_SCHEMA " " UUID_PATH_SCHEMA
+                                           " PRAGMA user_version=3; COMMIT;"
+                                         : "BEGIN; " UUID_PATH_SCHEMA
+                                           " PRAGMA user_version=3; COMMIT;";
     if ((rc = sqlite3_exec(db, upgrade, nullptr, nullptr, nullptr)) != SQLITE_OK) {
       OpenResult result = failure(db, rc, "upgrading the registry schema");
       execute(db, "ROLLBACK");
@@ -621,8 +628,8 @@ Result<void> SqliteRegistry::prepareSchema() {
                                       kPlugInColumns)},
       {&s.allPlugInUuids, "SELECT uuid FROM plugins ORDER BY path"},
       {&s.plugInUuidsOfPoint,
-       "SELECT p.uuid FROM plugin_points pp JOIN plugins p ON p.uuid = pp.uuid "
-       "WHERE pp.point = ?1 ORDER BY p.path"},
+       "SELECT p.uuid FROM plugin_points pp JOIN plugins p INDEXED BY plugins_uuid_path "
+       "ON p.uuid = pp.uuid WHERE pp.point = ?1 ORDER BY p.path"},
       {&s.upsertSdk, "INSERT OR REPLACE INTO extension_points(identifier, sdk) VALUES(?1, ?2)"},
       {&s.sdkOf, "SELECT sdk FROM extension_points WHERE identifier = ?1"},
   };

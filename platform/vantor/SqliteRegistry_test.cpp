@@ -704,21 +704,31 @@ TEST_F(StartUpScanTest, BundlesAreReadAgainWhenTheirRecordCannotBeTrusted) {
   EXPECT_EQ(reopenCountingReads(), 0);
 }
 
-TEST_F(StartUpScanTest, RegistryOfTheFirstSchemaIsUpgradedInPlace) {
+TEST_F(StartUpScanTest, RegistriesOfEarlierSchemasAreUpgradedInPlace) {
+  struct Earlier {
+    const char* downgrade;
+    int bundlesRead;  // version 1 kept no record of what the bundles were read from
+  };
+  const Earlier earlier[] = {
+      {"DROP INDEX plugins_uuid_path; DROP TRIGGER plugins_forget_sources; "
+       "DROP TABLE plugin_sources; PRAGMA user_version=1;",
+       1},
+      {"DROP INDEX plugins_uuid_path; PRAGMA user_version=2;", 0},
+  };
   Uuid uuid = open().plugInByUrl(spell_)->uuid;
-  registry_.reset();
-  sqlite3* db = nullptr;
-  ASSERT_EQ(sqlite3_open(paths::join(state_, "registry.db").c_str(), &db), SQLITE_OK);
-  ASSERT_EQ(sqlite3_exec(db,
-                         "DROP TRIGGER plugins_forget_sources; DROP TABLE plugin_sources; "
-                         "PRAGMA user_version=1;",
-                         nullptr, nullptr, nullptr),
-            SQLITE_OK);
-  sqlite3_close(db);
-  EXPECT_EQ(reopenCountingReads(), 1);
-  EXPECT_EQ(asideDatabases(state_), 0u);
-  EXPECT_EQ(registry_->plugInByUrl(spell_)->uuid, uuid);
-  EXPECT_EQ(reopenCountingReads(), 0);
+  const Dictionary byPoint{{"ZuExtensionPointIdentifier", Value("com.x.spell")}};
+  for (const Earlier& schema : earlier) {
+    registry_.reset();
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open(paths::join(state_, "registry.db").c_str(), &db), SQLITE_OK);
+    ASSERT_EQ(sqlite3_exec(db, schema.downgrade, nullptr, nullptr, nullptr), SQLITE_OK);
+    sqlite3_close(db);
+    EXPECT_EQ(reopenCountingReads(), schema.bundlesRead) << schema.downgrade;
+    EXPECT_EQ(asideDatabases(state_), 0u);
+    EXPECT_EQ(registry_->plugInByUrl(spell_)->uuid, uuid);
+    EXPECT_EQ(registry_->queryUuids(byPoint), std::vector<Uuid>{uuid});
+    EXPECT_EQ(reopenCountingReads(), 0);
+  }
 }
 
 TEST_F(SqliteRegistryTest, FileThatIsNotADatabaseIsMovedAsideAndRebuilt) {
