@@ -247,8 +247,8 @@ std::optional<std::vector<EkDPlugInRef>> EkDatabase::findPlugIns(const Dictionar
       result.push_back(std::move(cached));
       continue;
     }
-    // Gone since the registry named it: as if the query had run a moment later.
     vantor::PlugInProxyPtr proxy = platform_.registry->plugInByUuid(uuid);
+    // Gone since the registry named it: as if the query had run a moment later.
     if (!proxy) continue;
     if (elections && !electionFilter(*elections, proxy->identifier, proxy->entitlements)) continue;
     ++selected;

@@ -128,11 +128,15 @@ bool BundleSources::Checker::unchanged(std::span<const uint8_t> record) {
   }
   // A file recorded absent needs no look of its own when its directory was recorded present
   // before it: creating the file since would have changed the directory's stamp, and the
-  // record holds only when the directory's entry does too.
+  // record holds only when the directory's entry does too. A bundle records a handful of
+  // files; past kMaxSearched, files are looked at rather than searched for.
+  static constexpr size_t kMaxSearched = 64;
   std::vector<std::string_view> present;
   auto directoryRecordedPresent = [&](std::string_view path) {
     const size_t slash = path.rfind('/');
-    if (slash == std::string_view::npos || slash == 0) return false;
+    if (slash == std::string_view::npos || slash == 0 || present.size() > kMaxSearched) {
+      return false;
+    }
     return std::find(present.begin(), present.end(), path.substr(0, slash)) != present.end();
   };
   for (const Value& value : *entries) {
