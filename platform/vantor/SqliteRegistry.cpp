@@ -1319,6 +1319,7 @@ std::vector<PlugInProxyPtr> SqliteRegistry::query(const Dictionary& rules,
 }
 
 std::vector<Uuid> SqliteRegistry::queryUuids(const Dictionary& rules) {
+  checkLocale();
   std::vector<Uuid> uuids;
   std::lock_guard db(dbMutex_);
   auto collect = [&](sqlite3_stmt* statement, std::set<Uuid>* seen) {

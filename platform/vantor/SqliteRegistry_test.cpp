@@ -862,6 +862,10 @@ TEST_F(SqliteRegistryTest, LocaleFileOverridesTheEnvironmentAndItsChangeIsANotic
   fs::remove(state_ + "/locale");
   registry.checkLocale();
   EXPECT_EQ(recorder_->drained().size(), 3u);
+  // A query that reads no proxy still notices the change, as the daemon's matches rely on.
+  ASSERT_TRUE(dmap::writeBytesAtomically(state_ + "/locale", "fr\n").ok());
+  EXPECT_EQ(registry.queryUuids({}).size(), 1u);
+  EXPECT_EQ(recorder_->drained().size(), 4u);
 }
 
 class QueryTest : public SqliteRegistryTest {
