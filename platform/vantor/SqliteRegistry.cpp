@@ -300,7 +300,6 @@ struct SqliteRegistry::Statements {
   sqlite3_stmt* plugInsOfApp = nullptr;
   sqlite3_stmt* plugInUuidsOfApp = nullptr;
   sqlite3_stmt* allPlugIns = nullptr;
-  sqlite3_stmt* plugInsOfPoint = nullptr;
   sqlite3_stmt* allPlugInUuids = nullptr;
   sqlite3_stmt* plugInUuidsOfPoint = nullptr;
   sqlite3_stmt* upsertSdk = nullptr;
@@ -311,12 +310,34 @@ struct SqliteRegistry::Statements {
   sqlite3_stmt* allPlugInPaths = nullptr;
 
   std::vector<sqlite3_stmt**> all() {
-    return {&begin,          &commit,         &rollback,           &setMeta,          &getMeta,
-            &upsertApp,      &deleteApp,      &appByPath,          &appByIdentifier,  &appExists,
-            &allApps,        &insertPlugIn,   &deletePlugIn,       &insertPoint,      &deletePoints,
-            &plugInByUuid,   &plugInByPath,   &plugInsOfApp,       &plugInUuidsOfApp, &allPlugIns,
-            &plugInsOfPoint, &allPlugInUuids, &plugInUuidsOfPoint, &upsertSdk,        &sdkOf,
-            &setSources,     &allSources,     &allPlugInPaths,     &forgetSources};
+    return {&begin,
+            &commit,
+            &rollback,
+            &setMeta,
+            &getMeta,
+            &upsertApp,
+            &deleteApp,
+            &appByPath,
+            &appByIdentifier,
+            &appExists,
+            &allApps,
+            &insertPlugIn,
+            &deletePlugIn,
+            &insertPoint,
+            &deletePoints,
+            &plugInByUuid,
+            &plugInByPath,
+            &plugInsOfApp,
+            &plugInUuidsOfApp,
+            &allPlugIns,
+            &allPlugInUuids,
+            &plugInUuidsOfPoint,
+            &upsertSdk,
+            &sdkOf,
+            &setSources,
+            &allSources,
+            &allPlugInPaths,
+            &forgetSources};
   }
   ~Statements() {
     for (sqlite3_stmt** statement : all()) sqlite3_finalize(*statement);
@@ -623,9 +644,6 @@ Result<void> SqliteRegistry::prepareSchema() {
       {&s.plugInsOfApp, plugInSelect + "WHERE p.app_path = ?1 ORDER BY p.path"},
       {&s.plugInUuidsOfApp, "SELECT uuid FROM plugins WHERE app_path = ?1 ORDER BY path"},
       {&s.allPlugIns, plugInSelect + "ORDER BY p.path"},
-      {&s.plugInsOfPoint, fmt::format("SELECT {} FROM plugin_points pp JOIN plugins p "
-                                      "ON p.uuid = pp.uuid WHERE pp.point = ?1 ORDER BY p.path",
-                                      kPlugInColumns)},
       {&s.allPlugInUuids, "SELECT uuid FROM plugins ORDER BY path"},
       {&s.plugInUuidsOfPoint,
        "SELECT p.uuid FROM plugin_points pp JOIN plugins p INDEXED BY plugins_uuid_path "
@@ -1293,21 +1311,10 @@ std::vector<PlugInProxyPtr> SqliteRegistry::query(const Dictionary& rules,
   std::vector<PlugInProxyPtr> candidates;
   {
     std::lock_guard db(dbMutex_);
-    auto points = indexedExtensionPoints(rules);
-    if (!points) {
-      Use list(statements_->allPlugIns);
-      candidates = readAllLocked(list.get());
-    } else {
-      std::set<std::string> keys;
-      for (const std::string& point : *points) keys.insert(extensionPointIndexKey(point));
-      std::set<Uuid> seen;
-      for (const std::string& key : keys) {
-        Use list(statements_->plugInsOfPoint);
-        list.text(1, key);
-        for (PlugInProxyPtr& proxy : readAllLocked(list.get())) {
-          if (seen.insert(proxy->uuid).second) candidates.push_back(std::move(proxy));
-        }
-      }
+    for (const Uuid& uuid : uuidsLocked(rules)) {
+      Use find(statements_->plugInByUuid);
+      find.uuid(1, uuid);
+      if (find.step() == SQLITE_ROW) candidates.push_back(readPlugInLocked(find.get()));
     }
   }
   if (!filter) return candidates;
@@ -1320,8 +1327,12 @@ std::vector<PlugInProxyPtr> SqliteRegistry::query(const Dictionary& rules,
 
 std::vector<Uuid> SqliteRegistry::queryUuids(const Dictionary& rules) {
   checkLocale();
-  std::vector<Uuid> uuids;
   std::lock_guard db(dbMutex_);
+  return uuidsLocked(rules);
+}
+
+std::vector<Uuid> SqliteRegistry::uuidsLocked(const Dictionary& rules) {
+  std::vector<Uuid> uuids;
   auto collect = [&](sqlite3_stmt* statement, std::set<Uuid>* seen) {
     while (sqlite3_step(statement) == SQLITE_ROW) {
       Uuid uuid = columnUuid(statement, 0);

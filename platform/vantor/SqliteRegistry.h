@@ -106,6 +106,8 @@ class SqliteRegistry : public Registry {
   // Under dbMutex_. The language is the one checkLocale last saw.
   PlugInProxyPtr readPlugInLocked(void* statement);
   std::vector<PlugInProxyPtr> readAllLocked(void* statement);
+  // The UUIDs query considers for rules, in path order.
+  std::vector<Uuid> uuidsLocked(const Dictionary& rules);
   std::string languageLocked();
 
   void deliverInstall(std::vector<PlugInProxyPtr> plugIns);
