@@ -182,7 +182,7 @@ std::optional<EkError> EkDaemonClient::errorInReply(const Result<Value>& reply) 
 }
 
 std::optional<Value> EkDaemonClient::convertToWyre(Value object, uint64_t version) {
-  if (version != protocol::kCurrentVersion) return std::nullopt;
+  if (!convertsToWyre(version)) return std::nullopt;
   return std::optional<Value>(std::move(object));
 }
 

@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include "Ekora/EkProtocol.h"
 #include "platform/queue/SerialQueue.h"
 #include "platform/value/EkError.h"
 #include "platform/value/Result.h"
@@ -60,6 +61,8 @@ class EkDaemonClient {
   // The property-list conversion of "matches", defined for protocol version 3 only. Takes the
   // object by value: a match of hundreds of forms is moved into the reply, not copied.
   static std::optional<Value> convertToWyre(Value object, uint64_t version);
+  // Whether convertToWyre converts for version: a reply to any other version has no "matches".
+  static bool convertsToWyre(uint64_t version) { return version == protocol::kCurrentVersion; }
   std::optional<Value> convertFromWyre(const Value& value) const;
 
   int64_t protocolVersion() const { return protocolVersion_.load(); }

@@ -167,9 +167,9 @@ std::unique_ptr<EkDAnnotationStore> EkDAnnotationStore::initWithDatabase(
 }
 
 std::optional<Dictionary> EkDAnnotationStore::annotationForIdentifier(std::string_view key) const {
-  auto it = annotations_.find(key);
-  if (it == annotations_.end()) return std::nullopt;
-  const Dictionary* annotation = it->second.dictionary();
+  auto it = index_.find(key);
+  if (it == index_.end()) return std::nullopt;
+  const Dictionary* annotation = it->second->dictionary();
   if (annotation == nullptr) return std::nullopt;
   return *annotation;
 }
@@ -188,8 +188,11 @@ void EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
   if (annotation) {
     Dictionary merged = annotationForIdentifier(key).value_or(Dictionary{});
     for (const auto& [name, value] : *annotation) merged.insert_or_assign(name, value);
-    annotations_.insert_or_assign(key, Value(std::move(merged)));
+    auto entry = annotations_.insert_or_assign(key, Value(std::move(merged))).first;
+    index_.insert_or_assign(entry->first, &entry->second);
   } else {
+    // The index's key refers to the table's: it goes first.
+    index_.erase(key);
     annotations_.erase(key);
   }
   stale_.insert(key);
@@ -240,6 +243,9 @@ Result<void> EkDAnnotationStore::load(const std::string& path, bool& dataUsable)
     }
   }
   annotations_ = data != nullptr ? std::move(*data) : Dictionary{};
+  index_.clear();
+  index_.reserve(annotations_.size());
+  for (const auto& [key, annotation] : annotations_) index_.emplace(key, &annotation);
   written_.clear();
   stale_.clear();
   allStale_ = true;

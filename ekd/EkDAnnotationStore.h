@@ -7,6 +7,7 @@
 #include <set>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 #include "platform/value/Result.h"
@@ -23,6 +24,10 @@ class EkDPlugIn;
 class EkDAnnotationStore {
  public:
   static constexpr int64_t kVersion = 16;
+
+  // The index refers into the table: a copy would refer into the original's.
+  EkDAnnotationStore(const EkDAnnotationStore&) = delete;
+  EkDAnnotationStore& operator=(const EkDAnnotationStore&) = delete;
 
   // Opens the store on path (absent: defaultDatabaseURL()) and loads it. A file that is
   // missing starts an empty table silently; one that cannot be read or parsed, or has another
@@ -75,6 +80,9 @@ class EkDAnnotationStore {
 
   std::string annotationsURL_;
   Dictionary annotations_;
+  // The entries of annotations_ by key: a lookup in a tree of 10,000 keys sharing a long prefix
+  // compares most of each key a dozen times, for each plug-in of a reply.
+  std::unordered_map<std::string_view, const Value*> index_;
   // The dmap text of each entry of annotations_ as last saved, but for the keys changed since
   // (stale_), or all of them (allStale_, after a load).
   // Sorted by key, and contiguous: a save walks every entry, which a tree made slower than

@@ -174,7 +174,7 @@ bool EkDPlugIn::initWithVRData(const vantor::PlugInProxy& proxy) {
   {
     // Current until the registry's knowledge changes, when the proxy says when it was read.
     std::lock_guard lock(infoMutex_);
-    infoDmap_ = std::move(info);
+    storeInfoLocked(std::move(info));
     vrKnowledgeUUID_ = proxy.knowledge;
   }
 
@@ -213,11 +213,17 @@ vantor::PlugInProxyPtr EkDPlugIn::getProxy() const {
   return context_.registry->plugInByUrl(location->string());
 }
 
-DictionaryRef EkDPlugIn::bundleInfoDictionary() const {
+void EkDPlugIn::storeInfoLocked(DictionaryRef info) const {
+  current_.plugIn = dictionaryMember(info, pk::kInfoPlugInDictionary);
+  current_.attributes = dictionaryMember(current_.plugIn, pk::kAttributes);
+  current_.info = std::move(info);
+}
+
+EkDPlugIn::CurrentInfo EkDPlugIn::currentInfo() const {
   const Uuid knowledge = context_.registry->knowledgeUuid();
   {
     std::lock_guard lock(infoMutex_);
-    if (vrKnowledgeUUID_ == knowledge) return infoDmap_;
+    if (vrKnowledgeUUID_ == knowledge) return current_;
   }
   std::lock_guard refresh(refreshMutex_);
   vantor::PlugInProxyPtr proxy = getProxy();
@@ -228,23 +234,23 @@ DictionaryRef EkDPlugIn::bundleInfoDictionary() const {
     log::ops().error(kLogNoFreshProxy, uuid());
   }
   std::lock_guard lock(infoMutex_);
-  infoDmap_ = info;
+  storeInfoLocked(std::move(info));
   vrKnowledgeUUID_ = knowledge;
-  return info;
+  return current_;
+}
+
+DictionaryRef EkDPlugIn::bundleInfoDictionary() const {
+  return currentInfo().info;
 }
 
 DictionaryRef EkDPlugIn::infoDmap() const {
   std::lock_guard lock(infoMutex_);
-  return infoDmap_;
+  return current_.info;
 }
 
 std::optional<Uuid> EkDPlugIn::vrKnowledgeUUID() const {
   std::lock_guard lock(infoMutex_);
   return vrKnowledgeUUID_;
-}
-
-DictionaryRef EkDPlugIn::currentPlugInDictionary() const {
-  return dictionaryMember(bundleInfoDictionary(), pk::kInfoPlugInDictionary);
 }
 
 ValueRef EkDPlugIn::infoKey(std::string_view key) const {
@@ -254,11 +260,11 @@ ValueRef EkDPlugIn::infoKey(std::string_view key) const {
 }
 
 ValueRef EkDPlugIn::pluginKey(std::string_view key) const {
-  return member(currentPlugInDictionary(), key);
+  return member(currentInfo().plugIn, key);
 }
 
 ValueRef EkDPlugIn::attribute(std::string_view key) const {
-  return member(dictionaryMember(currentPlugInDictionary(), pk::kAttributes), key);
+  return member(currentInfo().attributes, key);
 }
 
 std::optional<Dictionary> EkDPlugIn::readSDKDictionary(std::string_view extensionPoint) const {

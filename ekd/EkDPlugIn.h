@@ -157,8 +157,16 @@ class EkDPlugIn : public EkPlugInCore {
 
   bool initWithVRData(const vantor::PlugInProxy& proxy);
   EkSandbox& sandbox() const;
-  // The "ZuExtension" dictionary of the current info dictionary, sharing its ownership.
-  DictionaryRef currentPlugInDictionary() const;
+  // The current info dictionary with its "ZuExtension" dictionary and that one's
+  // "ZuExtensionAttributes", found once per fetch: every lookup of a match reads them.
+  struct CurrentInfo {
+    DictionaryRef info;
+    DictionaryRef plugIn;
+    DictionaryRef attributes;
+  };
+  // Fetches the info dictionary again when the registry's knowledge UUID has changed.
+  CurrentInfo currentInfo() const;
+  void storeInfoLocked(DictionaryRef info) const;
 
   const EkDPlugInContext context_;
 
@@ -166,7 +174,7 @@ class EkDPlugIn : public EkPlugInCore {
   // registry lookup.
   mutable std::mutex refreshMutex_;
   mutable std::mutex infoMutex_;
-  mutable DictionaryRef infoDmap_;
+  mutable CurrentInfo current_;
   mutable std::optional<Uuid> vrKnowledgeUUID_;
 };
 

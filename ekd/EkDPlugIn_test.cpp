@@ -15,6 +15,8 @@
 
 #include "Ekora/EkPlugInKeys.h"
 #include "Ekora/EkSandboxKey.h"
+#include "ekd/EkDFormCache.h"
+#include "platform/cbor/Cbor.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/log/Log.h"
 #include "platform/log/testing/CapturingSink.h"
@@ -754,6 +756,97 @@ TEST_F(EkDPlugInTest, NonStringSharedValueGivesNoExtensionsKey) {
   Dictionary form;
   record->augmentForm(form);
   EXPECT_FALSE(form.contains("extensions"));
+}
+
+// ---- Forms kept encoded ----------------------------------------------------------------------
+
+// The form a kept encoding stands for.
+Dictionary decodeKept(const EkDFormCache::EncodedForm& form) {
+  std::vector<uint8_t> bytes;
+  cbor::encodeMapHead(form.count, bytes);
+  bytes.insert(bytes.end(), form.members.begin(), form.members.end());
+  Result<Value> decoded = cbor::decode(bytes);
+  EXPECT_TRUE(decoded.ok()) << (decoded.ok() ? "" : decoded.error().message);
+  if (!decoded.ok() || decoded->dictionary() == nullptr) return {};
+  return *decoded->dictionary();
+}
+
+TEST_F(EkDPlugInTest, KeptFormIsTheExportedFormWithoutWhatEachReplyAdds) {
+  auto record = build(thumbsProxy());
+  ASSERT_NE(record, nullptr);
+  record->setAnnotations(std::make_shared<const Dictionary>(Dictionary{{"election", 1}}));
+  EkDFormCache cache(1 << 20);
+  auto kept = cache.formFor(record);
+  ASSERT_NE(kept, nullptr);
+  EXPECT_FALSE(kept->error);
+
+  Dictionary expected = record->exportForm().form;
+  ASSERT_TRUE(expected.contains("annotations"));
+  expected.erase("annotations");
+  EXPECT_EQ(decodeKept(*kept), expected);
+  // Asked again for the same record, the same bytes come back without a new export.
+  EXPECT_EQ(cache.formFor(record), kept);
+  EXPECT_EQ(cache.count(), 1u);
+  EXPECT_EQ(cache.bytes(), kept->members.capacity());
+}
+
+TEST_F(EkDPlugInTest, KeptFormIsMadeAgainAfterARegistryChangeOrForANewRecord) {
+  vantor::PlugInProxy proxy = spellProxy();
+  auto record = build(proxy);
+  ASSERT_NE(record, nullptr);
+  EkDFormCache cache(1 << 20);
+  auto first = cache.formFor(record);
+  const std::string* version = stringIn(proxy.info, "QvBundleVersion");
+  ASSERT_NE(version, nullptr);
+  ASSERT_NE(*version, "9.9");
+  const Dictionary firstForm = decodeKept(*first);
+  const std::string* keptVersion = firstForm.at("bundleInfo").getString("QvBundleVersion");
+  ASSERT_NE(keptVersion, nullptr);
+  EXPECT_EQ(*keptVersion, *version);
+
+  // The registry now holds another info dictionary for the plug-in.
+  vantor::PlugInProxy changed = proxy;
+  changed.info["QvBundleVersion"] = Value("9.9");
+  registry_->install(changed);
+  auto second = cache.formFor(record);
+  ASSERT_NE(second, first);
+  const Dictionary secondForm = decodeKept(*second);
+  const Value& bundleInfo = secondForm.at("bundleInfo");
+  ASSERT_NE(bundleInfo.getString("QvBundleVersion"), nullptr);
+  EXPECT_EQ(*bundleInfo.getString("QvBundleVersion"), "9.9");
+  EXPECT_EQ(cache.formFor(record), second);
+
+  // A record built again for the same UUID (a locale change does that) gets its own form.
+  auto rebuilt = EkDPlugIn::createWithVRData(changed, context());
+  ASSERT_NE(rebuilt, nullptr);
+  EXPECT_NE(cache.formFor(rebuilt), second);
+  EXPECT_EQ(cache.count(), 1u);
+}
+
+TEST_F(EkDPlugInTest, FormsBeyondTheLimitAreDroppedLeastRecentlyUsedFirst) {
+  std::vector<std::shared_ptr<EkDPlugIn>> records;
+  for (int i = 0; i < 3; ++i) {
+    vantor::PlugInProxy proxy = spellProxy();
+    proxy.uuid = Uuid::random();
+    records.push_back(build(proxy));
+    ASSERT_NE(records.back(), nullptr);
+  }
+  const size_t size = EkDFormCache(1 << 20).formFor(records[0])->members.capacity();
+  EkDFormCache cache(2 * size + size / 2);
+  auto form0 = cache.formFor(records[0]);
+  auto form1 = cache.formFor(records[1]);
+  EXPECT_EQ(cache.formFor(records[0]), form0);  // 0 is now the most recently used
+  cache.formFor(records[2]);                    // drops 1, not 0
+  EXPECT_EQ(cache.count(), 2u);
+  EXPECT_LE(cache.bytes(), 2 * size + size / 2);
+  EXPECT_EQ(cache.formFor(records[0]), form0);
+  EXPECT_NE(cache.formFor(records[1]), form1);
+
+  // A form larger than the whole cache is answered and not kept.
+  EkDFormCache tiny(size / 2);
+  EXPECT_NE(tiny.formFor(records[0]), nullptr);
+  EXPECT_EQ(tiny.count(), 0u);
+  EXPECT_EQ(tiny.bytes(), 0u);
 }
 
 }  // namespace

@@ -217,18 +217,24 @@ std::optional<std::vector<EkDPlugInRef>> EkDatabase::findPlugIns(const Dictionar
     }
   }
 
-  size_t cachedBefore = cacheCount();
+  // The cached records of all candidates in one visit to the queue.
+  size_t cachedBefore = 0;
+  std::vector<EkDPlugInRef> records(uuids.size());
+  sync_->sync([&] {
+    cachedBefore = cache_.size();
+    for (size_t i = 0; i < uuids.size(); ++i) {
+      auto it = cache_.find(uuids[i]);
+      if (it != cache_.end() && it->second->isStillValid()) records[i] = it->second;
+    }
+  });
   size_t selected = 0;
   std::vector<EkDPlugInRef> result;
   result.reserve(uuids.size());
   std::unordered_set<Uuid> seen;
-  for (const Uuid& uuid : uuids) {
+  for (size_t i = 0; i < uuids.size(); ++i) {
+    const Uuid& uuid = uuids[i];
     if (!seen.insert(uuid).second) continue;
-    EkDPlugInRef cached = onQueue(*sync_, [&]() -> EkDPlugInRef {
-      auto it = cache_.find(uuid);
-      return it != cache_.end() && it->second->isStillValid() ? it->second : nullptr;
-    });
-    if (cached) {
+    if (EkDPlugInRef cached = std::move(records[i])) {
       if (elections) {
         DictionaryRef entitlements = cached->entitlements();
         if (!electionFilter(*elections, cached->identifier().value_or(""),
@@ -325,6 +331,20 @@ std::optional<EkError> EkDatabase::removePlugIn(std::string_view url) {
 
 std::optional<Dictionary> EkDatabase::annotationForPlugIn(const EkDPlugIn& plugIn) {
   return onQueue(*sync_, [&] { return annotations_->annotationForPlugIn(plugIn); });
+}
+
+std::vector<std::optional<Dictionary>> EkDatabase::annotationsForPlugIns(
+    const std::vector<const EkDPlugIn*>& plugIns) {
+  std::vector<std::string> keys;
+  keys.reserve(plugIns.size());
+  for (const EkDPlugIn* plugIn : plugIns) keys.push_back(plugIn->annotationKey());
+  std::vector<std::optional<Dictionary>> annotations(plugIns.size());
+  sync_->sync([&] {
+    for (size_t i = 0; i < keys.size(); ++i) {
+      annotations[i] = annotations_->annotationForIdentifier(keys[i]);
+    }
+  });
+  return annotations;
 }
 
 void EkDatabase::setAnnotation(const std::optional<Dictionary>& annotation,

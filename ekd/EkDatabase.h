@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "ekd/EkDAnnotationStore.h"
+#include "ekd/EkDFormCache.h"
 #include "ekd/EkDPlugIn.h"
 #include "platform/notify/Notifications.h"
 #include "platform/queue/SerialQueue.h"
@@ -86,6 +87,9 @@ class EkDatabase : public vantor::RegistryObserver {
   std::optional<EkError> removePlugIn(std::string_view url);
 
   std::optional<Dictionary> annotationForPlugIn(const EkDPlugIn& plugIn);
+  // The same for each of plugIns, in one visit to the queue.
+  std::vector<std::optional<Dictionary>> annotationsForPlugIns(
+      const std::vector<const EkDPlugIn*>& plugIns);
   // Merges (or, when absent, removes) and saves at once. Posts nothing: the request handlers
   // post once for all their changes with notifyAnnotationChange.
   void setAnnotation(const std::optional<Dictionary>& annotation, const EkDPlugIn& plugIn);
@@ -108,6 +112,8 @@ class EkDatabase : public vantor::RegistryObserver {
   uint32_t cacheLimit() const { return cacheLimit_.load(); }
   void setCacheLimit(uint32_t limit) { cacheLimit_ = limit; }
   size_t cacheCount();
+  // Forms of the plug-ins that replies carry by the hundred ("match"), kept encoded.
+  EkDFormCache& formCache() { return formCache_; }
 
   const std::shared_ptr<vantor::Registry>& workspace() const { return platform_.registry; }
   const std::shared_ptr<notify::Notifier>& notifier() const { return platform_.notifier; }
@@ -136,6 +142,8 @@ class EkDatabase : public vantor::RegistryObserver {
   std::unique_ptr<EkDAnnotationStore> annotations_;  // on _sync
   std::shared_ptr<SerialQueue> sync_;
   std::unordered_map<Uuid, EkDPlugInRef> cache_;  // on _sync
+  // About 2.6 KB a form: the forms of the largest extension points of a full installation.
+  EkDFormCache formCache_{4u << 20};
 };
 
 }  // namespace ek

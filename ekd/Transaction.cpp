@@ -8,6 +8,7 @@
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDWyreClient.h"
+#include "platform/cbor/Cbor.h"
 #include "platform/log/Log.h"
 #include "platform/trace/Probes.h"
 
@@ -85,19 +86,45 @@ void Transaction::dispatch() {
   (this->*(it->second))();
 }
 
-void Transaction::done() {
+void Transaction::prepareReply() {
   if (replied_) {
     log::ops().error("transaction for client %d replied twice", client_->pid());
     std::abort();
   }
   replied_ = true;
   if (beforeReply_) std::exchange(beforeReply_, nullptr)();
+}
+
+void Transaction::done() {
+  prepareReply();
   Value reply(std::move(reply_));
   if (EK_PROBE_ENABLED(request_output)) {
     std::string text = reply.description();
     EK_PROBE2(request_output, client_->pid(), text.c_str());
   }
   if (auto connection = client_->connection()) connection->reply(request_, reply);
+}
+
+void Transaction::doneWithEncoded(
+    std::string_view key, const std::function<void(std::vector<uint8_t>& out)>& writeValue) {
+  prepareReply();
+  if (auto it = reply_.find(key); it != reply_.end()) reply_.erase(it);
+  std::vector<uint8_t> frame(wyre::kHeaderSize);
+  cbor::encodeMapHead(reply_.size() + 1, frame);
+  for (const auto& [name, value] : reply_) {
+    cbor::encodeText(name, frame);
+    cbor::encode(value, frame);
+  }
+  cbor::encodeText(key, frame);
+  writeValue(frame);
+  if (EK_PROBE_ENABLED(request_output)) {
+    auto reply = cbor::decode(std::span(frame).subspan(wyre::kHeaderSize));
+    std::string text = reply ? reply->description() : reply.error().message;
+    EK_PROBE2(request_output, client_->pid(), text.c_str());
+  }
+  if (auto connection = client_->connection()) {
+    connection->replyEncoded(request_, std::move(frame));
+  }
 }
 
 void Transaction::fail(int32_t code, std::string_view message) {

@@ -6,6 +6,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/value/EkError.h"
 #include "platform/value/Value.h"
@@ -29,6 +30,10 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   // Sends the reply on the client's connection (a no-op when it has gone), after running the
   // work set with beforeReply.
   void done();
+  // done, with one more member of the reply under key written by writeValue straight in its
+  // encoding (exactly one CBOR item), for a reply too large to build as values first.
+  void doneWithEncoded(std::string_view key,
+                       const std::function<void(std::vector<uint8_t>& out)>& writeValue);
   // Work that must be finished before any reply, success or failure, leaves: what the reply
   // acknowledges must be durable by then.
   void beforeReply(std::function<void()> work) { beforeReply_ = std::move(work); }
@@ -87,6 +92,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   Dictionary reply_;
   std::atomic<uint64_t> version_{0};
   bool replied_ = false;
+  // Marks the transaction replied and runs the work set with beforeReply.
+  void prepareReply();
   std::function<void()> beforeReply_;
 };
 

@@ -7,11 +7,13 @@
 #include "Ekora/EkDaemonClient.h"
 #include "Ekora/EkPlugInKeys.h"
 #include "Ekora/EkProtocol.h"
+#include "ekd/EkDFormCache.h"
 #include "ekd/EkDPlugIn.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDUserPrefs.h"
 #include "ekd/EkDWyreClient.h"
 #include "ekd/Transaction.h"
+#include "platform/cbor/Cbor.h"
 #include "platform/log/Log.h"
 #include "platform/process/Process.h"
 #include "platform/trace/Probes.h"
@@ -22,30 +24,30 @@ namespace {
 namespace form = plugin::form;
 using Candidates = std::vector<std::shared_ptr<EkDPlugIn>>;
 
-const std::string* stringIn(const Dictionary& dictionary, std::string_view key) {
-  auto it = dictionary.find(key);
-  return it == dictionary.end() ? nullptr : it->second.string();
+// One plug-in of the reply: its kept form, and what this reply adds to it.
+struct Match {
+  Match(std::shared_ptr<EkDPlugIn> plugIn, std::shared_ptr<const EkDFormCache::EncodedForm> form)
+      : plugIn(std::move(plugIn)), form(std::move(form)) {}
+  std::shared_ptr<EkDPlugIn> plugIn;
+  std::shared_ptr<const EkDFormCache::EncodedForm> form;
+  Dictionary added;
+};
+
+// The version text of the plug-in's form: its version when that is a string, the no-version
+// text when it has none, nothing for a version of another type.
+std::optional<std::string> formVersion(const EkDPlugIn& plugIn) {
+  ValueRef version = plugIn.version();
+  if (!version) return std::string(plugin::kNoVersion);
+  if (const std::string* text = version->string()) return *text;
+  return std::nullopt;
 }
 
-int32_t lastModifiedIn(const Dictionary& form) {
-  auto it = form.find(form::kLastModified);
-  if (it == form.end()) return 0;
-  if (const uint64_t* u = it->second.unsignedNumber()) return static_cast<int32_t>(*u);
-  if (const int64_t* i = it->second.negativeNumber()) return static_cast<int32_t>(*i);
-  return 0;
-}
-
-bool systemResidentIn(const Dictionary& form) {
-  auto it = form.find(form::kSystemResident);
-  return it != form.end() && it->second.boolean() && *it->second.boolean();
-}
-
-// Whether candidate P wins over the earlier form X of the same identifier and version.
-bool candidateWins(const EkDPlugIn& plugIn, const Dictionary& earlier) {
-  bool earlierSystem = systemResidentIn(earlier);
+// Whether candidate P wins over an earlier match X of the same identifier and version.
+bool candidateWins(const EkDPlugIn& plugIn, const EkDPlugIn& earlier) {
+  bool earlierSystem = earlier.onSystemVolume();
   if (!plugIn.onSystemVolume() && earlierSystem) return false;
   if (plugIn.onSystemVolume() && !earlierSystem) return true;
-  return plugIn.lastModified() > lastModifiedIn(earlier);
+  return plugIn.lastModified() > earlier.lastModified();
 }
 
 // A plug-in inside the requesting host's own application wins over other copies of its
@@ -138,14 +140,15 @@ void Transaction::matchPlugIns() {
   std::optional<std::string> pluginsPath;
   if (const auto& bundle = client_->bundle()) pluginsPath = bundle->plugInsPath();
 
-  // Forms are shared with the override table: a replacing form removed from the results by a
-  // newer copy still marks the plug-ins it replaces. A removed form leaves an empty slot, so
-  // that the positions recorded per identifier stay valid.
-  using FormRef = std::shared_ptr<Dictionary>;
-  std::vector<FormRef> results;
+  // Matches are shared with the override table: a replacing plug-in removed from the results
+  // by a newer copy still marks the plug-ins it replaces. A removed match leaves an empty slot,
+  // so that the positions recorded per identifier stay valid.
+  using MatchRef = std::shared_ptr<Match>;
+  std::vector<MatchRef> results;
   std::unordered_map<std::string, std::vector<size_t>> accepted;
-  std::unordered_map<std::string, FormRef> overrides;
+  std::unordered_map<std::string, MatchRef> overrides;
   const Dictionary* matchRules = rules ? &*rules : nullptr;
+  EkDFormCache& forms = database.formCache();
   for (const auto& plugIn : candidates) {
     if (!all) {
       if (!plugIn->onSystemVolume()) {
@@ -176,24 +179,23 @@ void Transaction::matchPlugIns() {
         continue;
       }
     }
-    auto exported = plugIn->exportForm();
-    if (exported.error) {
+    auto match = std::make_shared<Match>(plugIn, forms.formFor(plugIn));
+    if (match->form->error) {
       log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(),
-                       *exported.error);
+                       *match->form->error);
     }
-    Dictionary& form = exported.form;
 
-    // De-duplication against the forms accepted so far with the same identifier, earliest
+    // De-duplication against the matches accepted so far with the same identifier, earliest
     // first; the index keeps this linear in the number of candidates.
-    const std::string identifier = plugIn->identifier().value_or("");
+    const std::optional<std::string> identifier = plugIn->identifier();
     const std::optional<std::string> version = plugIn->versionString();
     bool dropped = false;
-    auto sameIdentifier = accepted.find(identifier);
+    auto sameIdentifier = accepted.find(identifier.value_or(""));
     if (sameIdentifier != accepted.end()) {
       std::vector<size_t>& positions = sameIdentifier->second;
       for (auto position = positions.begin(); position != positions.end(); ++position) {
-        const Dictionary& earlier = *results[*position];
-        const std::string* otherVersion = stringIn(earlier, form::kVersion);
+        const EkDPlugIn& earlier = *results[*position]->plugIn;
+        const std::optional<std::string> otherVersion = formVersion(earlier);
         auto order = compareVersionString(version ? &*version : nullptr,
                                           otherVersion ? std::string_view(*otherVersion) : "");
         bool removeEarlier = false;
@@ -224,41 +226,44 @@ void Transaction::matchPlugIns() {
     }
     if (dropped) continue;
 
-    addAnnotationForPlugIn(*plugIn, form);
-    plugIn->augmentForm(form);
-    if (const std::string* formIdentifier = stringIn(form, form::kIdentifier)) {
-      accepted[*formIdentifier].push_back(results.size());
-    }
-    auto kept = std::make_shared<Dictionary>(std::move(form));
-    results.push_back(kept);
+    plugIn->augmentForm(match->added);
+    if (identifier) accepted[*identifier].push_back(results.size());
+    results.push_back(match);
     if (auto replaces = plugIn->valueForEntitlement(protocol::kEntitlementReplacePlugIn)) {
       if (const std::string* name = replaces->string()) {
-        overrides[*name] = kept;
+        overrides[*name] = match;
       } else if (const Array* names = replaces->array()) {
         for (const Value& element : *names) {
-          if (const std::string* name = element.string()) overrides[*name] = kept;
+          if (const std::string* name = element.string()) overrides[*name] = match;
         }
       }
     }
   }
 
   std::erase(results, nullptr);
-  for (const FormRef& result : results) {
+  {
+    std::vector<const EkDPlugIn*> matched;
+    matched.reserve(results.size());
+    for (const MatchRef& result : results) matched.push_back(result->plugIn.get());
+    std::vector<std::optional<Dictionary>> annotations = database.annotationsForPlugIns(matched);
+    for (size_t i = 0; i < results.size(); ++i) {
+      results[i]->added.insert_or_assign(
+          std::string(protocol::kAnnotations),
+          Value(annotations[i] ? std::move(*annotations[i]) : Dictionary{}));
+    }
+  }
+  for (const MatchRef& replaced : results) {
     if (overrides.empty()) break;
-    Dictionary& replaced = *result;
-    const std::string* identifier = stringIn(replaced, form::kIdentifier);
+    const std::optional<std::string> identifier = replaced->plugIn->identifier();
     if (!identifier) continue;
     auto it = overrides.find(*identifier);
     if (it == overrides.end()) continue;
-    Dictionary& overrider = *it->second;
-    const std::string* overriderUuid = stringIn(overrider, form::kUuid);
-    const std::string* replacedUuid = stringIn(replaced, form::kUuid);
-    replaced.insert_or_assign(std::string(form::kOverrider),
-                              Value(overriderUuid ? *overriderUuid : std::string()));
-    overrider.insert_or_assign(std::string(form::kOverriding), Value(*identifier));
-    log::ops().info("plug-in %{public}@ overrides %{public}@",
-                    overriderUuid ? std::string_view(*overriderUuid) : "(null)",
-                    replacedUuid ? std::string_view(*replacedUuid) : "(null)");
+    Match& overrider = *it->second;
+    const std::string overriderUuid = overrider.plugIn->uuid().string();
+    replaced->added.insert_or_assign(std::string(form::kOverrider), Value(overriderUuid));
+    overrider.added.insert_or_assign(std::string(form::kOverriding), Value(*identifier));
+    log::ops().info("plug-in %{public}@ overrides %{public}@", overriderUuid,
+                    replaced->plugIn->uuid().string());
   }
 
   if (log::ops().enabled(log::Level::Info)) {
@@ -266,22 +271,35 @@ void Transaction::matchPlugIns() {
       log::ops().info("Resulting plugin count: 0");
     } else {
       Array uuids;
-      for (const FormRef& result : results) {
-        auto it = result->find(form::kUuid);
-        uuids.push_back(it == result->end() ? Value() : it->second);
-      }
+      for (const MatchRef& result : results) uuids.emplace_back(result->plugIn->uuid().string());
       log::ops().info("Resulting plugin count: %u, UUIDs: %{public}@", results.size(),
                       Value(std::move(uuids)));
     }
   }
-  Array matches;
-  matches.reserve(results.size());
-  for (const FormRef& result : results) matches.emplace_back(std::move(*result));
-  if (auto converted = EkDaemonClient::convertToWyre(Value(std::move(matches)), version())) {
-    reply_.insert_or_assign(std::string(protocol::kMatches), std::move(*converted));
-  }
   log::ops().debug("reply marshalled");
-  done();
+  if (!EkDaemonClient::convertsToWyre(version())) {
+    done();
+    return;
+  }
+  doneWithEncoded(protocol::kMatches, [&results](std::vector<uint8_t>& out) {
+    size_t bound = 0;
+    for (const MatchRef& result : results) {
+      bound += 1 + result->form->members.size();
+      for (const auto& [key, value] : result->added) {
+        bound += 9 + key.size() + cbor::encodedSizeBound(value);
+      }
+    }
+    out.reserve(out.size() + 9 + bound);
+    cbor::encodeArrayHead(results.size(), out);
+    for (const MatchRef& result : results) {
+      cbor::encodeMapHead(result->form->count + result->added.size(), out);
+      out.insert(out.end(), result->form->members.begin(), result->form->members.end());
+      for (const auto& [key, value] : result->added) {
+        cbor::encodeText(key, out);
+        cbor::encode(value, out);
+      }
+    }
+  });
 }
 
 }  // namespace ek

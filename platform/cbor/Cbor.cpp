@@ -604,6 +604,22 @@ std::vector<uint8_t> encode(const Value& value) {
   return out;
 }
 
+void encodeArrayHead(uint64_t count, std::vector<uint8_t>& out) {
+  put(out, [&](uint8_t* at, size_t size) { return cbor_encode_array_start(count, at, size); });
+}
+
+void encodeMapHead(uint64_t count, std::vector<uint8_t>& out) {
+  put(out, [&](uint8_t* at, size_t size) { return cbor_encode_map_start(count, at, size); });
+}
+
+void encodeText(std::string_view text, std::vector<uint8_t>& out) {
+  putText(out, text);
+}
+
+size_t encodedSizeBound(const Value& value) {
+  return sizeBound(value);
+}
+
 Result<Value> decode(std::span<const uint8_t> bytes) {
   if (bytes.empty()) return EkError::format("CBOR item is empty");
   return Decoder(bytes).run();

@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <span>
+#include <string_view>
 #include <vector>
 
 #include "platform/value/Result.h"
@@ -17,6 +18,15 @@ inline constexpr size_t kMaxDepth = 512;
 // one that is not UTF-8 will not decode.
 void encode(const Value& value, std::vector<uint8_t>& out);
 std::vector<uint8_t> encode(const Value& value);
+
+// Pieces for writing an array or a map whose members are encoded separately, e.g. members kept
+// encoded from an earlier message. The caller appends exactly count elements (count key and
+// value pairs for a map, each key written with encodeText).
+void encodeArrayHead(uint64_t count, std::vector<uint8_t>& out);
+void encodeMapHead(uint64_t count, std::vector<uint8_t>& out);
+void encodeText(std::string_view text, std::vector<uint8_t>& out);
+// At least as many bytes as encode appends for value.
+size_t encodedSizeBound(const Value& value);
 
 // Decodes exactly one CBOR data item spanning all of bytes into the value model. Refuses,
 // with a Format error, anything the value model cannot carry, a map key that is not text,

@@ -160,6 +160,35 @@ TEST(Cbor, EncodeAppendsToExistingBuffer) {
   EXPECT_EQ(toHex(out), "aa8101");
 }
 
+TEST(Cbor, PiecesWrittenOneByOneDecodeAsTheWholeValue) {
+  const Dictionary big = {{"a", Value("x")}, {"b", Value(Array{1, 2})}};
+  std::vector<uint8_t> out;
+  encodeArrayHead(30, out);
+  for (int i = 0; i < 30; ++i) {
+    // Members in an order of their own: a map's keys need not be sorted on the wire.
+    encodeMapHead(3, out);
+    encodeText("z", out);
+    encode(Value(i), out);
+    for (const auto& [key, value] : big) {
+      encodeText(key, out);
+      encode(value, out);
+    }
+  }
+  Array expected;
+  for (int i = 0; i < 30; ++i) {
+    Dictionary member = big;
+    member["z"] = Value(i);
+    expected.emplace_back(std::move(member));
+  }
+  auto decoded = decode(out);
+  ASSERT_TRUE(decoded.ok()) << decoded.error().message;
+  EXPECT_EQ(*decoded, Value(expected));
+  // Shortest heads, as the whole value's encoding writes them: 30 elements take two bytes.
+  EXPECT_EQ(toHex(std::vector<uint8_t>(out.begin(), out.begin() + 3)), "981ea3");
+  EXPECT_EQ(out.size(), encode(Value(expected)).size());
+  EXPECT_GE(encodedSizeBound(Value(expected)), out.size());
+}
+
 struct Decodable {
   const char* name;
   const char* hex;

@@ -17,6 +17,7 @@
 #include <cstring>
 #include <future>
 #include <mutex>
+#include <stdexcept>
 #include <thread>
 
 #include "platform/cbor/Cbor.h"
@@ -423,6 +424,14 @@ void Connection::reply(const Message& request, const Value& reply) {
   if (!request.wantsReply()) return;
   std::vector<uint8_t> frame;
   appendFrame(frame, reply, kFlagReply, request.id);
+  enqueueOutput(std::move(frame), true);
+}
+
+void Connection::replyEncoded(const Message& request, std::vector<uint8_t> frame) {
+  if (!request.wantsReply()) return;
+  if (frame.size() < kHeaderSize) throw std::logic_error("reply frame without its header");
+  encodeHeader({static_cast<uint32_t>(frame.size() - kHeaderSize), kFlagReply, request.id},
+               frame.data());
   enqueueOutput(std::move(frame), true);
 }
 

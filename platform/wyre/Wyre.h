@@ -108,6 +108,9 @@ class Connection : public std::enable_shared_from_this<Connection> {
   // Answers a request received on this connection. A request that wanted no reply, or a
   // connection that has ended, makes this a no-op.
   void reply(const Message& request, const Value& reply);
+  // The same with the reply already encoded: frame holds kHeaderSize bytes of room for the
+  // header, then the reply's CBOR.
+  void replyEncoded(const Message& request, std::vector<uint8_t> frame);
   // The receiver will never answer this request: frees its place among the unanswered.
   void dropRequest(const Message& request);
 

@@ -7,6 +7,8 @@
 #include <filesystem>
 #include <future>
 
+#include "platform/cbor/Cbor.h"
+
 namespace ek::wyre {
 namespace {
 
@@ -63,7 +65,14 @@ class WyreLoopback : public ::testing::Test {
           ++*invalidated;
           return;
         }
-        if (self && e.type == EventType::Message) self->reply(e.message, e.message.body);
+        if (!self || e.type != EventType::Message) return;
+        if (e.message.body.get("encoded")) {
+          std::vector<uint8_t> frame(kHeaderSize);
+          cbor::encode(e.message.body, frame);
+          self->replyEncoded(e.message, std::move(frame));
+        } else {
+          self->reply(e.message, e.message.body);
+        }
       });
       connection->resume();
     });
@@ -95,6 +104,26 @@ TEST_F(WyreLoopback, RepliesReachTheirHandlersInOrder) {
     EXPECT_EQ(replies[i].get_future().get(), Value(Dictionary{{"n", i}}));
   }
   EXPECT_EQ(c->auditToken().pid, getpid());
+}
+
+TEST_F(WyreLoopback, RepliesEncodedByTheirSenderArriveAsOthersDo) {
+  auto connection = Connection::connect("echo");
+  ASSERT_TRUE(connection.ok()) << connection.error().message;
+  auto c = connection.value();
+  c->resume();
+  std::vector<std::promise<Value>> replies(20);
+  for (int i = 0; i < 20; ++i) {
+    Dictionary body{{"n", i}};
+    if (i % 2 == 0) body["encoded"] = Value(std::string(i * 1000, 'e'));
+    c->sendWithReply(Value(std::move(body)), [&replies, i](Result<Value> reply) {
+      replies[i].set_value(reply.ok() ? reply.value() : Value("error"));
+    });
+  }
+  for (int i = 0; i < 20; ++i) {
+    Value reply = replies[i].get_future().get();
+    EXPECT_EQ(reply.getUnsigned("n") ? *reply.getUnsigned("n") : 99u, static_cast<uint64_t>(i));
+    EXPECT_EQ(reply.get("encoded") != nullptr, i % 2 == 0);
+  }
 }
 
 TEST_F(WyreLoopback, PendingRepliesReceiveConnectionInvalidWhenTheConnectionEnds) {

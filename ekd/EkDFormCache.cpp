@@ -1,0 +1,87 @@
+#include "ekd/EkDFormCache.h"
+
+#include <algorithm>
+
+#include "Ekora/EkPlugInKeys.h"
+#include "platform/cbor/Cbor.h"
+
+namespace ek {
+
+const std::vector<std::string_view>& EkDFormCache::perRequestKeys() {
+  namespace form = plugin::form;
+  static const std::vector<std::string_view> keys = {form::kAnnotations, form::kExtensions,
+                                                     form::kServiceExtension, form::kOverrider,
+                                                     form::kOverriding};
+  return keys;
+}
+
+std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::encode(const EkDPlugIn& plugIn) {
+  EkPlugInCore::FormExport exported = plugIn.exportForm();
+  for (std::string_view key : perRequestKeys()) {
+    auto it = exported.form.find(key);
+    if (it != exported.form.end()) exported.form.erase(it);
+  }
+  auto encoded = std::make_shared<EncodedForm>();
+  size_t bound = 0;
+  for (const auto& [key, value] : exported.form) {
+    bound += key.size() + 9 + cbor::encodedSizeBound(value);
+  }
+  encoded->members.reserve(bound);
+  for (const auto& [key, value] : exported.form) {
+    cbor::encodeText(key, encoded->members);
+    cbor::encode(value, encoded->members);
+  }
+  encoded->members.shrink_to_fit();
+  encoded->count = exported.form.size();
+  encoded->error = std::move(exported.error);
+  return encoded;
+}
+
+std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::formFor(
+    const std::shared_ptr<const EkDPlugIn>& plugIn) {
+  // Read before the lock: a changed registry makes the record fetch its info again.
+  DictionaryRef info = plugIn->bundleInfoDictionary();
+  const Uuid uuid = plugIn->uuid();
+  {
+    std::lock_guard lock(mutex_);
+    auto it = slots_.find(uuid);
+    if (it != slots_.end()) {
+      Slot& slot = it->second;
+      if (slot.info == info && slot.record.lock() == plugIn) {
+        recent_.splice(recent_.begin(), recent_, slot.recent);
+        return slot.form;
+      }
+      dropLocked(it);
+    }
+  }
+
+  std::shared_ptr<const EncodedForm> form = encode(*plugIn);
+  const size_t size = form->members.capacity();
+  if (size > limit_) return form;
+  std::lock_guard lock(mutex_);
+  // Another thread may have kept one meanwhile; the newer one replaces it.
+  if (auto it = slots_.find(uuid); it != slots_.end()) dropLocked(it);
+  while (bytes_ + size > limit_ && !recent_.empty()) dropLocked(slots_.find(recent_.back()));
+  recent_.push_front(uuid);
+  slots_.emplace(uuid, Slot{plugIn, std::move(info), form, recent_.begin()});
+  bytes_ += size;
+  return form;
+}
+
+void EkDFormCache::dropLocked(std::unordered_map<Uuid, Slot>::iterator slot) {
+  bytes_ -= slot->second.form->members.capacity();
+  recent_.erase(slot->second.recent);
+  slots_.erase(slot);
+}
+
+size_t EkDFormCache::bytes() const {
+  std::lock_guard lock(mutex_);
+  return bytes_;
+}
+
+size_t EkDFormCache::count() const {
+  std::lock_guard lock(mutex_);
+  return slots_.size();
+}
+
+}  // namespace ek

@@ -1,0 +1,69 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <list>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <unordered_map>
+#include <vector>
+
+#include "ekd/EkDPlugIn.h"
+#include "platform/value/EkError.h"
+#include "platform/value/Uuid.h"
+
+namespace ek {
+
+// Plug-in forms kept encoded between replies. A reply carrying hundreds of forms would otherwise
+// build each form's dictionaries, encode them and free them again, for every request; with the
+// encoding kept, it copies bytes.
+//
+// What is kept is the part of a form that follows from the record alone: everything exportForm
+// writes except the keys a reply adds per request (perRequestKeys). A kept form is used again
+// while the record is the same object and reads the same info dictionary, which it replaces
+// whenever the registry changes.
+//
+// At most byteLimit bytes of forms are kept; the least recently used go first. Thread-safe.
+class EkDFormCache {
+ public:
+  struct EncodedForm {
+    // CBOR of count key and value pairs, without a map head.
+    std::vector<uint8_t> members;
+    size_t count = 0;
+    // exportForm's error for a form missing some of its base keys.
+    std::optional<EkError> error;
+  };
+
+  // The keys a reply sets per request and which are therefore never kept: the annotations
+  // (read from the annotation store each time), the extension tokens, the replacement marks.
+  static const std::vector<std::string_view>& perRequestKeys();
+
+  explicit EkDFormCache(size_t byteLimit) : limit_(byteLimit) {}
+
+  // The encoded form of plugIn, kept or made now.
+  std::shared_ptr<const EncodedForm> formFor(const std::shared_ptr<const EkDPlugIn>& plugIn);
+
+  // Bytes of encoded forms kept, and how many forms.
+  size_t bytes() const;
+  size_t count() const;
+
+ private:
+  struct Slot {
+    std::weak_ptr<const EkDPlugIn> record;
+    DictionaryRef info;
+    std::shared_ptr<const EncodedForm> form;
+    std::list<Uuid>::iterator recent;
+  };
+
+  static std::shared_ptr<const EncodedForm> encode(const EkDPlugIn& plugIn);
+  void dropLocked(std::unordered_map<Uuid, Slot>::iterator slot);
+
+  const size_t limit_;
+  mutable std::mutex mutex_;
+  std::unordered_map<Uuid, Slot> slots_;
+  std::list<Uuid> recent_;  // most recently used first
+  size_t bytes_ = 0;
+};
+
+}  // namespace ek
