@@ -1,6 +1,7 @@
 #include "ekd/EkDFormCache.h"
 
 #include <algorithm>
+#include <iterator>
 
 #include "Ekora/EkPlugInKeys.h"
 #include "platform/cbor/Cbor.h"
@@ -47,7 +48,7 @@ std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::formFor(
     auto it = slots_.find(uuid);
     if (it != slots_.end()) {
       Slot& slot = it->second;
-      if (slot.info == info && slot.record.lock() == plugIn) {
+      if (!slot.info.expired() && slot.info.lock() == info && slot.record.lock() == plugIn) {
         recent_.splice(recent_.begin(), recent_, slot.recent);
         return slot.form;
       }
@@ -61,6 +62,11 @@ std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::formFor(
   std::lock_guard lock(mutex_);
   // Another thread may have kept one meanwhile; the newer one replaces it.
   if (auto it = slots_.find(uuid); it != slots_.end()) dropLocked(it);
+  // Now and then, rather than on every insert: a sweep visits every slot.
+  if (++insertsSinceSweep_ >= 256) {
+    insertsSinceSweep_ = 0;
+    dropExpiredLocked();
+  }
   while (bytes_ + size > limit_ && !recent_.empty()) dropLocked(slots_.find(recent_.back()));
   recent_.push_front(uuid);
   slots_.emplace(uuid, Slot{plugIn, std::move(info), form, recent_.begin()});
@@ -72,6 +78,14 @@ void EkDFormCache::dropLocked(std::unordered_map<Uuid, Slot>::iterator slot) {
   bytes_ -= slot->second.form->members.capacity();
   recent_.erase(slot->second.recent);
   slots_.erase(slot);
+}
+
+void EkDFormCache::dropExpiredLocked() {
+  for (auto it = slots_.begin(); it != slots_.end();) {
+    auto next = std::next(it);
+    if (it->second.record.expired() || it->second.info.expired()) dropLocked(it);
+    it = next;
+  }
 }
 
 size_t EkDFormCache::bytes() const {

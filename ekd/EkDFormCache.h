@@ -50,20 +50,24 @@ class EkDFormCache {
 
  private:
   struct Slot {
+    // Both weak: a kept form holds neither a record nor an info dictionary in memory.
     std::weak_ptr<const EkDPlugIn> record;
-    DictionaryRef info;
+    std::weak_ptr<const Dictionary> info;
     std::shared_ptr<const EncodedForm> form;
     std::list<Uuid>::iterator recent;
   };
 
   static std::shared_ptr<const EncodedForm> encode(const EkDPlugIn& plugIn);
   void dropLocked(std::unordered_map<Uuid, Slot>::iterator slot);
+  // Drops the forms of records that are gone (uninstalled, or rebuilt).
+  void dropExpiredLocked();
 
   const size_t limit_;
   mutable std::mutex mutex_;
   std::unordered_map<Uuid, Slot> slots_;
   std::list<Uuid> recent_;  // most recently used first
   size_t bytes_ = 0;
+  size_t insertsSinceSweep_ = 0;
 };
 
 }  // namespace ek
