@@ -849,5 +849,27 @@ TEST_F(EkDPlugInTest, FormsBeyondTheLimitAreDroppedLeastRecentlyUsedFirst) {
   EXPECT_EQ(tiny.bytes(), 0u);
 }
 
+TEST_F(EkDPlugInTest, FormsOfRecordsThatAreGoneAreDropped) {
+  auto spellWithOwnUuid = [&] {
+    vantor::PlugInProxy proxy = spellProxy();
+    proxy.uuid = Uuid::random();
+    return build(proxy);
+  };
+  EkDFormCache cache(64 << 20);
+  {
+    auto gone = spellWithOwnUuid();
+    ASSERT_NE(gone, nullptr);
+    cache.formFor(gone);
+  }
+  // Gone records are swept now and then, not on every insert: by the 256th at the latest.
+  std::vector<std::shared_ptr<EkDPlugIn>> live;
+  for (int i = 0; i < 256; ++i) {
+    live.push_back(spellWithOwnUuid());
+    ASSERT_NE(live.back(), nullptr);
+    cache.formFor(live.back());
+  }
+  EXPECT_EQ(cache.count(), 256u);
+}
+
 }  // namespace
 }  // namespace ek
