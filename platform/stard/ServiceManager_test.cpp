@@ -272,21 +272,29 @@ TEST_F(FileServiceManagerTest, RemovalWithNothingRunningAnswersNoSuchProcess) {
 }
 
 TEST_F(FileServiceManagerTest, AnswerIsNeverGivenOnTheCallersStack) {
-  bool answeredInline = false;
-  bool returned = false;
-  std::promise<void> done;
-  std::mutex mutex;
+  // Shared, so that the answering thread may still be unlocking after the test has returned.
+  struct State {
+    std::mutex mutex;
+    bool answeredInline = false;
+    bool returned = false;
+    std::promise<void> done;
+  };
+  auto state = std::make_shared<State>();
+  auto answered = state->done.get_future();
   {
-    std::lock_guard lock(mutex);
-    manager_->removeExternalService("com.example.idle", "1", queue_, [&](int) {
-      std::lock_guard inner(mutex);
-      answeredInline = !returned;
-      done.set_value();
+    std::lock_guard lock(state->mutex);
+    manager_->removeExternalService("com.example.idle", "1", queue_, [state](int) {
+      {
+        std::lock_guard inner(state->mutex);
+        state->answeredInline = !state->returned;
+      }
+      state->done.set_value();
     });
-    returned = true;
+    state->returned = true;
   }
-  ASSERT_EQ(done.get_future().wait_for(kPatience), std::future_status::ready);
-  EXPECT_FALSE(answeredInline);
+  ASSERT_EQ(answered.wait_for(kPatience), std::future_status::ready);
+  std::lock_guard lock(state->mutex);
+  EXPECT_FALSE(state->answeredInline);
 }
 
 TEST_F(FileServiceManagerTest, OverlayEnvironmentReachesTheChild) {
