@@ -423,15 +423,24 @@ bool EkPlugInCore::isHybrid() const {
 }
 
 bool EkPlugInCore::isDedicated() const {
-  ValueRef value = pluginKey(pk::kDedicated);
-  if (!value) return false;
+  return isDedicatedValue(pluginKey(pk::kDedicated).get());
+}
+
+bool EkPlugInCore::isData() const {
+  // The default protocol of an application extension is not "#Data": the declared one decides.
+  return isDataProtocol(pluginKey(pk::kProtocol).get());
+}
+
+bool EkPlugInCore::isDedicatedValue(const Value* value) {
+  if (value == nullptr) return false;
   if (const bool* flag = value->boolean()) return *flag;
   if (std::optional<double> number = value->numericValue()) return *number != 0;
   return false;
 }
 
-bool EkPlugInCore::isData() const {
-  return isString(protocolSpec(), pk::kDataProtocol);
+bool EkPlugInCore::isDataProtocol(const Value* protocol) {
+  const std::string* text = protocol ? protocol->string() : nullptr;
+  return text != nullptr && *text == pk::kDataProtocol;
 }
 
 // ---- Lookups --------------------------------------------------------------------------------

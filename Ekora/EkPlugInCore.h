@@ -147,6 +147,9 @@ class EkPlugInCore {
   bool isDedicated() const;
   // The protocol is "#Data": a plug-in without code.
   bool isData() const;
+  // What isDedicated and isData make of the values they read, for records that keep the facts.
+  static bool isDedicatedValue(const Value* dedicated);
+  static bool isDataProtocol(const Value* protocol);
 
   // Lookups: the bundle info's value, the plug-in dictionary's value, the attributes' value.
   virtual ValueRef infoKey(std::string_view key) const;

@@ -30,6 +30,7 @@ inline constexpr std::string_view kMultiple = "Multiple";
 inline constexpr std::string_view kHubProtocolVersion = "HubProtocolVersion";
 inline constexpr std::string_view kShared = "Shared";
 inline constexpr std::string_view kCleanTimeout = "CleanTimeout";
+inline constexpr std::string_view kHostEntitlement = "ZuExtensionHostEntitlement";
 
 // Inside the attributes ("ZuExtensionAttributes").
 inline constexpr std::string_view kVersion = "ZuExtensionVersion";

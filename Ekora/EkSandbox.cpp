@@ -61,15 +61,19 @@ bool randomNonce(std::array<uint8_t, sandbox::kNonceSize>& nonce) {
   return true;
 }
 
-std::string toHex(std::string_view bytes) {
+void appendHex(std::string& out, std::string_view bytes) {
   static constexpr char kDigits[] = "0123456789abcdef";
-  std::string hex;
-  hex.reserve(bytes.size() * 2);
+  const size_t start = out.size();
+  out.resize(start + bytes.size() * 2);
+  char* hex = out.data() + start;
   for (unsigned char byte : bytes) {
-    hex.push_back(kDigits[byte >> 4]);
-    hex.push_back(kDigits[byte & 0xf]);
+    *hex++ = kDigits[byte >> 4];
+    *hex++ = kDigits[byte & 0xf];
   }
-  return hex;
+}
+
+std::string_view asText(const uint8_t* bytes, size_t size) {
+  return std::string_view(reinterpret_cast<const char*>(bytes), size);
 }
 
 int hexDigit(char c) {
@@ -117,12 +121,15 @@ std::optional<uint32_t> parseFlags(std::string_view text) {
 
 // A MAC context keyed once per thread and key: the one-shot HMAC() looks up the algorithm and
 // sets the key up again for every tag, which dominated issuing the hundreds of tokens of one
-// match reply. Each tag works on a copy of the keyed context.
+// match reply. Each tag starts the keyed context afresh, keeping the key's prepared state.
 class KeyedMac {
  public:
   ~KeyedMac() { reset(); }
+  // The context ready for a new tag under key, or nullptr.
   EVP_MAC_CTX* contextFor(const EkSandboxKey& key) {
-    if (keyed_ && key_ == key) return keyed_;
+    if (keyed_ && key_ == key) {
+      if (EVP_MAC_init(keyed_, nullptr, 0, nullptr) == 1) return keyed_;
+    }
     reset();
     mac_ = EVP_MAC_fetch(nullptr, "HMAC", nullptr);
     if (mac_ == nullptr) return nullptr;
@@ -154,16 +161,13 @@ class KeyedMac {
 std::optional<std::array<uint8_t, sandbox::kTagSize>> computeTag(const EkSandboxKey& key,
                                                                  std::string_view message) {
   thread_local KeyedMac keyed;
-  EVP_MAC_CTX* base = keyed.contextFor(key);
-  if (base == nullptr) return std::nullopt;
-  EVP_MAC_CTX* context = EVP_MAC_CTX_dup(base);
+  EVP_MAC_CTX* context = keyed.contextFor(key);
   if (context == nullptr) return std::nullopt;
   std::array<uint8_t, sandbox::kTagSize> tag;
   size_t length = 0;
   bool ok = EVP_MAC_update(context, reinterpret_cast<const unsigned char*>(message.data()),
                            message.size()) == 1 &&
             EVP_MAC_final(context, tag.data(), &length, tag.size()) == 1 && length == tag.size();
-  EVP_MAC_CTX_free(context);
   if (!ok) return std::nullopt;
   return tag;
 }
@@ -249,13 +253,18 @@ Result<std::string> EkSandbox::issue(std::string_view extensionClass, uint32_t f
   if (!randomNonce(nonce)) {
     return EkError::posix(EIO, "no random bytes for an extension nonce");
   }
-  std::string token = fmt::format(
-      "{}{}{}{}{}{}{}", extensionClass, kSeparator, flags, kSeparator, toHex(subject), kSeparator,
-      toHex(std::string_view(reinterpret_cast<const char*>(nonce.data()), nonce.size())));
+  std::string token;
+  token.reserve(extensionClass.size() + 16 +
+                2 * (subject.size() + nonce.size() + sandbox::kTagSize));
+  fmt::format_to(std::back_inserter(token), "{}{}{}{}", extensionClass, kSeparator, flags,
+                 kSeparator);
+  appendHex(token, subject);
+  token.push_back(kSeparator);
+  appendHex(token, asText(nonce.data(), nonce.size()));
   const auto tag = computeTag(*key, token);
   if (!tag) return EkError::posix(EIO, "cannot compute an extension tag");
   token.push_back(kSeparator);
-  token += toHex(std::string_view(reinterpret_cast<const char*>(tag->data()), tag->size()));
+  appendHex(token, asText(tag->data(), tag->size()));
   return token;
 }
 

@@ -41,19 +41,26 @@ constexpr std::string_view kLogResourceExtensionFailed =
 constexpr std::string_view kLogServiceExtensionFailed =
     "failed to make service extension for %@ in plug-in at %@: %{public}s";
 
-// The member under key, sharing ownership of the whole dictionary.
-ValueRef member(const DictionaryRef& dictionary, std::string_view key) {
-  if (!dictionary) return nullptr;
+const Value* valueIn(const Dictionary* dictionary, std::string_view key) {
+  if (dictionary == nullptr) return nullptr;
   auto it = dictionary->find(key);
-  if (it == dictionary->end()) return nullptr;
-  return ValueRef(dictionary, &it->second);
+  return it == dictionary->end() ? nullptr : &it->second;
 }
 
-// The member under key when it is a dictionary, sharing ownership of the whole.
-DictionaryRef dictionaryMember(const DictionaryRef& dictionary, std::string_view key) {
-  ValueRef value = member(dictionary, key);
-  if (!value || value->dictionary() == nullptr) return nullptr;
-  return DictionaryRef(value, value->dictionary());
+const Dictionary* dictionaryIn(const Dictionary* dictionary, std::string_view key) {
+  const Value* value = valueIn(dictionary, key);
+  return value ? value->dictionary() : nullptr;
+}
+
+// A value inside what owner holds, sharing ownership of owner.
+template <typename Owner, typename T>
+std::shared_ptr<const T> sharing(const std::shared_ptr<Owner>& owner, const T* inside) {
+  if (inside == nullptr) return nullptr;
+  return std::shared_ptr<const T>(owner, inside);
+}
+
+ValueRef member(const DictionaryRef& dictionary, std::string_view key) {
+  return sharing(dictionary, valueIn(dictionary.get(), key));
 }
 
 std::string logText(const Value* value) {
@@ -156,7 +163,7 @@ bool EkDPlugIn::initWithVRData(const vantor::PlugInProxy& proxy) {
   // One copy of the info dictionary: the plug-in dictionary is its "ZuExtension", shared.
   auto info = std::make_shared<const Dictionary>(proxy.info);
   if (!initWithName(std::move(identifier), url, nullptr, nullptr, proxy.uuid)) return false;
-  if (DictionaryRef plugIn = dictionaryMember(info, pk::kInfoPlugInDictionary)) {
+  if (DictionaryRef plugIn = sharing(info, dictionaryIn(info.get(), pk::kInfoPlugInDictionary))) {
     setPlugInDictionary(std::move(plugIn));
   }
 
@@ -173,8 +180,9 @@ bool EkDPlugIn::initWithVRData(const vantor::PlugInProxy& proxy) {
   setDataContainerURL(urlOfPath(proxy.dataContainerPath));
   {
     // Current until the registry's knowledge changes, when the proxy says when it was read.
+    CurrentInfoRef current = makeCurrentInfo(std::move(info));
     std::lock_guard lock(infoMutex_);
-    storeInfoLocked(std::move(info));
+    current_ = std::move(current);
     vrKnowledgeUUID_ = proxy.knowledge;
   }
 
@@ -213,13 +221,32 @@ vantor::PlugInProxyPtr EkDPlugIn::getProxy() const {
   return context_.registry->plugInByUrl(location->string());
 }
 
-void EkDPlugIn::storeInfoLocked(DictionaryRef info) const {
-  current_.plugIn = dictionaryMember(info, pk::kInfoPlugInDictionary);
-  current_.attributes = dictionaryMember(current_.plugIn, pk::kAttributes);
-  current_.info = std::move(info);
+const Value* EkDPlugIn::CurrentInfo::plugInValue(std::string_view key) const {
+  return valueIn(plugIn, key);
 }
 
-EkDPlugIn::CurrentInfo EkDPlugIn::currentInfo() const {
+const Value* EkDPlugIn::CurrentInfo::attribute(std::string_view key) const {
+  return valueIn(attributes, key);
+}
+
+EkDPlugIn::CurrentInfoRef EkDPlugIn::makeCurrentInfo(DictionaryRef info) const {
+  auto current = std::make_shared<CurrentInfo>();
+  current->appExtension = isAppExtension();
+  if (info) {
+    current->plugIn = dictionaryIn(info.get(), pk::kInfoPlugInDictionary);
+    current->attributes = dictionaryIn(current->plugIn, pk::kAttributes);
+    current->dedicated = isDedicatedValue(current->plugInValue(pk::kDedicated));
+    current->data = isDataProtocol(current->plugInValue(pk::kProtocol));
+    current->version = current->attribute(pk::kVersion);
+    current->bundleIdentifier = valueIn(info.get(), pk::kInfoBundleIdentifier);
+    current->shared = current->plugInValue(pk::kShared);
+    current->hostEntitlement = current->plugInValue(pk::kHostEntitlement);
+  }
+  current->info = std::move(info);
+  return current;
+}
+
+EkDPlugIn::CurrentInfoRef EkDPlugIn::currentInfo() const {
   const Uuid knowledge = context_.registry->knowledgeUuid();
   {
     std::lock_guard lock(infoMutex_);
@@ -233,19 +260,20 @@ EkDPlugIn::CurrentInfo EkDPlugIn::currentInfo() const {
   } else {
     log::ops().error(kLogNoFreshProxy, uuid());
   }
+  CurrentInfoRef current = makeCurrentInfo(std::move(info));
   std::lock_guard lock(infoMutex_);
-  storeInfoLocked(std::move(info));
+  current_ = std::move(current);
   vrKnowledgeUUID_ = knowledge;
   return current_;
 }
 
 DictionaryRef EkDPlugIn::bundleInfoDictionary() const {
-  return currentInfo().info;
+  return currentInfo()->info;
 }
 
 DictionaryRef EkDPlugIn::infoDmap() const {
   std::lock_guard lock(infoMutex_);
-  return current_.info;
+  return current_ ? current_->info : nullptr;
 }
 
 std::optional<Uuid> EkDPlugIn::vrKnowledgeUUID() const {
@@ -253,18 +281,25 @@ std::optional<Uuid> EkDPlugIn::vrKnowledgeUUID() const {
   return vrKnowledgeUUID_;
 }
 
-ValueRef EkDPlugIn::infoKey(std::string_view key) const {
-  ValueRef value = member(bundleInfoDictionary(), key);
-  log::vr().debug(pk::kLogInfoKey, "infoKey", key, logText(value.get()));
+const Value* EkDPlugIn::infoValue(const CurrentInfo& current, std::string_view key) const {
+  const Value* value = valueIn(current.info.get(), key);
+  log::vr().debug(pk::kLogInfoKey, "infoKey", key, logText(value));
   return value;
 }
 
+ValueRef EkDPlugIn::infoKey(std::string_view key) const {
+  CurrentInfoRef current = currentInfo();
+  return sharing(current, infoValue(*current, key));
+}
+
 ValueRef EkDPlugIn::pluginKey(std::string_view key) const {
-  return member(currentInfo().plugIn, key);
+  CurrentInfoRef current = currentInfo();
+  return sharing(current, current->plugInValue(key));
 }
 
 ValueRef EkDPlugIn::attribute(std::string_view key) const {
-  return member(currentInfo().attributes, key);
+  CurrentInfoRef current = currentInfo();
+  return sharing(current, current->attribute(key));
 }
 
 std::optional<Dictionary> EkDPlugIn::readSDKDictionary(std::string_view extensionPoint) const {
@@ -313,28 +348,30 @@ EkSandbox& EkDPlugIn::sandbox() const {
 }
 
 void EkDPlugIn::augmentForm(Dictionary& form) const {
-  std::optional<Value> shared;
-  if (isAppExtension()) {
-    // An application extension's host reads the whole bundle, nothing beside it.
-    shared = Array{Value(kBundleItself)};
-  } else if (ValueRef declared = pluginKey(pk::kShared)) {
-    shared = *declared;
-  }
+  augmentForm(form, *currentInfo());
+}
+
+void EkDPlugIn::augmentForm(Dictionary& form, const CurrentInfo& current) const {
+  static const Value kWholeBundle(Array{Value(kBundleItself)});
+  // An application extension's host reads the whole bundle, nothing beside it.
+  const Value* shared = current.appExtension ? &kWholeBundle : current.shared;
   if (shared) {
     if (std::optional<Dictionary> extensions = issueResourceExtensions(*shared)) {
       form.insert_or_assign(std::string(pk::form::kExtensions), std::move(*extensions));
     }
   }
 
-  if (isData()) return;
-  ValueRef bundleIdentifier = infoKey(pk::kInfoBundleIdentifier);
-  const std::string* service = bundleIdentifier ? bundleIdentifier->string() : nullptr;
+  if (current.data) return;
+  log::vr().debug(pk::kLogInfoKey, "infoKey", pk::kInfoBundleIdentifier,
+                  logText(current.bundleIdentifier));
+  const std::string* service =
+      current.bundleIdentifier ? current.bundleIdentifier->string() : nullptr;
   Result<std::string> token =
       issueServiceExtension(service ? std::string_view(*service) : std::string_view(), sandbox());
   if (token) {
     form.insert_or_assign(std::string(pk::form::kServiceExtension), std::move(token).value());
   } else {
-    log::ops().info(kLogServiceExtensionFailed, logText(bundleIdentifier.get()),
+    log::ops().info(kLogServiceExtensionFailed, logText(current.bundleIdentifier),
                     path().value_or("(null)"), systemErrorText(token.error()));
   }
 }

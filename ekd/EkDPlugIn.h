@@ -76,6 +76,31 @@ class EkDPlugIn : public EkPlugInCore {
   // A fresh proxy for this plug-in: by UUID, else (logged in "vr") by bundle URL.
   vantor::PlugInProxyPtr getProxy() const;
 
+  // The registry's info dictionary and what discovery reads of it, found once per fetch.
+  // Checking a plug-in for a host evaluates it against one of these, so that the answers of
+  // one request agree with each other even when the registry changes meanwhile; the
+  // pointers point into info.
+  struct CurrentInfo {
+    DictionaryRef info;
+    // "ZuExtension" of info, and that one's "ZuExtensionAttributes", when dictionaries.
+    const Dictionary* plugIn = nullptr;
+    const Dictionary* attributes = nullptr;
+    bool appExtension = false;                // isAppExtension
+    bool dedicated = false;                   // isDedicated
+    bool data = false;                        // isData
+    const Value* version = nullptr;           // attribute "ZuExtensionVersion"
+    const Value* bundleIdentifier = nullptr;  // infoKey "QvBundleIdentifier"
+    const Value* shared = nullptr;            // pluginKey "Shared"
+    const Value* hostEntitlement = nullptr;   // pluginKey "ZuExtensionHostEntitlement"
+
+    const Value* plugInValue(std::string_view key) const;
+    const Value* attribute(std::string_view key) const;
+  };
+  using CurrentInfoRef = std::shared_ptr<const CurrentInfo>;
+  // The current info, fetched again when the registry's knowledge UUID has changed. Never
+  // null; its info is absent after a failed fetch.
+  CurrentInfoRef currentInfo() const;
+
   // The registry's info dictionary for this plug-in, fetched again when the registry's
   // knowledge UUID differs from the one of the last fetch. Absent after a failed fetch until
   // the registry changes again.
@@ -102,7 +127,9 @@ class EkDPlugIn : public EkPlugInCore {
   // Attribute matching. Never fails: anything that cannot be interpreted does not match.
   // Every key/pattern pair of rules must match; absent or empty rules match every plug-in.
   bool match(const Dictionary* rules) const;
+  bool match(const Dictionary* rules, const CurrentInfo& current) const;
   bool matchKey(std::string_view key, const Value& pattern) const;
+  bool matchKey(std::string_view key, const Value& pattern, const CurrentInfo& current) const;
   // A string pattern, or an array whose string elements are tried in turn.
   bool matchValue(std::string_view value, const Value& patterns) const;
   // One pattern string, with its leading operator ("?TY-CONFORMS:", "?TY-IS:", "<>", "<=",
@@ -113,6 +140,8 @@ class EkDPlugIn : public EkPlugInCore {
 
   // Host permission: nothing when the host may use this plug-in, else the reason.
   std::optional<std::string> allowForClient(const EkDWyreClient& client) const;
+  std::optional<std::string> allowForClient(const EkDWyreClient& client,
+                                            const CurrentInfo& current) const;
 
   // Declares the plug-in's executable to the service manager as an external service of the
   // host, with its environment (the host's environment, then the data container's HOME,
@@ -139,6 +168,7 @@ class EkDPlugIn : public EkPlugInCore {
   // "service-extension" (the right to look up its service). Failures are logged and leave
   // their entry out.
   void augmentForm(Dictionary& form) const;
+  void augmentForm(Dictionary& form, const CurrentInfo& current) const;
   // Read-only file extensions for bundle-relative paths (a string, or an array whose strings
   // are paths; "." is the bundle itself): path to token. A path that fails, or that resolves
   // outside the bundle, is logged and left out. Absent only when paths is neither a string
@@ -157,16 +187,9 @@ class EkDPlugIn : public EkPlugInCore {
 
   bool initWithVRData(const vantor::PlugInProxy& proxy);
   EkSandbox& sandbox() const;
-  // The current info dictionary with its "ZuExtension" dictionary and that one's
-  // "ZuExtensionAttributes", found once per fetch: every lookup of a match reads them.
-  struct CurrentInfo {
-    DictionaryRef info;
-    DictionaryRef plugIn;
-    DictionaryRef attributes;
-  };
-  // Fetches the info dictionary again when the registry's knowledge UUID has changed.
-  CurrentInfo currentInfo() const;
-  void storeInfoLocked(DictionaryRef info) const;
+  CurrentInfoRef makeCurrentInfo(DictionaryRef info) const;
+  // infoKey without sharing ownership, for lookups against one CurrentInfo.
+  const Value* infoValue(const CurrentInfo& current, std::string_view key) const;
 
   const EkDPlugInContext context_;
 
@@ -174,7 +197,7 @@ class EkDPlugIn : public EkPlugInCore {
   // registry lookup.
   mutable std::mutex refreshMutex_;
   mutable std::mutex infoMutex_;
-  mutable CurrentInfo current_;
+  mutable CurrentInfoRef current_;
   mutable std::optional<Uuid> vrKnowledgeUUID_;
 };
 

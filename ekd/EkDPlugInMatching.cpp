@@ -22,7 +22,6 @@ constexpr std::string_view kKeyIdentifier = "ZuExtensionIdentifier";
 constexpr std::string_view kKeyUuid = "com.corvane.uuid";
 constexpr std::string_view kKeyElection = "ZuUserElection";
 constexpr std::string_view kKeyContainingApp = "ZuExtensionContainingApp";
-constexpr std::string_view kKeyHostEntitlement = "ZuExtensionHostEntitlement";
 constexpr std::string_view kAnnotationElection = "election";
 // Bits 8 to 15 of a stored election are not part of the choice the user made.
 constexpr int64_t kElectionFlagBits = 0xFF00;
@@ -207,23 +206,37 @@ bool matchAny(const types::TypeSystem& types, StringSet& values, std::string_vie
 
 bool EkDPlugIn::match(const Dictionary* rules) const {
   if (rules == nullptr) return true;
+  return match(rules, *currentInfo());
+}
+
+bool EkDPlugIn::match(const Dictionary* rules, const CurrentInfo& current) const {
+  if (rules == nullptr) return true;
   for (const auto& [key, pattern] : *rules) {
-    if (!matchKey(key, pattern)) return false;
+    if (!matchKey(key, pattern, current)) return false;
   }
   return true;
 }
 
 bool EkDPlugIn::matchKey(std::string_view key, const Value& pattern) const {
-  ValueRef value;
+  return matchKey(key, pattern, *currentInfo());
+}
+
+bool EkDPlugIn::matchKey(std::string_view key, const Value& pattern,
+                         const CurrentInfo& current) const {
+  // Values made for the special keys live here, the rest stay where they are.
+  std::optional<Value> made;
+  ValueRef entitlement;
+  const Value* value = nullptr;
   if (key.starts_with(kEntitlementKeyPrefix)) {
-    value = valueForEntitlement(key.substr(kEntitlementKeyPrefix.size()));
+    entitlement = valueForEntitlement(key.substr(kEntitlementKeyPrefix.size()));
+    value = entitlement.get();
   } else {
     if (key == kKeyIdentifier) {
       if (std::optional<std::string> identifier = this->identifier()) {
-        value = std::make_shared<const Value>(std::move(*identifier));
+        made.emplace(std::move(*identifier));
       }
     } else if (key == kKeyUuid) {
-      value = std::make_shared<const Value>(uuid().string());
+      made.emplace(uuid().string());
     } else if (key == kKeyElection) {
       int64_t election = 0;
       if (context_.annotations) {
@@ -232,14 +245,15 @@ bool EkDPlugIn::matchKey(std::string_view key, const Value& pattern) const {
           if (it != annotation->end()) election = electionNumber(it->second);
         }
       }
-      value = std::make_shared<const Value>(std::to_string(election & ~kElectionFlagBits));
+      made.emplace(std::to_string(election & ~kElectionFlagBits));
     } else if (key == kKeyContainingApp) {
       std::optional<std::string> containing = containingPath();
       if (!containing) return false;
-      value = std::make_shared<const Value>(std::move(*containing));
+      made.emplace(std::move(*containing));
     }
-    if (!value) value = attribute(key);
-    if (!value) value = infoKey(key);
+    if (made) value = &*made;
+    if (!value) value = current.attribute(key);
+    if (!value) value = infoValue(current, key);
   }
 
   if (isTrue(pattern)) return value && !isFalse(*value);
@@ -305,13 +319,18 @@ bool EkDPlugIn::matchDictionary(const Value& value, const Dictionary& pattern) c
 // ---- Host permission -------------------------------------------------------------------------
 
 std::optional<std::string> EkDPlugIn::allowForClient(const EkDWyreClient& client) const {
+  return allowForClient(client, *currentInfo());
+}
+
+std::optional<std::string> EkDPlugIn::allowForClient(const EkDWyreClient& client,
+                                                     const CurrentInfo& current) const {
   if (std::optional<Value> restriction =
           client.entitlementValueForKey(protocol::kEntitlementAllowedPlugIns)) {
     const Dictionary* rules = restriction->dictionary();
     if (rules == nullptr) return std::string(kInvalidRestriction);
-    if (!match(rules)) return std::string(kRestrictionRefuses);
+    if (!match(rules, current)) return std::string(kRestrictionRefuses);
   }
-  if (ValueRef required = pluginKey(kKeyHostEntitlement)) {
+  if (const Value* required = current.hostEntitlement) {
     // A name that is not a string is one no host can hold.
     if (const std::string* name = required->string()) {
       if (!client.hasEntitlement(*name)) return log::format(kMissingHostEntitlement, *name);

@@ -24,23 +24,25 @@ namespace {
 namespace form = plugin::form;
 using Candidates = std::vector<std::shared_ptr<EkDPlugIn>>;
 
-// One plug-in of the reply: its kept form, and what this reply adds to it.
-struct Match {
-  Match(std::shared_ptr<EkDPlugIn> plugIn, std::shared_ptr<const EkDFormCache::EncodedForm> form)
-      : plugIn(std::move(plugIn)), form(std::move(form)) {}
-  std::shared_ptr<EkDPlugIn> plugIn;
-  std::shared_ptr<const EkDFormCache::EncodedForm> form;
-  Dictionary added;
-};
-
 // The version text of the plug-in's form: its version when that is a string, the no-version
 // text when it has none, nothing for a version of another type.
-std::optional<std::string> formVersion(const EkDPlugIn& plugIn) {
-  ValueRef version = plugIn.version();
-  if (!version) return std::string(plugin::kNoVersion);
+std::optional<std::string_view> formVersion(const Value* version) {
+  if (version == nullptr) return plugin::kNoVersion;
   if (const std::string* text = version->string()) return *text;
   return std::nullopt;
 }
+
+// One plug-in of the reply: its kept form, and what this reply adds to it.
+struct Match {
+  Match(std::shared_ptr<EkDPlugIn> plugIn, EkDPlugIn::CurrentInfoRef current,
+        std::shared_ptr<const EkDFormCache::EncodedForm> form)
+      : plugIn(std::move(plugIn)), current(std::move(current)), form(std::move(form)) {}
+  std::shared_ptr<EkDPlugIn> plugIn;
+  // What the plug-in was checked against; its version orders copies of one identifier.
+  EkDPlugIn::CurrentInfoRef current;
+  std::shared_ptr<const EkDFormCache::EncodedForm> form;
+  Dictionary added;
+};
 
 // Whether candidate P wins over an earlier match X of the same identifier and version.
 bool candidateWins(const EkDPlugIn& plugIn, const EkDPlugIn& earlier) {
@@ -150,21 +152,22 @@ void Transaction::matchPlugIns() {
   const Dictionary* matchRules = rules ? &*rules : nullptr;
   EkDFormCache& forms = database.formCache();
   for (const auto& plugIn : candidates) {
+    EkDPlugIn::CurrentInfoRef current = plugIn->currentInfo();
     if (!all) {
       if (!plugIn->onSystemVolume()) {
         if (!plugIn->containingUrl()) continue;
         if (flags & protocol::kDiscoverSystemOnly) continue;
       }
-      if (plugIn->isDedicated()) {
+      if (current->dedicated) {
         auto path = plugIn->path();
         if (!pluginsPath || !path || !path->starts_with(*pluginsPath)) continue;
       }
       if (database.holdOnPlugIn(*plugIn)) continue;
     }
-    if (!plugIn->match(matchRules)) continue;
+    if (!plugIn->match(matchRules, *current)) continue;
     bool excluded = false;
     for (const Dictionary* exclusion : exclusions) {
-      if (plugIn->match(exclusion)) {
+      if (plugIn->match(exclusion, *current)) {
         log::ops().info("client %d plugin %{public}@ globally excluded", client_->pid(),
                         plugIn->uuid());
         excluded = true;
@@ -173,13 +176,13 @@ void Transaction::matchPlugIns() {
     }
     if (excluded) continue;
     if (!all) {
-      if (auto reason = plugIn->allowForClient(*client_)) {
+      if (auto reason = plugIn->allowForClient(*client_, *current)) {
         log::ops().info("client %d cannot use plugin %{public}@: %{public}@", client_->pid(),
                         plugIn->uuid(), *reason);
         continue;
       }
     }
-    auto match = std::make_shared<Match>(plugIn, forms.formFor(plugIn));
+    auto match = std::make_shared<Match>(plugIn, current, forms.formFor(plugIn));
     if (match->form->error) {
       log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(),
                        *match->form->error);
@@ -188,16 +191,16 @@ void Transaction::matchPlugIns() {
     // De-duplication against the matches accepted so far with the same identifier, earliest
     // first; the index keeps this linear in the number of candidates.
     const std::optional<std::string> identifier = plugIn->identifier();
-    const std::optional<std::string> version = plugIn->versionString();
+    const std::string* version = current->version ? current->version->string() : nullptr;
     bool dropped = false;
     auto sameIdentifier = accepted.find(identifier.value_or(""));
     if (sameIdentifier != accepted.end()) {
       std::vector<size_t>& positions = sameIdentifier->second;
       for (auto position = positions.begin(); position != positions.end(); ++position) {
-        const EkDPlugIn& earlier = *results[*position]->plugIn;
-        const std::optional<std::string> otherVersion = formVersion(earlier);
-        auto order = compareVersionString(version ? &*version : nullptr,
-                                          otherVersion ? std::string_view(*otherVersion) : "");
+        const Match& earlierMatch = *results[*position];
+        const EkDPlugIn& earlier = *earlierMatch.plugIn;
+        auto order = compareVersionString(
+            version, formVersion(earlierMatch.current->version).value_or(std::string_view()));
         bool removeEarlier = false;
         bool stop = true;
         if (!(flags & protocol::kDiscoverKeepVersions)) {
@@ -226,7 +229,7 @@ void Transaction::matchPlugIns() {
     }
     if (dropped) continue;
 
-    plugIn->augmentForm(match->added);
+    plugIn->augmentForm(match->added, *current);
     if (identifier) accepted[*identifier].push_back(results.size());
     results.push_back(match);
     if (auto replaces = plugIn->valueForEntitlement(protocol::kEntitlementReplacePlugIn)) {

@@ -436,6 +436,7 @@ Result<std::shared_ptr<SqliteRegistry>> SqliteRegistry::open(Options options) {
 }
 
 void SqliteRegistry::closeDatabase() {
+  uuidLists_ = {};
   statements_.reset();
   if (db_ != nullptr) sqlite3_close_v2(db_);
   db_ = nullptr;
@@ -1332,26 +1333,54 @@ std::vector<Uuid> SqliteRegistry::queryUuids(const Dictionary& rules) {
 }
 
 std::vector<Uuid> SqliteRegistry::uuidsLocked(const Dictionary& rules) {
+  // The lists read while the knowledge UUID stays the same are kept, keyed by the index keys
+  // they read ("*" for all): one match of a busy extension point read hundreds of rows.
+  auto points = indexedExtensionPoints(rules);
+  std::set<std::string> keys;
+  if (points) {
+    for (const std::string& point : *points) keys.insert(extensionPointIndexKey(point));
+  }
+  std::string listKey = points ? "=" : "*";
+  for (const std::string& key : keys) listKey += fmt::format("{}:{}", key.size(), key);
+  if (uuidLists_.knowledge != knowledge_) {
+    uuidLists_.lists.clear();
+    uuidLists_.size = 0;
+    uuidLists_.knowledge = knowledge_;
+  }
+  if (auto kept = uuidLists_.lists.find(listKey); kept != uuidLists_.lists.end()) {
+    return kept->second;
+  }
+
   std::vector<Uuid> uuids;
+  bool complete = true;
   auto collect = [&](sqlite3_stmt* statement, std::set<Uuid>* seen) {
-    while (sqlite3_step(statement) == SQLITE_ROW) {
+    int rc = SQLITE_ROW;
+    while ((rc = sqlite3_step(statement)) == SQLITE_ROW) {
       Uuid uuid = columnUuid(statement, 0);
       if (!seen || seen->insert(uuid).second) uuids.push_back(uuid);
     }
+    if (rc != SQLITE_DONE) complete = false;
   };
-  auto points = indexedExtensionPoints(rules);
   if (!points) {
     Use list(statements_->allPlugInUuids);
     collect(list.get(), nullptr);
-    return uuids;
+  } else {
+    std::set<Uuid> seen;
+    for (const std::string& key : keys) {
+      Use list(statements_->plugInUuidsOfPoint);
+      list.text(1, key);
+      collect(list.get(), keys.size() > 1 ? &seen : nullptr);
+    }
   }
-  std::set<std::string> keys;
-  for (const std::string& point : *points) keys.insert(extensionPointIndexKey(point));
-  std::set<Uuid> seen;
-  for (const std::string& key : keys) {
-    Use list(statements_->plugInUuidsOfPoint);
-    list.text(1, key);
-    collect(list.get(), keys.size() > 1 ? &seen : nullptr);
+  if (!complete) return uuids;
+  // Rules come from clients: the kept lists are bounded by the UUIDs they hold together.
+  if (uuidLists_.size + uuids.size() > kKeptUuidsLimit) {
+    uuidLists_.lists.clear();
+    uuidLists_.size = 0;
+  }
+  if (uuids.size() <= kKeptUuidsLimit) {
+    uuidLists_.size += uuids.size();
+    uuidLists_.lists.emplace(std::move(listKey), uuids);
   }
   return uuids;
 }

@@ -5,6 +5,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "platform/codesign/CodeSigning.h"
@@ -124,6 +125,14 @@ class SqliteRegistry : public Registry {
   sqlite3* db_ = nullptr;
   std::unique_ptr<Statements> statements_;
   Uuid knowledge_;  // REQUIRES dbMutex_
+  // uuidsLocked's answers for knowledge, by the index keys they read. REQUIRES dbMutex_.
+  struct UuidLists {
+    Uuid knowledge;
+    std::unordered_map<std::string, std::vector<Uuid>> lists;
+    size_t size = 0;  // UUIDs in all lists
+  };
+  static constexpr size_t kKeptUuidsLimit = 65536;
+  UuidLists uuidLists_;
 
   std::mutex observersMutex_;
   std::vector<std::weak_ptr<RegistryObserver>> observers_;
