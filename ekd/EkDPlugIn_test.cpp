@@ -465,6 +465,45 @@ TEST_F(EkDPlugInTest, LookupsReadTheRegistryNotTheStoredPlugInDictionary) {
   EXPECT_FALSE(record->plugInDictionary()->contains("Dedicated"));
 }
 
+TEST_F(EkDPlugInTest, CurrentInfoKeepsOneFetchAndTheNextFollowsTheRegistry) {
+  vantor::PlugInProxy proxy = thumbsProxy();
+  const Dictionary original = proxy.info;
+  auto record = build(proxy);
+  ASSERT_NE(record, nullptr);
+  EkDPlugIn::CurrentInfoRef before = record->currentInfo();
+  ASSERT_NE(before->info, nullptr);
+  EXPECT_FALSE(before->dedicated);
+  EXPECT_FALSE(before->data);
+  EXPECT_EQ(before->hostEntitlement, nullptr);
+  ASSERT_NE(before->bundleIdentifier, nullptr);
+  EXPECT_EQ(*before->bundleIdentifier, proxy.info.at("QvBundleIdentifier"));
+
+  Dictionary& extension = extensionOf(proxy.info);
+  extension["Dedicated"] = 1;
+  extension["ZuExtensionProtocol"] = "#Data";
+  extension["ZuExtensionHostEntitlement"] = "com.example.host";
+  extension["Shared"] = Array{Value("Resources")};
+  (*extension["ZuExtensionAttributes"].dictionary())["ZuExtensionVersion"] = "2.5";
+  registry_->install(proxy);
+
+  EkDPlugIn::CurrentInfoRef after = record->currentInfo();
+  EXPECT_TRUE(after->dedicated);
+  EXPECT_TRUE(after->data);
+  ASSERT_NE(after->hostEntitlement, nullptr);
+  EXPECT_EQ(*after->hostEntitlement, Value("com.example.host"));
+  ASSERT_NE(after->shared, nullptr);
+  EXPECT_EQ(*after->shared, Value(Array{Value("Resources")}));
+  ASSERT_NE(after->version, nullptr);
+  EXPECT_EQ(*after->version, Value("2.5"));
+  EXPECT_TRUE(record->match(nullptr, *after));
+  Dictionary rules{{"ZuExtensionVersion", Value("2.5")}};
+  EXPECT_TRUE(record->match(&rules, *after));
+  // What one request was checking against stays as it was.
+  EXPECT_FALSE(record->match(&rules, *before));
+  EXPECT_FALSE(before->dedicated);
+  EXPECT_EQ(*before->info, original);
+}
+
 TEST_F(EkDPlugInTest, FallsBackToTheBundleURLWhenTheUUIDIsGone) {
   vantor::PlugInProxy proxy = thumbsProxy();
   auto record = build(proxy);

@@ -925,6 +925,20 @@ TEST_F(QueryTest, DigitRunsCompareByNumber) {
             std::vector<std::string>{"com.example.e"});
 }
 
+TEST_F(QueryTest, AnswersFollowEveryChange) {
+  const Dictionary share{{"ZuExtensionPointIdentifier", Value("com.x.share")}};
+  ASSERT_EQ(identifiers(share).size(), 2u);
+  ASSERT_EQ(identifiers({}).size(), 5u);
+  writeApp("Y.app", "com.example.y", {{"F.appex", plugInInfo("com.example.f", "com.x.share")}});
+  ASSERT_TRUE(registry_->registerBundle(apps_ + "/Y.app").ok());
+  EXPECT_EQ(identifiers(share),
+            (std::vector<std::string>{"com.example.a", "com.example.b", "com.example.f"}));
+  EXPECT_EQ(identifiers({}).size(), 6u);
+  ASSERT_TRUE(registry_->unregisterBundle(apps_ + "/X.app").ok());
+  EXPECT_EQ(identifiers(share), std::vector<std::string>{"com.example.f"});
+  EXPECT_EQ(identifiers({}).size(), 1u);
+}
+
 TEST_F(QueryTest, FilterRunsPerCandidateAndDecides) {
   std::vector<std::string> seen;
   auto names = identifiers({{"ZuExtensionPointIdentifier", Value("com.x.share")}},
