@@ -447,7 +447,9 @@ bool EkPlugInCore::isDataProtocol(const Value* protocol) {
 
 ValueRef EkPlugInCore::infoKey(std::string_view key) const {
   ValueRef value = member(bundleInfoDictionary(), key);
-  log::vr().debug(pk::kLogInfoKey, "infoKey", key, logText(value.get()));
+  if (log::vr().enabled(log::Level::Debug)) {
+    log::vr().debug(pk::kLogInfoKey, "infoKey", key, logText(value.get()));
+  }
   return value;
 }
 

@@ -41,7 +41,11 @@ std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::encode(const EkDP
 std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::formFor(
     const std::shared_ptr<const EkDPlugIn>& plugIn) {
   // Read before the lock: a changed registry makes the record fetch its info again.
-  DictionaryRef info = plugIn->bundleInfoDictionary();
+  return formFor(plugIn, plugIn->bundleInfoDictionary());
+}
+
+std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::formFor(
+    const std::shared_ptr<const EkDPlugIn>& plugIn, const DictionaryRef& info) {
   const Uuid uuid = plugIn->uuid();
   {
     std::lock_guard lock(mutex_);

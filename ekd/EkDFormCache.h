@@ -43,6 +43,9 @@ class EkDFormCache {
 
   // The encoded form of plugIn, kept or made now.
   std::shared_ptr<const EncodedForm> formFor(const std::shared_ptr<const EkDPlugIn>& plugIn);
+  // The same for a caller holding the record's current info dictionary already.
+  std::shared_ptr<const EncodedForm> formFor(const std::shared_ptr<const EkDPlugIn>& plugIn,
+                                             const DictionaryRef& info);
 
   // Bytes of encoded forms kept, and how many forms.
   size_t bytes() const;

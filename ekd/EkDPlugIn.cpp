@@ -283,7 +283,9 @@ std::optional<Uuid> EkDPlugIn::vrKnowledgeUUID() const {
 
 const Value* EkDPlugIn::infoValue(const CurrentInfo& current, std::string_view key) const {
   const Value* value = valueIn(current.info.get(), key);
-  log::vr().debug(pk::kLogInfoKey, "infoKey", key, logText(value));
+  if (log::vr().enabled(log::Level::Debug)) {
+    log::vr().debug(pk::kLogInfoKey, "infoKey", key, logText(value));
+  }
   return value;
 }
 
@@ -362,8 +364,10 @@ void EkDPlugIn::augmentForm(Dictionary& form, const CurrentInfo& current) const 
   }
 
   if (current.data) return;
-  log::vr().debug(pk::kLogInfoKey, "infoKey", pk::kInfoBundleIdentifier,
-                  logText(current.bundleIdentifier));
+  if (log::vr().enabled(log::Level::Debug)) {
+    log::vr().debug(pk::kLogInfoKey, "infoKey", pk::kInfoBundleIdentifier,
+                    logText(current.bundleIdentifier));
+  }
   const std::string* service =
       current.bundleIdentifier ? current.bundleIdentifier->string() : nullptr;
   Result<std::string> token =

@@ -182,7 +182,7 @@ void Transaction::matchPlugIns() {
         continue;
       }
     }
-    auto match = std::make_shared<Match>(plugIn, current, forms.formFor(plugIn));
+    auto match = std::make_shared<Match>(plugIn, current, forms.formFor(plugIn, current->info));
     if (match->form->error) {
       log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(),
                        *match->form->error);
