@@ -37,6 +37,21 @@ std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::encode(const EkDP
   encoded->error = std::move(exported.error);
   return encoded;
 }
+size_t EkDFormCache::sizeBound(const EncodedForm& form, const Dictionary& added) {
+  size_t bound = 9 + form.members.size();
+  for (const auto& [key, value] : added) bound += 9 + key.size() + cbor::encodedSizeBound(value);
+  return bound;
+}
+
+void EkDFormCache::write(const EncodedForm& form, const Dictionary& added,
+                         std::vector<uint8_t>& out) {
+  cbor::encodeMapHead(form.count + added.size(), out);
+  out.insert(out.end(), form.members.begin(), form.members.end());
+  for (const auto& [key, value] : added) {
+    cbor::encodeText(key, out);
+    cbor::encode(value, out);
+  }
+}
 
 std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::formFor(
     const std::shared_ptr<const EkDPlugIn>& plugIn) {

@@ -47,6 +47,11 @@ class EkDFormCache {
   std::shared_ptr<const EncodedForm> formFor(const std::shared_ptr<const EkDPlugIn>& plugIn,
                                              const DictionaryRef& info);
 
+  // An upper bound of the bytes write adds for form with the per-request members added.
+  static size_t sizeBound(const EncodedForm& form, const Dictionary& added);
+  // Writes form with the per-request members added as one CBOR map.
+  static void write(const EncodedForm& form, const Dictionary& added, std::vector<uint8_t>& out);
+
   // Bytes of encoded forms kept, and how many forms.
   size_t bytes() const;
   size_t count() const;

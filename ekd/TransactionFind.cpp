@@ -3,6 +3,7 @@
 #include "Ekora/EkDaemonClient.h"
 #include "Ekora/EkFileURL.h"
 #include "Ekora/EkProtocol.h"
+#include "ekd/EkDFormCache.h"
 #include "ekd/EkDPlugIn.h"
 #include "ekd/EkDServer.h"
 #include "ekd/Transaction.h"
@@ -42,18 +43,24 @@ void Transaction::findPlugIn() {
     return;
   }
   log::ops().defaultLevel("plugin found %{public}@", *plugIn);
-  auto exported = plugIn->exportForm();
-  if (exported.error) {
+  // The kept encoded form, with what this request adds to it, as a match's reply carries it.
+  EkDPlugIn::CurrentInfoRef current = plugIn->currentInfo();
+  auto form = server().formCache().formFor(plugIn, current->info);
+  if (form->error) {
     log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(),
-                     *exported.error);
+                     *form->error);
   }
-  Dictionary form = std::move(exported.form);
-  addAnnotationForPlugIn(*plugIn, form);
-  plugIn->augmentForm(form);
-  if (auto converted = EkDaemonClient::convertToWyre(Value(std::move(form)), version())) {
-    reply_.insert_or_assign(std::string(protocol::kMatches), std::move(*converted));
+  Dictionary added;
+  addAnnotationForPlugIn(*plugIn, added);
+  plugIn->augmentForm(added, *current);
+  if (!EkDaemonClient::convertsToWyre(version())) {
+    done();
+    return;
   }
-  done();
+  doneWithEncoded(protocol::kMatches, [&](std::vector<uint8_t>& out) {
+    out.reserve(out.size() + EkDFormCache::sizeBound(*form, added));
+    EkDFormCache::write(*form, added, out);
+  });
 }
 
 }  // namespace ek

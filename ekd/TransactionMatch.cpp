@@ -285,23 +285,13 @@ void Transaction::matchPlugIns() {
     return;
   }
   doneWithEncoded(protocol::kMatches, [&results](std::vector<uint8_t>& out) {
-    size_t bound = 0;
+    size_t bound = 9;
     for (const MatchRef& result : results) {
-      bound += 1 + result->form->members.size();
-      for (const auto& [key, value] : result->added) {
-        bound += 9 + key.size() + cbor::encodedSizeBound(value);
-      }
+      bound += EkDFormCache::sizeBound(*result->form, result->added);
     }
-    out.reserve(out.size() + 9 + bound);
+    out.reserve(out.size() + bound);
     cbor::encodeArrayHead(results.size(), out);
-    for (const MatchRef& result : results) {
-      cbor::encodeMapHead(result->form->count + result->added.size(), out);
-      out.insert(out.end(), result->form->members.begin(), result->form->members.end());
-      for (const auto& [key, value] : result->added) {
-        cbor::encodeText(key, out);
-        cbor::encode(value, out);
-      }
-    }
+    for (const MatchRef& result : results) EkDFormCache::write(*result->form, result->added, out);
   });
 }
 

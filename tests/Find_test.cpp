@@ -219,6 +219,45 @@ TEST_F(FindRequests, BarePathIsNotAUrl) {
   expectNotFound(ask(request("find", {{"paths", Value(thumbs())}})));
 }
 
+TEST_F(FindRequests, FormFollowsAReRegisteredBundleAndNewAnnotations) {
+  // Found forms are kept encoded between requests; none may outlive what it was made from.
+  addExamples();
+  auto uuid = uuidOf(thumbs());
+  ASSERT_TRUE(uuid);
+  Value before = findByUuid(*uuid);
+  ASSERT_NE(before.get("matches"), nullptr) << before.description();
+  EXPECT_EQ(stringAt(*before.get("matches"), "version"), "1.0");
+
+  fs::path info = fs::path(thumbs()) / "Info.dmap";
+  std::string text;
+  {
+    std::ifstream in(info);
+    text.assign(std::istreambuf_iterator<char>(in), {});
+  }
+  const std::string from = "<key>ZuExtensionVersion</key>\n\t\t\t<string>1.0</string>";
+  auto at = text.find(from);
+  ASSERT_NE(at, std::string::npos);
+  text.replace(at, from.size(), "<key>ZuExtensionVersion</key>\n\t\t\t<string>2.5</string>");
+  std::ofstream(info, std::ios::trunc) << text;
+  addExamples();
+  ASSERT_EQ(replyErrorCode(ask(request(
+                "annotate", {{"annotations", Value(Dictionary{{"election", Value(uint64_t{1})}})},
+                             {"uuids", Value(Array{Value(*uuid)})}}))),
+            0);
+
+  Value after = findByUuid(*uuid);
+  const Value* form = after.get("matches");
+  ASSERT_NE(form, nullptr) << after.description();
+  EXPECT_EQ(stringAt(*form, "uuid"), uuid->string());
+  EXPECT_EQ(stringAt(*form, "version"), "2.5") << after.description();
+  const Dictionary* annotations = form->getDictionary("annotations");
+  ASSERT_NE(annotations, nullptr) << after.description();
+  auto election = annotations->find("election");
+  ASSERT_NE(election, annotations->end()) << after.description();
+  ASSERT_NE(election->second.unsignedNumber(), nullptr);
+  EXPECT_EQ(*election->second.unsignedNumber(), 1u);
+}
+
 TEST_F(FindRequests, FormCarriesEmptyAnnotationsWhenNoneAreStored) {
   addExamples();
   Value reply = findByUrl(thumbs());
