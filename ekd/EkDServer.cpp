@@ -3,9 +3,11 @@
 #include <fcntl.h>
 #include <malloc.h>
 
+#include <future>
 #include <mutex>
 
 #include "Ekora/EkProtocol.h"
+#include "ekd/EkDAnnotationStore.h"
 #include "ekd/EkDPlugInHold.h"
 #include "ekd/EkDUserPrefs.h"
 #include "ekd/EkDWyreClient.h"
@@ -40,6 +42,11 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
   auto server = std::shared_ptr<EkDServer>(new EkDServer());
   server->databasePath_ = std::move(database);
   server->platform_ = std::move(platform);
+  // The annotation file and the registry know nothing of each other: the one is read while
+  // the other opens and checks the system plug-ins.
+  std::future<std::unique_ptr<EkDAnnotationStore>> store = std::async(
+      std::launch::async,
+      [path = server->databasePath_] { return EkDAnnotationStore::initWithDatabase(path); });
   if (!server->platform_.registry) {
     vantor::SqliteRegistry::Options options;
     options.codeSigning = server->platform_.codeSigning;
@@ -66,7 +73,7 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
       server->platform_.registry, server->platform_.extensions, {},
       server->platform_.notifier, server->platform_.types,      server->platform_.serviceManager,
       server->platform_.consent};
-  if (!server->initWithDatabase(server->databasePath_, std::move(databasePlatform))) {
+  if (!server->initWithStore(store.get(), std::move(databasePlatform))) {
     return nullptr;
   }
   server->userPrefs_ = EkDUserPrefs::init(server->platform_.preferences);

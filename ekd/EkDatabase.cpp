@@ -62,8 +62,13 @@ auto onQueue(SerialQueue& queue, F&& block) {
 EkDatabase::~EkDatabase() = default;
 
 bool EkDatabase::initWithDatabase(std::optional<std::string> path, EkDatabasePlatform platform) {
+  return initWithStore(EkDAnnotationStore::initWithDatabase(std::move(path)), std::move(platform));
+}
+
+bool EkDatabase::initWithStore(std::unique_ptr<EkDAnnotationStore> store,
+                               EkDatabasePlatform platform) {
   platform_ = std::move(platform);
-  annotations_ = EkDAnnotationStore::initWithDatabase(std::move(path));
+  annotations_ = std::move(store);
   if (!annotations_) return false;
   sync_ = SerialQueue::make("EkDatabase");
   // The registry holds observers weakly; the owner registers this database once it is shared

@@ -61,6 +61,8 @@ class EkDatabase : public vantor::RegistryObserver {
 
   // Fails only when the annotation store cannot be opened.
   bool initWithDatabase(std::optional<std::string> path, EkDatabasePlatform platform);
+  // The same with the annotation store opened already (EkDAnnotationStore::initWithDatabase).
+  bool initWithStore(std::unique_ptr<EkDAnnotationStore> store, EkDatabasePlatform platform);
 
   // The cached record of the proxy's UUID, else a new one. nullptr when the proxy yields no
   // record (the next request tries again).
