@@ -1,6 +1,8 @@
 #include "platform/vantor/BundleSources.h"
 
+#include <fcntl.h>
 #include <algorithm>
+
 #include <cerrno>
 #include <ctime>
 #include <string_view>
@@ -12,12 +14,13 @@
 namespace ek::vantor {
 namespace {
 
-enum class Look { Present, Absent, Unknown };
+using Look = BundleSources::Look;
 
-// Absent only when the system says so: EACCES or EIO prove nothing about the file.
-Look look(const std::string& path, FileStamp& stamp) {
+// Stats name, relative to directory when that is a descriptor. Absent only when the system
+// says so: EACCES or EIO prove nothing about the file.
+Look look(int directory, const char* name, FileStamp& stamp) {
   struct stat st {};
-  if (::stat(path.c_str(), &st) == 0) {
+  if (::fstatat(directory, name, &st, 0) == 0) {
     stamp = FileStamp::of(st);
     return Look::Present;
   }
@@ -84,7 +87,7 @@ void BundleSources::add(const std::string& path, bool shared) {
     return;
   }
   FileStamp stamp;
-  switch (look(path, stamp)) {
+  switch (look(AT_FDCWD, path.c_str(), stamp)) {
     case Look::Present:
       if (!settled(stamp, settleSeconds_)) {
         checkable_ = false;
@@ -112,6 +115,24 @@ std::optional<std::vector<uint8_t>> BundleSources::record() const {
       cbor::encode(Value(Array{Value(context_), Value(std::move(entries))}));
   if (bytes.size() > kMaxRecordBytes) return std::nullopt;
   return bytes;
+}
+
+BundleSources::Look BundleSources::Checker::look(std::string_view path, FileStamp& stamp) {
+  if (directoryFd_.valid() && path.size() > directory_.size() && path.starts_with(directory_)) {
+    return vantor::look(directoryFd_.get(), std::string(path.substr(directory_.size())).c_str(),
+                        stamp);
+  }
+  const std::string whole(path);
+  const Look seen = vantor::look(AT_FDCWD, whole.c_str(), stamp);
+  // The next paths likely lie below this one's directory (a bundle's files below the bundle's
+  // parent directory). A directory that cannot be opened is simply not kept.
+  const size_t slash = path.rfind('/');
+  if (slash != std::string_view::npos && slash > 0) {
+    std::string directory(path.substr(0, slash + 1));
+    directoryFd_.reset(::open(directory.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    directory_ = directoryFd_.valid() ? std::move(directory) : std::string();
+  }
+  return seen;
 }
 
 bool BundleSources::Checker::unchanged(std::span<const uint8_t> record) {

@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "platform/io/FileStamp.h"
+#include "platform/io/UniqueFd.h"
 
 namespace ek::vantor {
 
@@ -42,6 +43,9 @@ class BundleSources {
   // The record to keep, absent when it could not prove the bundle unchanged later.
   std::optional<std::vector<uint8_t>> record() const;
 
+  // What a look at a file found. Unknown: it could not be told (EACCES, EIO).
+  enum class Look { Present, Absent, Unknown };
+
   // Checks records against the file system as it is now; one per scan.
   class Checker {
    public:
@@ -51,8 +55,15 @@ class BundleSources {
     bool unchanged(std::span<const uint8_t> record);
 
    private:
+    // Stats path, relative to the directory of the last path looked at when it lies below it:
+    // the files of one bundle, and the bundles of one directory, then share the walk of their
+    // common path.
+    Look look(std::string_view path, FileStamp& stamp);
+
     std::string context_;
     std::unordered_map<std::string, std::optional<FileStamp>> shared_;
+    std::string directory_;  // with its trailing slash
+    UniqueFd directoryFd_;
   };
 
  private:

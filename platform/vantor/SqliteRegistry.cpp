@@ -11,6 +11,7 @@
 #include <filesystem>
 #include <map>
 #include <set>
+#include <thread>
 #include <unordered_map>
 #include <unordered_set>
 
@@ -1069,6 +1070,11 @@ void SqliteRegistry::recordSources(const Plan& plan) {
 namespace {
 
 // A data container outlives registrations, but someone may have removed it.
+// The start-up check of the system bundles' records uses up to this many threads, one for
+// every so many bundles.
+constexpr size_t kMaxCheckThreads = 4;
+constexpr size_t kBundlesPerCheckThread = 512;
+
 void ensureContainer(const std::string& container, const std::string& bundle) {
   std::string tmp = paths::join(container, "tmp");
   if (isDirectory(tmp)) return;
@@ -1104,21 +1110,46 @@ void SqliteRegistry::reconcile() {
                        Recorded{columnText(row, 1), std::vector<uint8_t>(bytes, bytes + size)});
     }
   }
-  BundleSources::Checker checker(reader.sourcesContext());
+  bool truncated = false;
+  std::vector<std::string> names = subdirectories(dir, "", kMaxSystemBundles, truncated);
+
+  // Which records still hold. Checking them only reads the records and stats files, and with
+  // many system bundles it is most of a start, so it is shared among a few threads.
+  std::vector<char> holds(names.size(), 0);
+  const std::string context = reader.sourcesContext();
+  auto check = [&](size_t begin, size_t end) {
+    BundleSources::Checker checker(context);
+    for (size_t i = begin; i < end; ++i) {
+      const std::string path = paths::join(dir, names[i]);
+      auto known = recorded.find(path);
+      if (known == recorded.end() || !checker.unchanged(known->second.sources)) continue;
+      if (known->second.container) ensureContainer(*known->second.container, path);
+      holds[i] = 1;
+    }
+  };
+  const size_t threads = std::clamp<size_t>(
+      std::min<size_t>(std::thread::hardware_concurrency(), names.size() / kBundlesPerCheckThread),
+      1, kMaxCheckThreads);
+  {
+    std::vector<std::thread> helpers;
+    const size_t share = (names.size() + threads - 1) / threads;
+    for (size_t t = 1; t < threads; ++t) {
+      helpers.emplace_back(check, std::min(names.size(), t * share),
+                           std::min(names.size(), (t + 1) * share));
+    }
+    check(0, std::min(names.size(), share));
+    for (std::thread& helper : helpers) helper.join();
+  }
 
   // Unchanged bundles read again: their new records, written together at the end.
   Plan fresh;
-  bool truncated = false;
-  std::vector<std::string> names = subdirectories(dir, "", kMaxSystemBundles, truncated);
   std::unordered_set<std::string> present;
   present.reserve(names.size());
   size_t untouched = 0;
-  for (const std::string& name : names) {
-    std::string path = paths::join(dir, name);
+  for (size_t i = 0; i < names.size(); ++i) {
+    std::string path = paths::join(dir, names[i]);
     present.insert(path);
-    if (auto known = recorded.find(path);
-        known != recorded.end() && checker.unchanged(known->second.sources)) {
-      if (known->second.container) ensureContainer(*known->second.container, path);
+    if (holds[i]) {
       ++untouched;
       continue;
     }

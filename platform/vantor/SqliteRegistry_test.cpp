@@ -1,5 +1,6 @@
 #include "platform/vantor/SqliteRegistry.h"
 
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
@@ -678,6 +679,43 @@ TEST_F(StartUpScanTest, UnchangedBundlesAreNotReadAgainAndEveryChangedFileIsSeen
   ::chmod((spell_ + "/spell").c_str(), 0777);  // the entitlements are no longer trusted
   EXPECT_EQ(reopenCountingReads(), 1);
   EXPECT_TRUE(registry_->plugInByUrl(spell_)->entitlements.empty());
+}
+
+TEST_F(StartUpScanTest, ManyBundlesAreCheckedTogetherAndEachChangeIsSeenWherever) {
+  // Enough bundles for the check to be shared among threads; a change in any share is seen.
+  constexpr int kBundles = 1200;
+  std::vector<std::string> bundles;
+  for (int i = 0; i < kBundles; ++i) {
+    bundles.push_back(writePlugIn(fmt::format("{}/Library/PlugIns/P{:04}.bundle", system_, i),
+                                  plugInInfo(fmt::format("com.example.p{}", i), "com.x.many")));
+  }
+  EXPECT_EQ(reopenCountingReads(), kBundles + 1);
+  EXPECT_EQ(reopenCountingReads(), 0);
+
+  std::vector<int> changed = {0, kBundles / 3, kBundles / 2 + 1, kBundles - 1};
+  for (int i : changed) {
+    Dictionary info = plugInInfo(fmt::format("com.example.p{}", i), "com.x.many");
+    info["QvBundleVersion"] = Value("7.0");
+    writePlugIn(bundles[i], info);
+  }
+  // A bundle replaced by another directory of the same name, as an installer swaps them in.
+  const std::string swapped = bundles[kBundles / 4];
+  const std::string fresh = system_ + "/Library/swap.tmp";
+  Dictionary info = plugInInfo(fmt::format("com.example.p{}", kBundles / 4), "com.x.many");
+  info["QvBundleVersion"] = Value("8.0");
+  writePlugIn(fresh, info);
+  fs::remove_all(swapped);
+  fs::rename(fresh, swapped);
+
+  EXPECT_EQ(reopenCountingReads(), static_cast<int>(changed.size()) + 1);
+  for (int i : changed) {
+    ASSERT_TRUE(registry_->plugInByUrl(bundles[i])) << bundles[i];
+    EXPECT_EQ(registry_->plugInByUrl(bundles[i])->bundleVersion, "7.0") << bundles[i];
+  }
+  ASSERT_TRUE(registry_->plugInByUrl(swapped));
+  EXPECT_EQ(registry_->plugInByUrl(swapped)->bundleVersion, "8.0");
+  EXPECT_EQ(registry_->plugInByUrl(bundles[1])->bundleVersion, "1.0");
+  EXPECT_EQ(reopenCountingReads(), 0);
 }
 
 TEST_F(StartUpScanTest, BundlesAreReadAgainWhenTheirRecordCannotBeTrusted) {
