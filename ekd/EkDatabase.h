@@ -144,8 +144,10 @@ class EkDatabase : public vantor::RegistryObserver {
   std::unique_ptr<EkDAnnotationStore> annotations_;  // on _sync
   std::shared_ptr<SerialQueue> sync_;
   std::unordered_map<Uuid, EkDPlugInRef> cache_;  // on _sync
-  // About 2.6 KB a form: the forms of the largest extension points of a full installation.
-  EkDFormCache formCache_{4u << 20};
+  // About 2.6 KB a form: room for the 500 forms of a busy extension point and the plug-ins
+  // found most recently. Finds pass every form they answer through it, so a larger cache
+  // mostly holds forms nobody asks for again.
+  EkDFormCache formCache_{2u << 20};
 };
 
 }  // namespace ek
