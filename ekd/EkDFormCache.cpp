@@ -37,6 +37,7 @@ std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::encode(const EkDP
   encoded->error = std::move(exported.error);
   return encoded;
 }
+
 size_t EkDFormCache::sizeBound(const EncodedForm& form, const Dictionary& added) {
   size_t bound = 9 + form.members.size();
   for (const auto& [key, value] : added) bound += 9 + key.size() + cbor::encodedSizeBound(value);

@@ -43,9 +43,10 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
   server->databasePath_ = std::move(database);
   server->platform_ = std::move(platform);
   // The annotation file and the registry know nothing of each other: the one is read while
-  // the other opens and checks the system plug-ins.
+  // the other opens and checks the system plug-ins (or, with no thread to be had, when the
+  // store is asked for).
   std::future<std::unique_ptr<EkDAnnotationStore>> store = std::async(
-      std::launch::async,
+      std::launch::async | std::launch::deferred,
       [path = server->databasePath_] { return EkDAnnotationStore::initWithDatabase(path); });
   if (!server->platform_.registry) {
     vantor::SqliteRegistry::Options options;

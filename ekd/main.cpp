@@ -1,4 +1,5 @@
 // ekd: the plug-in daemon.
+#include <malloc.h>
 #include <unistd.h>
 #include <asio/io_context.hpp>
 #include <asio/signal_set.hpp>
@@ -24,6 +25,10 @@ namespace {
 
 int main(int argc, char* argv[]) {
   using namespace ek;
+  // One malloc arena for every thread. Requests, replies and records pass from thread to
+  // thread, and with an arena per thread the memory each frees stays apart from the others':
+  // the footprint then creeps up for long after start instead of levelling off.
+  mallopt(M_ARENA_MAX, 1);
   log::ops().info("ekd is launching");
 
   std::string serviceName(protocol::kServiceName);

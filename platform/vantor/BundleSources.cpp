@@ -1,8 +1,8 @@
 #include "platform/vantor/BundleSources.h"
 
 #include <fcntl.h>
-#include <algorithm>
 
+#include <algorithm>
 #include <cerrno>
 #include <ctime>
 #include <string_view>

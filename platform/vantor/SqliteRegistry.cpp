@@ -11,6 +11,7 @@
 #include <filesystem>
 #include <map>
 #include <set>
+#include <system_error>
 #include <thread>
 #include <unordered_map>
 #include <unordered_set>
@@ -1069,12 +1070,12 @@ void SqliteRegistry::recordSources(const Plan& plan) {
 
 namespace {
 
-// A data container outlives registrations, but someone may have removed it.
 // The start-up check of the system bundles' records uses up to this many threads, one for
 // every so many bundles.
 constexpr size_t kMaxCheckThreads = 4;
 constexpr size_t kBundlesPerCheckThread = 512;
 
+// A data container outlives registrations, but someone may have removed it.
 void ensureContainer(const std::string& container, const std::string& bundle) {
   std::string tmp = paths::join(container, "tmp");
   if (isDirectory(tmp)) return;
@@ -1134,8 +1135,13 @@ void SqliteRegistry::reconcile() {
     std::vector<std::thread> helpers;
     const size_t share = (names.size() + threads - 1) / threads;
     for (size_t t = 1; t < threads; ++t) {
-      helpers.emplace_back(check, std::min(names.size(), t * share),
-                           std::min(names.size(), (t + 1) * share));
+      const size_t begin = std::min(names.size(), t * share);
+      const size_t end = std::min(names.size(), (t + 1) * share);
+      try {
+        helpers.emplace_back(check, begin, end);
+      } catch (const std::system_error&) {
+        check(begin, end);  // no thread to be had: this one does that share too
+      }
     }
     check(0, std::min(names.size(), share));
     for (std::thread& helper : helpers) helper.join();
