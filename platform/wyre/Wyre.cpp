@@ -56,11 +56,20 @@ std::mutex gRunningMutex;
 std::condition_variable gRunningChanged;
 int gRunning = 0;
 
+// Counts a thread out only once its thread-local objects are gone: made first in the thread,
+// it is destroyed last. Counted out earlier, the process could exit while the thread still
+// frees them (a leak checker then sees memory that only that thread refers to).
+struct RunningMark {
+  ~RunningMark() {
+    std::lock_guard lock(gRunningMutex);
+    --gRunning;
+    gRunningChanged.notify_all();
+  }
+};
+
 void runIo(asio::io_context& context) {
+  thread_local RunningMark mark;
   context.run();
-  std::lock_guard lock(gRunningMutex);
-  --gRunning;
-  gRunningChanged.notify_all();
 }
 
 // At exit the I/O threads stop before static objects go: a socket failing during exit would
