@@ -195,8 +195,21 @@ bool EkDServer::holdOnPlugIn(const EkDPlugIn& plugIn) {
 }
 
 void EkDServer::addHold(std::shared_ptr<EkDPlugInHold> hold) {
-  syncQueue_->sync([&] { holds_.push_back(std::move(hold)); });
-  notifier()->post(protocol::kAnnotationChangeNotification);
+  // A hold request may pass its client's check just before the client dies and arrive here
+  // after the client's holds were released: nobody would ever release it then. The client
+  // stops accepting work before it releases its holds, both ordered by this queue.
+  bool added = false;
+  syncQueue_->sync([&] {
+    auto client = hold->client();
+    if (client && !client->acceptWork()) {
+      log::ops().debug("dropping plug-in hold %{public}@ of dead client pid %d", hold->uuid(),
+                       client->pid());
+      return;
+    }
+    holds_.push_back(hold);
+    added = true;
+  });
+  if (added) notifier()->post(protocol::kAnnotationChangeNotification);
 }
 
 void EkDServer::unholdToken(const Uuid& token) {

@@ -169,6 +169,18 @@ TEST_F(EkDServerTest, UnknownTokenChangesNothingAndPostsNothing) {
   EXPECT_EQ(sink_->count("releasing plug-in hold"), 0u);
 }
 
+TEST_F(EkDServerTest, HoldPlacedAfterItsClientDiedIsDropped) {
+  // A hold request that passed its client's check before the client died must not outlive it.
+  auto dying = connectClient();
+  auto a = plugIn("com.example.a");
+  dying->dead();
+  size_t posts = notifier_->count(kChange);
+  server_->addHold(EkDPlugInHold::initWithPlugIns({a}, dying, serviceManager_));
+  EXPECT_EQ(server_->holdCount(), 0u);
+  EXPECT_FALSE(server_->holdOnPlugIn(*a));
+  EXPECT_EQ(notifier_->count(kChange), posts);
+}
+
 TEST_F(EkDServerTest, DeadClientReleasesOnlyItsOwnHoldsOnePostEach) {
   auto dying = connectClient();
   auto other = connectClient();

@@ -76,9 +76,10 @@ void EkDWyreClient::dying() {
 }
 
 void EkDWyreClient::dead() {
+  // First: a hold placed from now on is dropped rather than outliving its client.
+  acceptWork_ = false;
   server_->unholdClient(shared_from_this());
   log::ops().debug("client %d is dead", pid_);
-  acceptWork_ = false;
   EK_PROBE1(client_done, pid_);
 }
 
