@@ -167,11 +167,14 @@ std::unique_ptr<EkDAnnotationStore> EkDAnnotationStore::initWithDatabase(
 }
 
 std::optional<Dictionary> EkDAnnotationStore::annotationForIdentifier(std::string_view key) const {
-  auto it = index_.find(key);
-  if (it == index_.end()) return std::nullopt;
-  const Dictionary* annotation = it->second->dictionary();
+  const Dictionary* annotation = findAnnotation(key);
   if (annotation == nullptr) return std::nullopt;
   return *annotation;
+}
+
+const Dictionary* EkDAnnotationStore::findAnnotation(std::string_view key) const {
+  auto it = index_.find(key);
+  return it == index_.end() ? nullptr : it->second->dictionary();
 }
 
 std::optional<Dictionary> EkDAnnotationStore::annotationForPlugIn(const EkDPlugIn& plugIn) const {
@@ -195,6 +198,7 @@ void EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
     index_.erase(key);
     annotations_.erase(key);
   }
+  generation_.fetch_add(1, std::memory_order_release);
   stale_.insert(key);
   if (deferring_) {
     pendingSave_ = true;
@@ -246,6 +250,7 @@ Result<void> EkDAnnotationStore::load(const std::string& path, bool& dataUsable)
   index_.clear();
   index_.reserve(annotations_.size());
   for (const auto& [key, annotation] : annotations_) index_.emplace(key, &annotation);
+  generation_.fetch_add(1, std::memory_order_release);
   written_.clear();
   stale_.clear();
   allStale_ = true;

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <map>
 #include <memory>
@@ -20,7 +21,7 @@ class EkDPlugIn;
 // The user's per-plug-in choices (annotations), kept in memory and written through to one dmap
 // file after every change: {"version": 16, "data": {annotation key: annotation}}.
 //
-// Not thread-safe: the database makes every call on its serial queue.
+// Not thread-safe: the database makes every call on its serial queue, but for generation().
 class EkDAnnotationStore {
  public:
   static constexpr int64_t kVersion = 16;
@@ -38,6 +39,8 @@ class EkDAnnotationStore {
   static std::unique_ptr<EkDAnnotationStore> initWithDatabase(std::optional<std::string> path);
 
   std::optional<Dictionary> annotationForIdentifier(std::string_view key) const;
+  // The same without a copy: valid until the next change of the table.
+  const Dictionary* findAnnotation(std::string_view key) const;
   // The annotation under the plug-in's annotationKey().
   std::optional<Dictionary> annotationForPlugIn(const EkDPlugIn& plugIn) const;
   // Merges annotation into the stored one (same-named entries replaced, others kept), or
@@ -65,6 +68,10 @@ class EkDAnnotationStore {
   static std::string globalURL();
   // The daemon's system-data container, created when missing: the migration source.
   static Result<std::string> containerURL();
+
+  // Counts the changes of the table, from 1. What a reader took from the table while the
+  // generation was G is still the table's while it is G. Safe to read from any thread.
+  uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
 
   const std::string& annotationsURL() const { return annotationsURL_; }
   const Dictionary& annotations() const { return annotations_; }
@@ -99,6 +106,7 @@ class EkDAnnotationStore {
   bool keepBadFile_ = false;
   bool deferring_ = false;
   bool pendingSave_ = false;
+  std::atomic<uint64_t> generation_{1};
 };
 
 }  // namespace ek

@@ -38,17 +38,25 @@ std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::encode(const EkDP
   return encoded;
 }
 
-size_t EkDFormCache::sizeBound(const EncodedForm& form, const Dictionary& added) {
-  size_t bound = 9 + form.members.size();
-  for (const auto& [key, value] : added) bound += 9 + key.size() + cbor::encodedSizeBound(value);
+size_t EkDFormCache::sizeBound(const EncodedForm& form, const Added& added) {
+  size_t bound =
+      9 + form.members.size() + 9 + plugin::form::kAnnotations.size() + added.annotations.size();
+  for (const auto& [key, value] : added.members) {
+    bound += 9 + key.size() + cbor::encodedSizeBound(value);
+  }
   return bound;
 }
 
-void EkDFormCache::write(const EncodedForm& form, const Dictionary& added,
-                         std::vector<uint8_t>& out) {
-  cbor::encodeMapHead(form.count + added.size(), out);
+void EkDFormCache::write(const EncodedForm& form, const Added& added, std::vector<uint8_t>& out) {
+  cbor::encodeMapHead(form.count + 1 + added.members.size(), out);
   out.insert(out.end(), form.members.begin(), form.members.end());
-  for (const auto& [key, value] : added) {
+  cbor::encodeText(plugin::form::kAnnotations, out);
+  if (added.annotations.empty()) {
+    cbor::encodeMapHead(0, out);
+  } else {
+    out.insert(out.end(), added.annotations.begin(), added.annotations.end());
+  }
+  for (const auto& [key, value] : added.members) {
     cbor::encodeText(key, out);
     cbor::encode(value, out);
   }

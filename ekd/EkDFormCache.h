@@ -6,6 +6,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <span>
 #include <unordered_map>
 #include <vector>
 
@@ -47,10 +48,17 @@ class EkDFormCache {
   std::shared_ptr<const EncodedForm> formFor(const std::shared_ptr<const EkDPlugIn>& plugIn,
                                              const DictionaryRef& info);
 
-  // An upper bound of the bytes write adds for form with the per-request members added.
-  static size_t sizeBound(const EncodedForm& form, const Dictionary& added);
-  // Writes form with the per-request members added as one CBOR map.
-  static void write(const EncodedForm& form, const Dictionary& added, std::vector<uint8_t>& out);
+  // What a reply adds to a kept form: the plug-in's annotations, encoded already (a CBOR map,
+  // see EkDatabase::encodedAnnotationsForPlugIns; none written as an empty map), and the other
+  // per-request members, which do not include the annotations.
+  struct Added {
+    std::span<const uint8_t> annotations;
+    const Dictionary& members;
+  };
+  // An upper bound of the bytes write adds for form with added.
+  static size_t sizeBound(const EncodedForm& form, const Added& added);
+  // Writes form with added as one CBOR map.
+  static void write(const EncodedForm& form, const Added& added, std::vector<uint8_t>& out);
 
   // Bytes of encoded forms kept, and how many forms.
   size_t bytes() const;

@@ -276,6 +276,16 @@ DictionaryRef EkDPlugIn::infoDmap() const {
   return current_ ? current_->info : nullptr;
 }
 
+EkDPlugIn::AnnotationNote EkDPlugIn::annotationNote() const {
+  std::lock_guard lock(noteMutex_);
+  return annotationNote_;
+}
+
+void EkDPlugIn::setAnnotationNote(AnnotationNote note) const {
+  std::lock_guard lock(noteMutex_);
+  annotationNote_ = std::move(note);
+}
+
 std::optional<Uuid> EkDPlugIn::vrKnowledgeUUID() const {
   std::lock_guard lock(infoMutex_);
   return vrKnowledgeUUID_;

@@ -182,6 +182,16 @@ class EkDPlugIn : public EkPlugInCore {
 
   const EkDPlugInContext& context() const { return context_; }
 
+  // The database's note of this plug-in's annotation as a reply carries it (CBOR), with the
+  // annotation store's generation it was read in (0: not read yet). A reply of hundreds of
+  // forms then finds the annotations beside the records it walks already.
+  struct AnnotationNote {
+    uint64_t generation = 0;
+    std::shared_ptr<const std::vector<uint8_t>> encoded;
+  };
+  AnnotationNote annotationNote() const;
+  void setAnnotationNote(AnnotationNote note) const;
+
  private:
   explicit EkDPlugIn(EkDPlugInContext context);
 
@@ -199,6 +209,8 @@ class EkDPlugIn : public EkPlugInCore {
   mutable std::mutex infoMutex_;
   mutable CurrentInfoRef current_;
   mutable std::optional<Uuid> vrKnowledgeUUID_;
+  mutable std::mutex noteMutex_;
+  mutable AnnotationNote annotationNote_;
 };
 
 // File-provider action names of an extension dictionary ("ZuExtensionFileProviderActions",

@@ -6,6 +6,7 @@
 #include <unordered_set>
 
 #include "Ekora/EkProtocol.h"
+#include "platform/cbor/Cbor.h"
 #include "platform/log/Log.h"
 
 namespace ek {
@@ -338,18 +339,38 @@ std::optional<Dictionary> EkDatabase::annotationForPlugIn(const EkDPlugIn& plugI
   return onQueue(*sync_, [&] { return annotations_->annotationForPlugIn(plugIn); });
 }
 
-std::vector<std::optional<Dictionary>> EkDatabase::annotationsForPlugIns(
-    const std::vector<const EkDPlugIn*>& plugIns) {
-  std::vector<std::string> keys;
-  keys.reserve(plugIns.size());
-  for (const EkDPlugIn* plugIn : plugIns) keys.push_back(plugIn->annotationKey());
-  std::vector<std::optional<Dictionary>> annotations(plugIns.size());
+std::vector<EkDatabase::EncodedAnnotation> EkDatabase::encodedAnnotationsForPlugIns(
+    std::span<const EkDPlugIn* const> plugIns) {
+  std::vector<EncodedAnnotation> encoded(plugIns.size());
+  // Every note of the store's current generation: the whole answer is that generation's.
+  const uint64_t generation = annotations_->generation();
+  bool noted = true;
+  for (size_t i = 0; noted && i < plugIns.size(); ++i) {
+    EkDPlugIn::AnnotationNote note = plugIns[i]->annotationNote();
+    noted = note.generation == generation;
+    encoded[i] = std::move(note.encoded);
+  }
+  if (noted) return encoded;
+
+  static const EncodedAnnotation kNone =
+      std::make_shared<const std::vector<uint8_t>>(cbor::encode(Value(Dictionary{})));
   sync_->sync([&] {
-    for (size_t i = 0; i < keys.size(); ++i) {
-      annotations[i] = annotations_->annotationForIdentifier(keys[i]);
+    const uint64_t current = annotations_->generation();
+    for (size_t i = 0; i < plugIns.size(); ++i) {
+      EkDPlugIn::AnnotationNote note = plugIns[i]->annotationNote();
+      if (note.generation != current) {
+        const Dictionary* annotation = annotations_->findAnnotation(plugIns[i]->annotationKey());
+        note.generation = current;
+        note.encoded =
+            annotation
+                ? std::make_shared<const std::vector<uint8_t>>(cbor::encode(Value(*annotation)))
+                : kNone;
+        plugIns[i]->setAnnotationNote(note);
+      }
+      encoded[i] = std::move(note.encoded);
     }
   });
-  return annotations;
+  return encoded;
 }
 
 void EkDatabase::setAnnotation(const std::optional<Dictionary>& annotation,

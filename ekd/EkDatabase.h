@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -89,9 +90,13 @@ class EkDatabase : public vantor::RegistryObserver {
   std::optional<EkError> removePlugIn(std::string_view url);
 
   std::optional<Dictionary> annotationForPlugIn(const EkDPlugIn& plugIn);
-  // The same for each of plugIns, in one visit to the queue.
-  std::vector<std::optional<Dictionary>> annotationsForPlugIns(
-      const std::vector<const EkDPlugIn*>& plugIns);
+  // The annotation of each of plugIns as a reply carries it: a CBOR map, empty for none. All
+  // of them are as the store held them at one moment, after every change made before the
+  // call. Records keep what was read (EkDPlugIn::AnnotationNote), so while the store does not
+  // change, this neither enters the queue nor looks anything up.
+  using EncodedAnnotation = std::shared_ptr<const std::vector<uint8_t>>;
+  std::vector<EncodedAnnotation> encodedAnnotationsForPlugIns(
+      std::span<const EkDPlugIn* const> plugIns);
   // Merges (or, when absent, removes) and saves at once. Posts nothing: the request handlers
   // post once for all their changes with notifyAnnotationChange.
   void setAnnotation(const std::optional<Dictionary>& annotation, const EkDPlugIn& plugIn);

@@ -7,8 +7,10 @@
 #include <future>
 #include <memory>
 #include <string>
+#include <thread>
 #include <vector>
 
+#include "platform/cbor/Cbor.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/log/Log.h"
 #include "platform/vantor/FakeRegistry.h"
@@ -389,6 +391,96 @@ TEST_F(DatabaseTest, AnnotationsMergeThroughTheDatabaseAndPostOnlyWhenAsked) {
   EXPECT_EQ(notifier_->count("com.corvane.ekora.annotation-change"), 1u);
   database_->setAnnotation(std::nullopt, *plugIn);
   EXPECT_EQ(database_->annotationForPlugIn(*plugIn), std::nullopt);
+}
+
+// The annotations a reply carries encoded, which records keep between replies.
+Dictionary decodedAnnotation(const EkDatabase::EncodedAnnotation& encoded) {
+  if (!encoded) return Dictionary{{"missing", Value(true)}};
+  Result<Value> value = cbor::decode(*encoded);
+  if (!value.ok() || !value->dictionary()) return Dictionary{{"undecodable", Value(true)}};
+  return *value->dictionary();
+}
+
+TEST_F(DatabaseTest, EncodedAnnotationsFollowEveryChangeOfTheStore) {
+  auto original = database_->findPlugIn(install("com.example.shared").uuid);
+  // Files its annotations under the identifier it replaces: one entry for both records.
+  auto replacement = database_->findPlugIn(
+      install("com.example.replacement",
+              Dictionary{{std::string(kReplacePlugIn), Value("com.example.shared")}})
+          .uuid);
+  auto other = database_->findPlugIn(install("com.example.other").uuid);
+  ASSERT_TRUE(original && replacement && other);
+  const std::vector<const EkDPlugIn*> records = {original.get(), replacement.get(), other.get()};
+  auto annotations = [&] {
+    std::vector<Dictionary> decoded;
+    for (const auto& encoded : database_->encodedAnnotationsForPlugIns(records)) {
+      decoded.push_back(decodedAnnotation(encoded));
+    }
+    return decoded;
+  };
+  const Dictionary none;
+  const Dictionary elected{{"election", Value(uint64_t{1})}};
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, none}));
+
+  // Through either record, and asked twice: the second answer comes from what was kept.
+  database_->setAnnotation(elected, *replacement);
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
+  database_->setAnnotation(std::nullopt, *original);
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, none}));
+
+  // Straight through the store, and by loading another file.
+  database_->databaseQueue()->sync(
+      [&] { database_->annotations().setAnnotation(elected, std::string("com.example.other")); });
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, elected}));
+  const std::string file = (directory_ / "Other").string();
+  Dictionary data{{"com.example.shared", Value(elected)}};
+  ASSERT_TRUE(dmap::writeFileAtomically(file, Value(Dictionary{{"version", Value(uint64_t{16})},
+                                                               {"data", Value(std::move(data))}}))
+                  .ok());
+  database_->databaseQueue()->sync(
+      [&] { ASSERT_TRUE(database_->annotations().loadDb(file).ok()); });
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
+}
+
+// One answer is one moment of the store: a writer numbering two plug-ins' annotations, first
+// then second, is never seen to have numbered the second further than the first.
+TEST_F(DatabaseTest, EncodedAnnotationsOfOneCallAreOneMomentOfTheStore) {
+  auto first = database_->findPlugIn(install("com.example.first").uuid);
+  auto second = database_->findPlugIn(install("com.example.second").uuid);
+  ASSERT_TRUE(first && second);
+  constexpr uint64_t kRounds = 300;
+  auto numbered = [](uint64_t n) { return Dictionary{{"n", Value(n)}}; };
+  auto numberOf = [](const Dictionary& annotation) -> uint64_t {
+    auto it = annotation.find("n");
+    return it == annotation.end() || !it->second.unsignedNumber() ? 0
+                                                                  : *it->second.unsignedNumber();
+  };
+  database_->beginAnnotationChanges();  // memory only: the rounds need not each reach the disk
+  std::atomic<bool> writing{true};
+  std::thread writer([&] {
+    for (uint64_t n = 1; n <= kRounds; ++n) {
+      database_->setAnnotation(numbered(n), *first);
+      database_->setAnnotation(numbered(n), *second);
+    }
+    writing = false;
+  });
+  const std::vector<const EkDPlugIn*> records = {first.get(), second.get()};
+  size_t reads = 0;
+  uint64_t torn = 0;
+  while (writing || reads == 0) {
+    auto encoded = database_->encodedAnnotationsForPlugIns(records);
+    const uint64_t firstNumber = numberOf(decodedAnnotation(encoded[0]));
+    const uint64_t secondNumber = numberOf(decodedAnnotation(encoded[1]));
+    if (secondNumber > firstNumber) ++torn;
+    ++reads;
+  }
+  writer.join();
+  database_->commitAnnotationChanges();
+  EXPECT_EQ(torn, 0u) << "of " << reads << " reads";
+  auto last = database_->encodedAnnotationsForPlugIns(records);
+  EXPECT_EQ(numberOf(decodedAnnotation(last[0])), kRounds);
+  EXPECT_EQ(numberOf(decodedAnnotation(last[1])), kRounds);
 }
 
 }  // namespace

@@ -55,8 +55,6 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   // until it answers false. True when every entry was resolved and accepted; on false a
   // failure reply has been sent, by the walk or by the step.
   bool processUuidList(const PlugInStep& step);
-  // Sets form["annotations"] to the plug-in's stored annotations (empty when it has none).
-  void addAnnotationForPlugIn(const EkDPlugIn& plugIn, Dictionary& form);
 
   // The member under key when it is an array / a dictionary; nullptr otherwise.
   const Array* arrayForKey(std::string_view key) const;

@@ -22,12 +22,6 @@ std::shared_ptr<EkDPlugIn> Transaction::findPlugInByPathURL(const std::string& t
   return server().findPlugInAtPath(url->string());
 }
 
-void Transaction::addAnnotationForPlugIn(const EkDPlugIn& plugIn, Dictionary& form) {
-  auto annotation = server().annotationForPlugIn(plugIn);
-  form.insert_or_assign(std::string(protocol::kAnnotations),
-                        Value(annotation ? std::move(*annotation) : Dictionary{}));
-}
-
 void Transaction::findPlugIn() {
   std::shared_ptr<EkDPlugIn> plugIn;
   if (const Value* uuids = request_.body.get(protocol::kUuids)) {
@@ -50,14 +44,17 @@ void Transaction::findPlugIn() {
     log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(),
                      *form->error);
   }
-  Dictionary added;
-  addAnnotationForPlugIn(*plugIn, added);
-  plugIn->augmentForm(added, *current);
+  const EkDPlugIn* record = plugIn.get();
+  EkDatabase::EncodedAnnotation annotation =
+      server().encodedAnnotationsForPlugIns({&record, 1}).front();
+  Dictionary members;
+  plugIn->augmentForm(members, *current);
   if (!EkDaemonClient::convertsToWyre(version())) {
     done();
     return;
   }
   doneWithEncoded(protocol::kMatches, [&](std::vector<uint8_t>& out) {
+    const EkDFormCache::Added added{*annotation, members};
     out.reserve(out.size() + EkDFormCache::sizeBound(*form, added));
     EkDFormCache::write(*form, added, out);
   });

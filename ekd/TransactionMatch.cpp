@@ -244,16 +244,12 @@ void Transaction::matchPlugIns() {
   }
 
   std::erase(results, nullptr);
+  std::vector<EkDatabase::EncodedAnnotation> annotations;
   {
     std::vector<const EkDPlugIn*> matched;
     matched.reserve(results.size());
     for (const MatchRef& result : results) matched.push_back(result->plugIn.get());
-    std::vector<std::optional<Dictionary>> annotations = database.annotationsForPlugIns(matched);
-    for (size_t i = 0; i < results.size(); ++i) {
-      results[i]->added.insert_or_assign(
-          std::string(protocol::kAnnotations),
-          Value(annotations[i] ? std::move(*annotations[i]) : Dictionary{}));
-    }
+    annotations = database.encodedAnnotationsForPlugIns(matched);
   }
   for (const MatchRef& replaced : results) {
     if (overrides.empty()) break;
@@ -284,14 +280,16 @@ void Transaction::matchPlugIns() {
     done();
     return;
   }
-  doneWithEncoded(protocol::kMatches, [&results](std::vector<uint8_t>& out) {
+  doneWithEncoded(protocol::kMatches, [&results, &annotations](std::vector<uint8_t>& out) {
     size_t bound = 9;
-    for (const MatchRef& result : results) {
-      bound += EkDFormCache::sizeBound(*result->form, result->added);
+    for (size_t i = 0; i < results.size(); ++i) {
+      bound += EkDFormCache::sizeBound(*results[i]->form, {*annotations[i], results[i]->added});
     }
     out.reserve(out.size() + bound);
     cbor::encodeArrayHead(results.size(), out);
-    for (const MatchRef& result : results) EkDFormCache::write(*result->form, result->added, out);
+    for (size_t i = 0; i < results.size(); ++i) {
+      EkDFormCache::write(*results[i]->form, {*annotations[i], results[i]->added}, out);
+    }
   });
 }
 
