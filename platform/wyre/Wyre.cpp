@@ -337,6 +337,7 @@ void Connection::enqueueOutput(std::vector<uint8_t> frame, bool answersRequest) 
   {
     std::lock_guard lock(outputMutex_);
     if (closed_) return;
+    size_t sent = 0;
     if (output_.empty() && !writing_) {
       // Nothing queued: write straight from this thread, saving a hop to the I/O thread.
       ssize_t n =
@@ -345,7 +346,7 @@ void Connection::enqueueOutput(std::vector<uint8_t> frame, bool answersRequest) 
       if (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR) {
         failNow = true;
       } else if (n > 0) {
-        frame.erase(frame.begin(), frame.begin() + n);
+        sent = static_cast<size_t>(n);
       }
     }
     // One frame of any size a frame may have is always taken: a large answer is not a peer
@@ -355,7 +356,9 @@ void Connection::enqueueOutput(std::vector<uint8_t> frame, bool answersRequest) 
       failNow = true;
     }
     if (!failNow) {
-      queuedBytes_ += frame.size();
+      queuedBytes_ += frame.size() - sent;
+      // Only a frame that starts an empty queue can have been partly sent.
+      if (output_.empty()) outputStart_ = sent;
       output_.push_back(std::move(frame));
       if (!writing_) writing_ = startWriter = true;
     }
@@ -374,6 +377,7 @@ void Connection::writeMore() {
     std::lock_guard lock(outputMutex_);
     if (closed_ || output_.empty()) {
       output_.clear();
+      outputStart_ = 0;
       queuedBytes_ = 0;
       writing_ = false;
       return;
@@ -381,6 +385,7 @@ void Connection::writeMore() {
     size_t count = std::min(output_.size(), kMaxGather);
     buffers.reserve(count);
     for (size_t i = 0; i < count; ++i) buffers.emplace_back(asio::buffer(output_[i]));
+    buffers.front() += outputStart_;
   }
   size_t count = buffers.size();
   asio::async_write(socket_, buffers,
@@ -391,6 +396,7 @@ void Connection::writeMore() {
                         for (size_t i = 0; i < count && !self->output_.empty(); ++i) {
                           self->output_.pop_front();
                         }
+                        self->outputStart_ = 0;
                         self->queuedBytes_ -= std::min(written, self->queuedBytes_);
                       }
                       if (ec) {

@@ -159,8 +159,10 @@ class Connection : public std::enable_shared_from_this<Connection> {
   // no thread writes to a descriptor number that has been reused.
   mutable std::mutex outputMutex_;
   std::deque<std::vector<uint8_t>> output_;  // guarded by outputMutex_
-  size_t queuedBytes_ = 0;                   // guarded by outputMutex_
-  bool writing_ = false;                     // a writer owns the socket; guarded by outputMutex_
+  // Bytes of output_.front() written already: the rest of a large reply is not moved down.
+  size_t outputStart_ = 0;  // guarded by outputMutex_
+  size_t queuedBytes_ = 0;  // guarded by outputMutex_
+  bool writing_ = false;    // a writer owns the socket; guarded by outputMutex_
 
   std::atomic<size_t> unanswered_{0};
   std::atomic<bool> closed_{false};
