@@ -1,12 +1,13 @@
+// SHA256_Init and its kin are deprecated in favour of the EVP interface; see KeyedSha256.
+#define OPENSSL_SUPPRESS_DEPRECATED
+
 #include "Ekora/EkSandbox.h"
 
 #include <fmt/format.h>
 #include <limits.h>
-#include <openssl/core_names.h>
 #include <openssl/crypto.h>
-#include <openssl/evp.h>
-#include <openssl/params.h>
 #include <openssl/rand.h>
+#include <openssl/sha.h>
 #include <pthread.h>
 #include <stdlib.h>
 #include <sys/stat.h>
@@ -119,57 +120,57 @@ std::optional<uint32_t> parseFlags(std::string_view text) {
   return value;
 }
 
-// A MAC context keyed once per thread and key: the one-shot HMAC() looks up the algorithm and
-// sets the key up again for every tag, which dominated issuing the hundreds of tokens of one
-// match reply. Each tag starts the keyed context afresh, keeping the key's prepared state.
-class KeyedMac {
+// HMAC-SHA256 with the key's two padded states prepared once per thread and key. OpenSSL's
+// digest and MAC contexts allocate a fresh algorithm context for every copy of a prepared
+// state, two per tag: for the hundreds of tokens of one match reply those allocations cost
+// more than the hashing. The plain SHA-256 state is a value that copies without allocating,
+// which is why this one translation unit uses OpenSSL's low-level digest interface.
+class KeyedSha256 {
  public:
-  ~KeyedMac() { reset(); }
-  // The context ready for a new tag under key, or nullptr.
-  EVP_MAC_CTX* contextFor(const EkSandboxKey& key) {
-    if (keyed_ && key_ == key) {
-      if (EVP_MAC_init(keyed_, nullptr, 0, nullptr) == 1) return keyed_;
-    }
-    reset();
-    mac_ = EVP_MAC_fetch(nullptr, "HMAC", nullptr);
-    if (mac_ == nullptr) return nullptr;
-    keyed_ = EVP_MAC_CTX_new(mac_);
-    char digest[] = "SHA256";
-    OSSL_PARAM params[] = {OSSL_PARAM_construct_utf8_string("digest", digest, 0),
-                           OSSL_PARAM_construct_end()};
-    if (keyed_ == nullptr || EVP_MAC_init(keyed_, key.data(), key.size(), params) != 1) {
-      reset();
-      return nullptr;
-    }
-    key_ = key;
-    return keyed_;
+  static_assert(kSandboxKeySize <= SHA256_CBLOCK, "a longer key would be hashed first");
+
+  ~KeyedSha256() { OPENSSL_cleanse(this, sizeof(*this)); }
+
+  std::array<uint8_t, sandbox::kTagSize> tag(const EkSandboxKey& key, std::string_view message) {
+    if (!prepared_ || key_ != key) prepare(key);
+    static_assert(sandbox::kTagSize == SHA256_DIGEST_LENGTH);
+    std::array<uint8_t, SHA256_DIGEST_LENGTH> inner;
+    std::array<uint8_t, sandbox::kTagSize> tag;
+    SHA256_CTX context = inner_;
+    SHA256_Update(&context, message.data(), message.size());
+    SHA256_Final(inner.data(), &context);
+    context = outer_;
+    SHA256_Update(&context, inner.data(), inner.size());
+    SHA256_Final(tag.data(), &context);
+    OPENSSL_cleanse(&context, sizeof(context));
+    return tag;
   }
 
  private:
-  void reset() {
-    EVP_MAC_CTX_free(keyed_);
-    EVP_MAC_free(mac_);
-    keyed_ = nullptr;
-    mac_ = nullptr;
-    OPENSSL_cleanse(key_.data(), key_.size());
+  void prepare(const EkSandboxKey& key) {
+    std::array<uint8_t, SHA256_CBLOCK> pad{};
+    std::copy(key.begin(), key.end(), pad.begin());
+    for (uint8_t& byte : pad) byte ^= 0x36;
+    SHA256_Init(&inner_);
+    SHA256_Update(&inner_, pad.data(), pad.size());
+    for (uint8_t& byte : pad) byte ^= 0x36 ^ 0x5c;
+    SHA256_Init(&outer_);
+    SHA256_Update(&outer_, pad.data(), pad.size());
+    OPENSSL_cleanse(pad.data(), pad.size());
+    key_ = key;
+    prepared_ = true;
   }
-  EVP_MAC* mac_ = nullptr;
-  EVP_MAC_CTX* keyed_ = nullptr;
+
+  SHA256_CTX inner_;
+  SHA256_CTX outer_;
   EkSandboxKey key_{};
+  bool prepared_ = false;
 };
 
-std::optional<std::array<uint8_t, sandbox::kTagSize>> computeTag(const EkSandboxKey& key,
-                                                                 std::string_view message) {
-  thread_local KeyedMac keyed;
-  EVP_MAC_CTX* context = keyed.contextFor(key);
-  if (context == nullptr) return std::nullopt;
-  std::array<uint8_t, sandbox::kTagSize> tag;
-  size_t length = 0;
-  bool ok = EVP_MAC_update(context, reinterpret_cast<const unsigned char*>(message.data()),
-                           message.size()) == 1 &&
-            EVP_MAC_final(context, tag.data(), &length, tag.size()) == 1 && length == tag.size();
-  if (!ok) return std::nullopt;
-  return tag;
+std::array<uint8_t, sandbox::kTagSize> computeTag(const EkSandboxKey& key,
+                                                  std::string_view message) {
+  thread_local KeyedSha256 keyed;
+  return keyed.tag(key, message);
 }
 
 // The grant a token carries when its form is right and its tag verifies.
@@ -198,7 +199,7 @@ std::optional<EkSandboxGrant> verify(std::string_view token, const EkSandboxKey&
 
   const std::string_view message = token.substr(0, token.size() - tagHex.size() - 1);
   const auto expected = computeTag(key, message);
-  if (!expected || CRYPTO_memcmp(expected->data(), tag->data(), expected->size()) != 0) {
+  if (CRYPTO_memcmp(expected.data(), tag->data(), expected.size()) != 0) {
     return std::nullopt;
   }
   return EkSandboxGrant{std::string(extensionClass), *flags, std::move(*subject)};
@@ -256,15 +257,18 @@ Result<std::string> EkSandbox::issue(std::string_view extensionClass, uint32_t f
   std::string token;
   token.reserve(extensionClass.size() + 16 +
                 2 * (subject.size() + nonce.size() + sandbox::kTagSize));
-  fmt::format_to(std::back_inserter(token), "{}{}{}{}", extensionClass, kSeparator, flags,
-                 kSeparator);
+  token.append(extensionClass);
+  token.push_back(kSeparator);
+  std::array<char, kMaxFlagsDigits> digits;
+  token.append(digits.data(),
+               std::to_chars(digits.data(), digits.data() + digits.size(), flags).ptr);
+  token.push_back(kSeparator);
   appendHex(token, subject);
   token.push_back(kSeparator);
   appendHex(token, asText(nonce.data(), nonce.size()));
   const auto tag = computeTag(*key, token);
-  if (!tag) return EkError::posix(EIO, "cannot compute an extension tag");
   token.push_back(kSeparator);
-  appendHex(token, asText(tag->data(), tag->size()));
+  appendHex(token, asText(tag.data(), tag.size()));
   return token;
 }
 

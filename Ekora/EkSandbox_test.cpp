@@ -1,6 +1,7 @@
 #include "Ekora/EkSandbox.h"
 
 #include <gtest/gtest.h>
+#include <openssl/evp.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -128,6 +129,35 @@ TEST_F(EkSandboxTest, ServiceTokenRoundTrips) {
   EXPECT_EQ(sandbox_.grant(handle)->extensionClass, sandbox::kPlugInServiceClass);
   EXPECT_EQ(sandbox_.grant(handle)->subject, "com.example.viewer.thumbs");
   EXPECT_EQ(sandbox_.grant(handle)->flags, 0u);
+}
+
+// The tag is plain HMAC-SHA256 of everything before it, as outside tools verify it; tokens under
+// two keys alternate so that each thread's prepared key state is set up again each time.
+TEST_F(EkSandboxTest, TagIsTheStandardHmacOfTheRestUnderEachKey) {
+  EkSandbox other{std::make_shared<EkSandboxMemoryKeySource>(keyOf(0xc3))};
+  for (int round = 0; round < 3; ++round) {
+    for (auto [sandbox, fill] : {std::pair{&sandbox_, 0x5a}, std::pair{&other, 0xc3}}) {
+      // Subjects around the 64-byte block edges of the message.
+      const std::string subject =
+          "com.example." + std::string(static_cast<size_t>(round) * 23, 'x');
+      Result<std::string> token =
+          sandbox->issueServiceExtension(sandbox::kPlugInServiceClass, subject, 7);
+      ASSERT_TRUE(token.ok());
+      const size_t cut = token->rfind(';');
+      const std::string message = token->substr(0, cut);
+      const EkSandboxKey key = keyOf(static_cast<uint8_t>(fill));
+      unsigned char expected[EVP_MAX_MD_SIZE];
+      size_t length = 0;
+      ASSERT_NE(EVP_Q_mac(nullptr, "HMAC", nullptr, "SHA256", nullptr, key.data(), key.size(),
+                          reinterpret_cast<const unsigned char*>(message.data()), message.size(),
+                          expected, sizeof(expected), &length),
+                nullptr);
+      EXPECT_EQ(token->substr(cut + 1),
+                hexOf(std::string_view(reinterpret_cast<const char*>(expected), length)))
+          << "round " << round << ", key " << fill;
+      EXPECT_GT(sandbox->consume(*token), 0);
+    }
+  }
 }
 
 // Nonces come from blocks of random bytes drawn ahead: many issues span several blocks, and a
