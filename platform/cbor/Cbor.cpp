@@ -2,6 +2,7 @@
 
 #include <cbor.h>
 
+#include <algorithm>
 #include <cassert>
 #include <cfloat>
 #include <cmath>
@@ -329,11 +330,17 @@ struct Frame {
   std::string text;  // indefinite text string, or the pending key of a map
   bool haveKey = false;
   Data bytes;
+  // Checked like any other item but not built (decodeEntries).
+  bool discard = false;
 };
 
 class Decoder {
  public:
   explicit Decoder(std::span<const uint8_t> input) : input_(input) {}
+  // Builds of the top-level map only the entries under keys; everything else is checked and
+  // dropped.
+  Decoder(std::span<const uint8_t> input, std::span<const std::string_view> keys)
+      : input_(input), skim_(true), keys_(keys) {}
 
   Result<Value> run() {
     while (!root_) {
@@ -375,6 +382,21 @@ class Decoder {
     }
   }
 
+  // Whether the item that starts next is dropped rather than built.
+  bool discardingNext() const {
+    if (!skim_ || stack_.empty()) return false;
+    const Frame& frame = stack_.back();
+    // A tag's content is built: checking it needs its value, and it is small.
+    if (frame.kind == Frame::Kind::Tag) return false;
+    if (frame.discard) return true;
+    if (stack_.size() > 1) return false;  // inside a kept entry
+    if (frame.kind == Frame::Kind::Map) {
+      return frame.haveKey &&
+             std::find(keys_.begin(), keys_.end(), std::string_view(frame.text)) == keys_.end();
+    }
+    return frame.kind == Frame::Kind::Array;
+  }
+
   Result<void> handle(const Token& t) {
     Frame* frame = top();
     // Inside an indefinite string only definite chunks of the same major type and break.
@@ -386,42 +408,46 @@ class Decoder {
       return EkError::format("CBOR map key is not a text string");
     }
     if (frame && frame->kind == Frame::Kind::Tag) EK_TRY(checkTagContent(*frame, t));
+    const bool discard = discardingNext();
 
     switch (t.event) {
       case Event::Unsigned:
         beginItem();
-        return deliver(Value(t.number));
+        return discard ? deliverNothing() : deliver(Value(t.number));
       case Event::Negative:
         if (t.number > static_cast<uint64_t>(std::numeric_limits<int64_t>::max())) {
           return EkError::format("CBOR negative integer is below the 64-bit range");
         }
         beginItem();
-        return deliver(Value(-1 - static_cast<int64_t>(t.number)));
+        return discard ? deliverNothing() : deliver(Value(-1 - static_cast<int64_t>(t.number)));
       case Event::Float:
         beginItem();
-        return deliver(Value(t.real));
+        return discard ? deliverNothing() : deliver(Value(t.real));
       case Event::Bool:
         beginItem();
-        return deliver(Value(t.flag));
+        return discard ? deliverNothing() : deliver(Value(t.flag));
       case Event::Bytes:
         beginItem();
-        return deliver(Value(Data(t.bytes, t.bytes + t.size)));
+        return discard ? deliverNothing() : deliver(Value(Data(t.bytes, t.bytes + t.size)));
       case Event::Text:
         if (!isValidUtf8(t.bytes, t.size)) return EkError::format("CBOR text string is not UTF-8");
         beginItem();
-        return deliver(Value(std::string(reinterpret_cast<const char*>(t.bytes), t.size)));
+        return discard
+                   ? deliverNothing()
+                   : deliver(Value(std::string(reinterpret_cast<const char*>(t.bytes), t.size)));
       case Event::BytesStart:
       case Event::TextStart:
         beginItem();
         stack_.push_back(
             Frame{t.event == Event::TextStart ? Frame::Kind::Text : Frame::Kind::Bytes});
         stack_.back().indefinite = true;
+        stack_.back().discard = discard;
         return {};
       case Event::ArrayStart:
       case Event::MapStart:
       case Event::IndefiniteArrayStart:
       case Event::IndefiniteMapStart:
-        return openContainer(t);
+        return openContainer(t, discard);
       case Event::Tag:
         if (t.number != kTagUuid && t.number != kTagEpochDate) {
           return EkError::format("CBOR tag " + std::to_string(t.number) + " is not supported");
@@ -429,6 +455,7 @@ class Decoder {
         beginItem();
         stack_.push_back(Frame{Frame::Kind::Tag});
         stack_.back().tag = t.number;
+        stack_.back().discard = discard;
         return {};
       case Event::Null:
         return EkError::format("CBOR null has no counterpart in the value model");
@@ -441,7 +468,7 @@ class Decoder {
     return EkError::format("CBOR item is malformed");
   }
 
-  Result<void> openContainer(const Token& t) {
+  Result<void> openContainer(const Token& t, bool discard) {
     if (containerDepth_ >= kMaxDepth) {
       return EkError::format("CBOR item is nested deeper than " + std::to_string(kMaxDepth) +
                              " levels");
@@ -452,6 +479,7 @@ class Decoder {
     beginItem();
     Frame frame{isMap ? Frame::Kind::Map : Frame::Kind::Array};
     frame.indefinite = indefinite;
+    frame.discard = discard;
     if (!indefinite) {
       // Each item takes at least one byte, and so does every item still owed to the enclosing
       // containers: a count beyond that cannot be honest, and is refused before anything is
@@ -466,7 +494,7 @@ class Decoder {
       }
       frame.remaining = items;
       pending_ += items;
-      if (!isMap) frame.array.reserve(items);
+      if (!isMap && !discard) frame.array.reserve(items);
     }
     ++containerDepth_;
     stack_.push_back(std::move(frame));
@@ -492,6 +520,10 @@ class Decoder {
 
   Result<void> handleChunk(Frame& frame, const Token& t) {
     if (t.event == Event::Break) {
+      if (frame.discard) {
+        stack_.pop_back();
+        return deliverNothing();
+      }
       Value value = frame.kind == Frame::Kind::Text ? Value(std::move(frame.text))
                                                     : Value(std::move(frame.bytes));
       stack_.pop_back();
@@ -502,13 +534,13 @@ class Decoder {
         return EkError::format("CBOR indefinite text string holds something other than text");
       }
       if (!isValidUtf8(t.bytes, t.size)) return EkError::format("CBOR text string is not UTF-8");
-      frame.text.append(reinterpret_cast<const char*>(t.bytes), t.size);
+      if (!frame.discard) frame.text.append(reinterpret_cast<const char*>(t.bytes), t.size);
       return {};
     }
     if (t.event != Event::Bytes) {
       return EkError::format("CBOR indefinite byte string holds something other than bytes");
     }
-    frame.bytes.insert(frame.bytes.end(), t.bytes, t.bytes + t.size);
+    if (!frame.discard) frame.bytes.insert(frame.bytes.end(), t.bytes, t.bytes + t.size);
     return {};
   }
 
@@ -524,6 +556,11 @@ class Decoder {
 
   Result<void> closeTop() {
     Frame& frame = stack_.back();
+    if (frame.discard) {
+      stack_.pop_back();
+      --containerDepth_;
+      return deliverNothing();
+    }
     Value value = frame.kind == Frame::Kind::Map ? Value(std::move(frame.dictionary))
                                                  : Value(std::move(frame.array));
     stack_.pop_back();
@@ -566,22 +603,39 @@ class Decoder {
     return {};
   }
 
+  // Accounts in the enclosing container for an item that was checked but not built.
+  Result<void> deliverNothing() {
+    Frame& frame = stack_.back();  // the root is never dropped
+    assert((frame.kind == Frame::Kind::Array || frame.kind == Frame::Kind::Map) &&
+           "only container members are dropped");
+    if (frame.kind == Frame::Kind::Map) {
+      // A dropped key belongs to a dropped map; a dropped value ends its entry.
+      frame.haveKey = !frame.haveKey;
+      if (!frame.haveKey) frame.text.clear();
+    }
+    if (!frame.indefinite && frame.remaining == 0) return closeTop();
+    return {};
+  }
+
   Result<void> deliverTagged(Value value) {
-    uint64_t tag = stack_.back().tag;
+    const uint64_t tag = stack_.back().tag;
+    const bool discard = stack_.back().discard;
     stack_.pop_back();
     if (tag == kTagUuid) {
       const Data* bytes = value.data();
       if (!bytes || bytes->size() != kUuidSize) {
         return EkError::format("CBOR tag 37 must wrap a 16-byte byte string");
       }
-      return deliver(Value(Uuid::fromBytes(bytes->data())));
+      return discard ? deliverNothing() : deliver(Value(Uuid::fromBytes(bytes->data())));
     }
     std::optional<double> seconds = value.numericValue();
     assert(seconds && "checkTagContent admits only numbers");
-    return deliver(Value(Date{*seconds}));
+    return discard ? deliverNothing() : deliver(Value(Date{*seconds}));
   }
 
   std::span<const uint8_t> input_;
+  const bool skim_ = false;
+  const std::span<const std::string_view> keys_;
   size_t position_ = 0;
   std::vector<Frame> stack_;
   size_t containerDepth_ = 0;
@@ -623,6 +677,15 @@ size_t encodedSizeBound(const Value& value) {
 Result<Value> decode(std::span<const uint8_t> bytes) {
   if (bytes.empty()) return EkError::format("CBOR item is empty");
   return Decoder(bytes).run();
+}
+
+Result<Dictionary> decodeEntries(std::span<const uint8_t> bytes,
+                                 std::span<const std::string_view> keys) {
+  if (bytes.empty()) return EkError::format("CBOR item is empty");
+  Result<Value> root = Decoder(bytes, keys).run();
+  if (!root) return root.error();
+  Dictionary* entries = root->getIf<Dictionary>();
+  return entries ? std::move(*entries) : Dictionary{};
 }
 
 }  // namespace ek::cbor

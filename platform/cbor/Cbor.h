@@ -37,4 +37,12 @@ size_t encodedSizeBound(const Value& value);
 // simple values, other tags, duplicate map keys and text that is not UTF-8 are refused.
 Result<Value> decode(std::span<const uint8_t> bytes);
 
+// Checks bytes as decode does but builds only the entries of the top-level map whose keys are
+// among keys, and answers those (none when the item is not a map). For a reader that needs a
+// few members of a large message, such as the error of a reply. Repeated map keys are looked
+// for only among the entries answered: where decode refuses nothing else, this answers
+// decode's entries under keys.
+Result<Dictionary> decodeEntries(std::span<const uint8_t> bytes,
+                                 std::span<const std::string_view> keys);
+
 }  // namespace ek::cbor

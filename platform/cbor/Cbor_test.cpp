@@ -4,6 +4,7 @@
 
 #include <cmath>
 #include <limits>
+#include <span>
 #include <string>
 
 namespace ek::cbor {
@@ -351,6 +352,95 @@ TEST(Cbor, TaggedLeavesDoNotCountTowardTheDepthLimit) {
   auto decoded = decode(encode(leaf));
   ASSERT_TRUE(decoded.ok()) << decoded.error().message;
   EXPECT_EQ(*decoded, leaf);
+}
+
+// --- decodeEntries: a few members of a message, the rest checked but not built ---
+
+Dictionary only(const Dictionary& all, std::span<const std::string_view> keys) {
+  Dictionary kept;
+  for (std::string_view key : keys) {
+    auto it = all.find(key);
+    if (it != all.end()) kept.insert(*it);
+  }
+  return kept;
+}
+
+TEST(CborEntries, AnswersWhatDecodeDecodesUnderTheKeysAlone) {
+  // Every form decode knows, each under its own name, the foreign ones as they were written.
+  std::vector<std::pair<std::string, std::string>> members;
+  for (const Known& known : knownEncodings()) members.emplace_back(known.name, known.hex);
+  members.emplace_back("indefiniteMap", "bf61610161629f0203ffff");
+  members.emplace_back("indefiniteText", "7f657374726561646d696e67ff");
+  members.emplace_back("uuidFromIndefiniteBytes", "d8255f4810e621e1f8c36c49485a593fc0c247a3e6ff");
+  members.emplace_back("halfDate", "c1f93e00");
+  members.emplace_back("nested", "a2616182a0bf6162f5ff6163c1f93e00");
+  std::vector<uint8_t> bytes;
+  encodeMapHead(members.size(), bytes);
+  for (const auto& [name, hex] : members) {
+    encodeText(name, bytes);
+    std::vector<uint8_t> item = fromHex(hex);
+    bytes.insert(bytes.end(), item.begin(), item.end());
+  }
+  auto all = decode(bytes);
+  ASSERT_TRUE(all.ok()) << all.error().message;
+  ASSERT_EQ(all->dictionary()->size(), members.size());
+
+  std::vector<std::string_view> even, odd;
+  for (size_t i = 0; i < members.size(); ++i) (i % 2 ? odd : even).push_back(members[i].first);
+  const std::string_view absent[] = {"absent", "nested"};
+  for (std::span<const std::string_view> keys :
+       {std::span<const std::string_view>(even), std::span<const std::string_view>(odd),
+        std::span<const std::string_view>(absent), std::span<const std::string_view>()}) {
+    auto entries = decodeEntries(bytes, keys);
+    ASSERT_TRUE(entries.ok()) << entries.error().message;
+    EXPECT_EQ(*entries, only(*all->dictionary(), keys));
+  }
+}
+
+TEST(CborEntries, RefusesWhatDecodeRefusesInTheMembersItDoesNotBuild) {
+  const std::string_view kept[] = {"kept"};
+  for (const Refusal& refusal : refusals()) {
+    if (refusal.hex.empty()) continue;
+    // {"kept": 1, "dropped": refusal} and {"kept": 1, "dropped": [refusal]}
+    for (const std::string& wrapped : {refusal.hex, "81" + refusal.hex}) {
+      std::vector<uint8_t> bytes = fromHex(
+          "a2646b65707401"
+          "6764726f70706564" +
+          wrapped);
+      auto entries = decodeEntries(bytes, kept);
+      if (std::string_view(refusal.name).starts_with("duplicateKey")) {
+        // Repeated keys are only looked for in what is built.
+        ASSERT_TRUE(entries.ok()) << refusal.name << ": " << entries.error().message;
+        EXPECT_EQ(*entries, (Dictionary{{"kept", 1}})) << refusal.name;
+        continue;
+      }
+      ASSERT_FALSE(entries.ok()) << refusal.name << " in " << wrapped;
+      EXPECT_EQ(entries.error().domain, kFormatErrorDomain) << refusal.name;
+      EXPECT_NE(entries.error().message.find(refusal.message), std::string::npos)
+          << refusal.name << ": " << entries.error().message;
+    }
+  }
+  // A key repeated among the entries built is refused as decode refuses it.
+  const std::string_view a[] = {"a"};
+  auto repeated = decodeEntries(fromHex("a2616101616102"), a);
+  ASSERT_FALSE(repeated.ok());
+  EXPECT_NE(repeated.error().message.find("repeats the key \"a\""), std::string::npos);
+  // Nesting is bounded in what is dropped too.
+  std::vector<uint8_t> deep = fromHex("a1616b");
+  std::vector<uint8_t> arrays = nestedArrays(kMaxDepth, false);
+  deep.insert(deep.end(), arrays.begin(), arrays.end());
+  auto tooDeep = decodeEntries(deep, a);
+  ASSERT_FALSE(tooDeep.ok());
+  EXPECT_NE(tooDeep.error().message.find("deeper than 512"), std::string::npos);
+}
+
+TEST(CborEntries, AnythingButAMapHasNoEntries) {
+  const std::string_view a[] = {"a"};
+  for (const char* hex : {"81a1616101", "9fa1616101ff", "01", "6161", "c11a514b67b0"}) {
+    auto entries = decodeEntries(fromHex(hex), a);
+    ASSERT_TRUE(entries.ok()) << hex << ": " << entries.error().message;
+    EXPECT_TRUE(entries->empty()) << hex;
+  }
 }
 
 }  // namespace
