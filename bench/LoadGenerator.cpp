@@ -25,19 +25,30 @@ using Clock = std::chrono::steady_clock;
 enum class Outcome { Reply, ErrorReply, Failure };
 
 // The error of a reply whose "errorcode", its low 32 bits read as a signed code, is not zero.
-std::optional<std::string> replyError(const Value& reply) {
-  const Value* code = reply.get(protocol::kErrorCode);
-  if (code == nullptr) return std::nullopt;
+std::optional<std::string> replyError(const Dictionary& reply) {
+  auto code = reply.find(protocol::kErrorCode);
+  if (code == reply.end()) return std::nullopt;
   int32_t signedCode = 0;
-  if (const uint64_t* number = code->unsignedNumber()) {
+  if (const uint64_t* number = code->second.unsignedNumber()) {
     signedCode = static_cast<int32_t>(static_cast<uint32_t>(*number));
-  } else if (const int64_t* negative = code->negativeNumber()) {
+  } else if (const int64_t* negative = code->second.negativeNumber()) {
     signedCode = static_cast<int32_t>(*negative);
   }
   if (signedCode == 0) return std::nullopt;
-  const std::string* text = reply.getString(protocol::kError);
-  return text ? fmt::format("error {}: {}", signedCode, *text)
-              : fmt::format("error {}", signedCode);
+  auto text = reply.find(protocol::kError);
+  const std::string* message = text == reply.end() ? nullptr : text->second.string();
+  return message ? fmt::format("error {}: {}", signedCode, *message)
+                 : fmt::format("error {}", signedCode);
+}
+
+// The members replyError reads, of a reply decoded as options ask.
+Result<Dictionary> replyMembers(std::span<const uint8_t> body, bool whole) {
+  static constexpr std::string_view kErrorKeys[] = {protocol::kErrorCode, protocol::kError};
+  if (!whole) return cbor::decodeEntries(body, kErrorKeys);
+  Result<Value> reply = cbor::decode(body);
+  if (!reply) return reply.error();
+  Dictionary* members = reply->getIf<Dictionary>();
+  return members ? std::move(*members) : Dictionary{};
 }
 
 const char* describe(FrameReader::Status status) {
@@ -90,7 +101,7 @@ struct Worker {
   }
 
   Outcome roundTrip(Clock::time_point& sent, Clock::time_point& received,
-                    std::chrono::milliseconds timeout) {
+                    std::chrono::milliseconds timeout, bool decodeReplies) {
     uint64_t id = nextId++;
     if (bodies.size() > 1) {
       const std::vector<uint8_t>& body = bodies[next];
@@ -122,7 +133,7 @@ struct Worker {
       fail(fmt::format("reply carries id {}, expected {}", header.id, id));
       return Outcome::Failure;
     }
-    Result<Value> reply = cbor::decode(body);
+    Result<Dictionary> reply = replyMembers(body, decodeReplies);
     if (!reply) {
       fail("undecodable reply: " + reply.error().message);
       return Outcome::Failure;
@@ -146,7 +157,7 @@ struct Worker {
         break;
       }
       Clock::time_point sent, received;
-      Outcome outcome = roundTrip(sent, received, options.replyTimeout);
+      Outcome outcome = roundTrip(sent, received, options.replyTimeout, options.decodeReplies);
       // Failures count in the warm-up too: they say the figures cannot be trusted.
       if (outcome == Outcome::Failure) {
         disconnect();

@@ -249,18 +249,23 @@ TEST(LoadGeneratorTest, NonZeroErrorCodesAreErrorRepliesAndZeroIsNot) {
       {Value(Dictionary{{"matches", Array{}}}), false},
       {Value(Array{}), false},
   };
-  for (const auto& [reply, isError] : cases) {
-    std::vector<uint8_t> encoded = cbor::encode(reply);
-    auto server = startServer([&](wyre::FrameHeader&, std::vector<uint8_t>& body) {
-      body = encoded;
-      return Action::Reply;
-    });
-    ASSERT_TRUE(server);
-    LoadResult result = runOk(countedRun(*server, 5));
-    EXPECT_EQ(result.requests, 5u) << reply.description();
-    EXPECT_EQ(result.failures, 0u) << reply.description();
-    EXPECT_EQ(result.errorReplies, isError ? 5u : 0u) << reply.description();
-    EXPECT_EQ(result.firstError.empty(), !isError) << reply.description();
+  // Read from the error members alone, or from the whole reply built: the same verdicts.
+  for (bool decodeReplies : {false, true}) {
+    for (const auto& [reply, isError] : cases) {
+      std::vector<uint8_t> encoded = cbor::encode(reply);
+      auto server = startServer([&](wyre::FrameHeader&, std::vector<uint8_t>& body) {
+        body = encoded;
+        return Action::Reply;
+      });
+      ASSERT_TRUE(server);
+      LoadOptions options = countedRun(*server, 5);
+      options.decodeReplies = decodeReplies;
+      LoadResult result = runOk(options);
+      EXPECT_EQ(result.requests, 5u) << reply.description();
+      EXPECT_EQ(result.failures, 0u) << reply.description();
+      EXPECT_EQ(result.errorReplies, isError ? 5u : 0u) << reply.description();
+      EXPECT_EQ(result.firstError.empty(), !isError) << reply.description();
+    }
   }
 }
 
@@ -277,20 +282,30 @@ TEST(LoadGeneratorTest, BadRepliesAreFailuresNotRequests) {
        "undecodable reply"},
       {"empty body", [](wyre::FrameHeader&, std::vector<uint8_t>& b) { b.clear(); },
        "undecodable reply"},
+      // {"matches": ["\xff"]}: bad deep inside a member that only the whole decode builds.
+      {"text that is not UTF-8 in a large member",
+       [](wyre::FrameHeader&, std::vector<uint8_t>& b) {
+         b = {0xa1, 0x67, 'm', 'a', 't', 'c', 'h', 'e', 's', 0x81, 0x61, 0xff};
+       },
+       "undecodable reply"},
   };
-  for (const auto& [name, mutate, reason] : cases) {
-    auto server = startServer([&](wyre::FrameHeader& header, std::vector<uint8_t>& body) {
-      mutate(header, body);
-      return Action::Reply;
-    });
-    ASSERT_TRUE(server);
-    LoadResult result = runOk(countedRun(*server, 4));
-    EXPECT_EQ(result.requests, 0u) << name;
-    EXPECT_EQ(result.failures, 4u) << name;
-    EXPECT_TRUE(result.latenciesNs.empty()) << name;
-    EXPECT_EQ(result.firstFailure.rfind(reason, 0), 0u) << name << ": " << result.firstFailure;
-    // Every failure drops the connection, which may be out of step, and opens a new one.
-    EXPECT_EQ(server->accepted(), 4u) << name;
+  for (bool decodeReplies : {false, true}) {
+    for (const auto& [name, mutate, reason] : cases) {
+      auto server = startServer([&](wyre::FrameHeader& header, std::vector<uint8_t>& body) {
+        mutate(header, body);
+        return Action::Reply;
+      });
+      ASSERT_TRUE(server);
+      LoadOptions options = countedRun(*server, 4);
+      options.decodeReplies = decodeReplies;
+      LoadResult result = runOk(options);
+      EXPECT_EQ(result.requests, 0u) << name;
+      EXPECT_EQ(result.failures, 4u) << name;
+      EXPECT_TRUE(result.latenciesNs.empty()) << name;
+      EXPECT_EQ(result.firstFailure.rfind(reason, 0), 0u) << name << ": " << result.firstFailure;
+      // Every failure drops the connection, which may be out of step, and opens a new one.
+      EXPECT_EQ(server->accepted(), 4u) << name;
+    }
   }
 }
 

@@ -56,6 +56,7 @@ struct Options {
   bool echoSelfTest = false;
   bool json = false;
   bool encodeReply = false;
+  bool decodeReplies = false;
   std::string request;
   std::string requestsFile;
 };
@@ -340,6 +341,9 @@ int main(int argc, char** argv) {
                "the daemon's ratio to it")
       ->excludes(baseline)
       ->excludes(selfTest);
+  app.add_flag("--decode-replies", options.decodeReplies,
+               "build every reply whole in the value model, as a client would; by default only "
+               "a reply's error members are built and the rest is only checked");
   app.add_flag("--json", options.json, "print one JSON object");
   auto* requestsFile = app.add_option(
       "--requests", options.requestsFile,
@@ -428,6 +432,7 @@ int main(int argc, char** argv) {
       load.warmup = ek::bench::Seconds(options.warmup);
       load.duration = ek::bench::Seconds(options.duration);
       if (options.count) load.count = options.count;
+      load.decodeReplies = options.decodeReplies;
       load.replyTimeout = std::chrono::milliseconds(
           std::max<int64_t>(1, static_cast<int64_t>(options.timeout * 1000)));
       ek::Result<LoadResult> result =
