@@ -8,13 +8,19 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <pthread.h>
+
 #include <algorithm>
+#include <atomic>
 #include <cctype>
 #include <charconv>
+#include <condition_variable>
 #include <cstdlib>
+#include <limits>
 #include <map>
 #include <mutex>
 #include <optional>
+#include <thread>
 #include <vector>
 
 namespace ek::log {
@@ -179,11 +185,116 @@ void writeAll(int fd, std::string_view bytes) {
   }
 }
 
+// The process id, asked of the kernel once per process rather than once per line.
+std::atomic<int> gProcessId{0};
+
+int processId() {
+  int pid = gProcessId.load(std::memory_order_relaxed);
+  if (pid == 0) {
+    static std::once_flag atFork;
+    std::call_once(atFork, [] {
+      pthread_atfork(nullptr, nullptr, [] { gProcessId.store(0, std::memory_order_relaxed); });
+    });
+    pid = ::getpid();
+    gProcessId.store(pid, std::memory_order_relaxed);
+  }
+  return pid;
+}
+
+// Lines of standard error waiting to be written together (bufferLines). One writer thread
+// writes them every delay while lines come, and sleeps once a second has passed without any.
+class LineBuffer {
+ public:
+  static LineBuffer& shared() {
+    // Never destroyed: lines may still come from other threads while the process exits.
+    static LineBuffer* buffer = new LineBuffer;
+    return *buffer;
+  }
+
+  bool enabled() const { return enabled_.load(std::memory_order_acquire); }
+
+  void start(std::chrono::milliseconds delay) {
+    std::lock_guard lock(mutex_);
+    delay_ = std::max(delay, std::chrono::milliseconds(1));
+    if (enabled_.exchange(true, std::memory_order_acq_rel)) return;
+    std::thread([this] { run(); }).detach();
+    std::atexit([] { LineBuffer::shared().flush(); });
+  }
+
+  void add(const std::string& line, bool now) {
+    std::lock_guard lock(mutex_);
+    pending_ += line;
+    if (now || pending_.size() >= kMaxPending) {
+      writeLocked();
+    } else if (sleeping_) {
+      sleeping_ = false;
+      wake_.notify_one();
+    }
+  }
+
+  void flush() {
+    std::lock_guard lock(mutex_);
+    writeLocked();
+  }
+
+  void flushFromSignal() {
+    // The interrupted thread may hold the lines; they are then lost rather than the process
+    // hung.
+    if (!mutex_.try_lock()) return;
+    writeLocked();
+    mutex_.unlock();
+  }
+
+ private:
+  static constexpr size_t kMaxPending = 64 * 1024;
+
+  // Written under mutex_, so that batches never overtake one another.
+  void writeLocked() {
+    if (pending_.empty()) return;
+    writeAll(STDERR_FILENO, pending_);
+    pending_.clear();
+  }
+
+  void run() {
+    std::unique_lock lock(mutex_);
+    auto quietSince = std::chrono::steady_clock::now();
+    for (;;) {
+      if (pending_.empty() && std::chrono::steady_clock::now() - quietSince >= kQuietBeforeSleep) {
+        sleeping_ = true;
+        wake_.wait(lock, [this] { return !sleeping_; });
+      }
+      wake_.wait_for(lock, delay_);
+      if (!pending_.empty()) {
+        writeLocked();
+        quietSince = std::chrono::steady_clock::now();
+      }
+    }
+  }
+
+  static constexpr std::chrono::seconds kQuietBeforeSleep{1};
+
+  std::atomic<bool> enabled_{false};
+  std::mutex mutex_;
+  std::condition_variable wake_;
+  std::chrono::milliseconds delay_{10};
+  bool sleeping_ = false;
+  std::string pending_;
+};
+
 class StandardErrorSink : public Sink {
  public:
   void write(const Record& record) override {
-    writeAll(STDERR_FILENO, formatLine(record, std::chrono::system_clock::now(),
-                                       program_invocation_short_name, getpid()));
+    std::string line = formatLine(record, std::chrono::system_clock::now(),
+                                  program_invocation_short_name, processId());
+    LineBuffer& buffer = LineBuffer::shared();
+    if (buffer.enabled()) {
+      buffer.add(line, record.level == Level::Error);
+    } else {
+      writeAll(STDERR_FILENO, line);
+    }
+  }
+  void flush() override {
+    if (LineBuffer::shared().enabled()) LineBuffer::shared().flush();
   }
 };
 
@@ -210,6 +321,7 @@ class JournalSink : public Sink {
     }
     if (r < 0) fallback_.write(record);
   }
+  void flush() override { fallback_.flush(); }
 
  private:
   StandardErrorSink fallback_;
@@ -521,17 +633,47 @@ std::string formatLine(const Record& record, std::chrono::system_clock::time_poi
   auto sinceEpoch = when.time_since_epoch();
   auto secs = floor<seconds>(sinceEpoch);
   auto millis = duration_cast<milliseconds>(sinceEpoch - secs).count();
-  time_t t = static_cast<time_t>(secs.count());
-  struct tm tm {};
-  gmtime_r(&t, &tm);
-  char stamp[64];
-  size_t n = strftime(stamp, sizeof stamp, "%Y-%m-%dT%H:%M:%S", &tm);
-  std::string_view date(stamp, n);
-  if (record.subsystem.empty()) {
-    return fmt::format("{}.{:03}Z {}[{}]: {}\n", date, millis, program, pid, record.message);
+  // Lines come many to a second: the date part is worked out once per second and thread.
+  thread_local int64_t stampSecond = std::numeric_limits<int64_t>::min();
+  thread_local std::string stamp;
+  if (secs.count() != stampSecond) {
+    time_t t = static_cast<time_t>(secs.count());
+    struct tm tm {};
+    gmtime_r(&t, &tm);
+    char text[64];
+    stamp.assign(text, strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%S", &tm));
+    stampSecond = secs.count();
   }
-  return fmt::format("{}.{:03}Z {}[{}] {} {}:{}: {}\n", date, millis, program, pid,
-                     levelName(record.level), record.subsystem, record.category, record.message);
+  const std::string_view level = levelName(record.level);
+  std::string line;
+  line.reserve(stamp.size() + program.size() + level.size() + record.subsystem.size() +
+               record.category.size() + record.message.size() + 32);
+  line += stamp;
+  char number[24];
+  number[0] = '.';
+  number[1] = static_cast<char>('0' + millis / 100);
+  number[2] = static_cast<char>('0' + millis / 10 % 10);
+  number[3] = static_cast<char>('0' + millis % 10);
+  line.append(number, 4);
+  line += "Z ";
+  line += program;
+  line += '[';
+  line.append(number, std::to_chars(number, number + sizeof number, pid).ptr);
+  line += ']';
+  if (record.subsystem.empty()) {
+    line += ": ";
+  } else {
+    line += ' ';
+    line += level;
+    line += ' ';
+    line += record.subsystem;
+    line += ':';
+    line += record.category;
+    line += ": ";
+  }
+  line += record.message;
+  line += '\n';
+  return line;
 }
 
 Registry::Registry() {
@@ -547,6 +689,18 @@ Registry::Registry() {
 
 void setSink(std::shared_ptr<Sink> sink) {
   Registry::shared().setSink(std::move(sink));
+}
+
+void bufferLines(std::chrono::milliseconds delay) {
+  LineBuffer::shared().start(delay);
+}
+
+void flush() {
+  if (auto sink = Registry::shared().sink()) sink->flush();
+}
+
+void flushFromSignal() {
+  if (LineBuffer::shared().enabled()) LineBuffer::shared().flushFromSignal();
 }
 
 void configure(std::string_view levels) {

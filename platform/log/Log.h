@@ -94,11 +94,25 @@ class Sink {
  public:
   virtual ~Sink() = default;
   virtual void write(const Record& record) = 0;
+  // Writes whatever the sink holds back.
+  virtual void flush() {}
 };
 
 // Replaces where lines go (standard error or the journal by default). Tests install a
 // capturing sink; nullptr restores the default.
 void setSink(std::shared_ptr<Sink> sink);
+
+// From now on, lines to standard error below the error level may wait up to delay, so that a
+// busy process writes many lines with one write. An error line writes every line before it
+// at once, as do flush(), a backlog of 64 KiB and exit through std::exit; a process leaving
+// with _exit calls flush() first. Lines keep their order and their time of logging. The
+// journal takes each line as it comes.
+void bufferLines(std::chrono::milliseconds delay);
+// Writes every line that waits. Thread-safe.
+void flush();
+// flush() for a handler of a fatal signal: gives the waiting lines up rather than wait for a
+// thread that the signal may have stopped while it held them.
+void flushFromSignal();
 
 // Re-reads the enabled levels, written in EKORA_LOG's syntax
 // ("debug", "info", "ops:debug,vr:info"). The environment is read on first use.

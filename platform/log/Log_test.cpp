@@ -4,8 +4,12 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <sys/wait.h>
+
 #include <atomic>
+#include <cstdio>
 #include <cstdlib>
+#include <functional>
 #include <mutex>
 #include <optional>
 #include <thread>
@@ -384,6 +388,139 @@ TEST_F(StderrLogTest, DisabledLevelWritesNothing) {
   ops().debug("hidden %d", 1);
   vr().info("hidden");
   EXPECT_EQ(capture.finish(), "");
+}
+
+// --- bufferLines: held for the whole process, so each case runs in a child of its own ---
+
+// What a child wrote to its standard error (a pipe), and how it ended. The body answers 0, or
+// the number of the check that failed; it may read what has reached the pipe so far.
+struct ChildRun {
+  std::string written;
+  int status = -1;
+};
+
+ChildRun inChild(const std::function<int(int pipe)>& body) {
+  int fds[2];
+  if (pipe2(fds, O_CLOEXEC) != 0) return {};
+  fcntl(fds[1], F_SETPIPE_SZ, 1 << 20);  // room for a backlog the child reads itself
+  pid_t pid = fork();
+  if (pid == 0) {
+    dup2(fds[1], STDERR_FILENO);
+    close(fds[1]);
+    fcntl(fds[0], F_SETFL, O_NONBLOCK);
+    std::exit(body(fds[0]));  // through exit: what still waits is written by then
+  }
+  close(fds[1]);
+  // The child reads the same pipe: what is left is read once it has ended.
+  int status = 0;
+  waitpid(pid, &status, 0);
+  ChildRun run;
+  run.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  fcntl(fds[0], F_SETFL, O_NONBLOCK);
+  char buffer[4096];
+  for (ssize_t n; (n = read(fds[0], buffer, sizeof buffer)) > 0;)
+    run.written.append(buffer, size_t(n));
+  close(fds[0]);
+  return run;
+}
+
+// What has reached the pipe and not been read yet.
+std::string arrived(int pipe) {
+  std::string text;
+  char buffer[4096];
+  for (ssize_t n; (n = read(pipe, buffer, sizeof buffer)) > 0;) text.append(buffer, size_t(n));
+  return text;
+}
+
+// Whether line shows up in the pipe within five seconds.
+bool arrives(int pipe, std::string_view line) {
+  std::string text;
+  for (int i = 0; i < 500; ++i) {
+    text += arrived(pipe);
+    if (text.find(line) != std::string::npos) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return false;
+}
+
+bool inOrder(const std::string& text, std::initializer_list<std::string_view> parts) {
+  size_t at = 0;
+  for (std::string_view part : parts) {
+    at = text.find(part, at);
+    if (at == std::string::npos) return false;
+  }
+  return true;
+}
+
+TEST_F(StderrLogTest, BufferedLinesWaitUntilAnErrorAFlushOrExit) {
+  ChildRun run = inChild([](int pipe) {
+    bufferLines(std::chrono::hours(1));
+    ops().defaultLevel("first");
+    if (!arrived(pipe).empty()) return 1;
+    ops().error("second");
+    if (!inOrder(arrived(pipe), {"default com.corvane.Ekora:ops: first\n",
+                                 "error com.corvane.Ekora:ops: second\n"})) {
+      return 2;
+    }
+    process().defaultLevel("third");
+    if (!arrived(pipe).empty()) return 3;
+    flush();
+    if (arrived(pipe).find("]: third\n") == std::string::npos) return 4;
+    // A backlog is written without waiting for anything.
+    for (int i = 0; i < 80; ++i) ops().defaultLevel("%d %s", i, std::string(1000, 'x'));
+    std::string backlog = arrived(pipe);
+    if (backlog.size() < 64 * 1024 || !inOrder(backlog, {" 0 xxx", " 50 xxx"})) return 5;
+    flush();
+    arrived(pipe);
+    ops().defaultLevel("last, written at exit");
+    return 0;
+  });
+  EXPECT_EQ(run.status, 0);
+  EXPECT_NE(run.written.find("ops: last, written at exit\n"), std::string::npos) << run.written;
+}
+
+TEST_F(StderrLogTest, BufferedLinesAreWrittenAfterTheDelayEvenAfterAQuietSpell) {
+  ChildRun run = inChild([](int pipe) {
+    bufferLines(std::chrono::milliseconds(20));
+    ops().defaultLevel("soon");
+    if (!arrives(pipe, "soon\n")) return 1;
+    // Long enough for the writer to stop looking and sleep until the next line.
+    std::this_thread::sleep_for(std::chrono::milliseconds(1500));
+    ops().defaultLevel("after a quiet spell");
+    if (!arrives(pipe, "after a quiet spell\n")) return 2;
+    return 0;
+  });
+  EXPECT_EQ(run.status, 0) << run.written;
+}
+
+TEST_F(StderrLogTest, BufferedLinesOfConcurrentThreadsKeepTheirOrder) {
+  constexpr int kThreads = 8;
+  constexpr int kLines = 300;
+  ChildRun run = inChild([](int) {
+    bufferLines(std::chrono::milliseconds(5));
+    std::vector<std::jthread> threads;
+    for (int t = 0; t < kThreads; ++t) {
+      threads.emplace_back([t] {
+        for (int i = 0; i < kLines; ++i)
+          ops().defaultLevel("%d %d %s", t, i, std::string(100, 'y'));
+      });
+    }
+    return 0;
+  });
+  ASSERT_EQ(run.status, 0);
+  std::vector<int> seen(kThreads, 0);
+  for (const std::string& line : splitLines(run.written)) {
+    auto rest = afterTimeStamp(line);
+    ASSERT_TRUE(rest.has_value()) << line;
+    size_t colon = rest->find("ops: ");
+    ASSERT_NE(colon, std::string::npos) << line;
+    int t = -1, i = -1;
+    ASSERT_EQ(std::sscanf(rest->c_str() + colon + 5, "%d %d", &t, &i), 2) << line;
+    ASSERT_TRUE(t >= 0 && t < kThreads) << line;
+    ASSERT_EQ(i, seen[t]) << line;
+    ++seen[t];
+  }
+  for (int t = 0; t < kThreads; ++t) EXPECT_EQ(seen[t], kLines) << t;
 }
 
 }  // namespace
