@@ -93,6 +93,9 @@ void Transaction::prepareReply() {
   }
   replied_ = true;
   if (beforeReply_) std::exchange(beforeReply_, nullptr)();
+  // Lines logged for a request are out before its reply, unless other requests wait: then
+  // they go out together a moment later, rather than one write each.
+  if (!server().mainQueue()->hasWaiting()) log::flush();
 }
 
 void Transaction::done() {

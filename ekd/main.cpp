@@ -4,9 +4,11 @@
 #include <asio/io_context.hpp>
 #include <asio/signal_set.hpp>
 
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <iterator>
 #include <optional>
 #include <string>
 
@@ -15,6 +17,39 @@
 #include "platform/log/Log.h"
 
 namespace {
+
+// A crash writes the log lines that still wait, then takes its course: through the handler
+// that was there before (a sanitizer's, say), or the default action.
+constexpr int kFatalSignals[] = {SIGABRT, SIGSEGV, SIGBUS, SIGFPE, SIGILL};
+struct sigaction gPreviousActions[std::size(kFatalSignals)];
+
+void onFatalSignal(int signal, siginfo_t* info, void* context) {
+  ek::log::flushFromSignal();
+  for (size_t i = 0; i < std::size(kFatalSignals); ++i) {
+    if (kFatalSignals[i] != signal) continue;
+    const struct sigaction& previous = gPreviousActions[i];
+    if (previous.sa_flags & SA_SIGINFO) {
+      previous.sa_sigaction(signal, info, context);
+      return;
+    }
+    if (previous.sa_handler != SIG_DFL && previous.sa_handler != SIG_IGN) {
+      previous.sa_handler(signal);
+      return;
+    }
+  }
+  ::signal(signal, SIG_DFL);
+  ::raise(signal);
+}
+
+void flushLogOnCrash() {
+  for (size_t i = 0; i < std::size(kFatalSignals); ++i) {
+    struct sigaction action {};
+    action.sa_sigaction = onFatalSignal;
+    action.sa_flags = SA_SIGINFO | SA_NODEFER;
+    sigemptyset(&action.sa_mask);
+    sigaction(kFatalSignals[i], &action, &gPreviousActions[i]);
+  }
+}
 
 [[noreturn]] void usage() {
   std::fputs("Usage: ekd [-S servicename] [-v]\n", stderr);
@@ -29,6 +64,10 @@ int main(int argc, char* argv[]) {
   // thread, and with an arena per thread the memory each frees stays apart from the others':
   // the footprint then creeps up for long after start instead of levelling off.
   mallopt(M_ARENA_MAX, 1);
+  // Under load, many requests' lines share one write; a reply still follows its lines when
+  // no other request waits (see Transaction::prepareReply).
+  log::bufferLines(std::chrono::milliseconds(10));
+  flushLogOnCrash();
   log::ops().info("ekd is launching");
 
   std::string serviceName(protocol::kServiceName);
@@ -81,6 +120,7 @@ int main(int argc, char* argv[]) {
     server->stop();
     // Worker threads may still be mid-block; leave without running static destructors
     // under them. Everything acknowledged is already durable.
+    log::flush();
     std::fflush(nullptr);
     _exit(0);
   });

@@ -131,6 +131,14 @@ std::string EkdProcess::log() const {
   return text.str();
 }
 
+bool EkdProcess::logShows(std::string_view text) const {
+  for (int i = 0; i < 500; ++i) {
+    if (log().find(text) != std::string::npos) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return false;
+}
+
 bool EkdProcess::start() {
   std::string logPath = (root_.path() / "ekd.log").string();
   pid_ = fork();

@@ -55,6 +55,9 @@ class EkdProcess {
   std::string socketPath() const;
   // What ekd wrote to standard error so far.
   std::string log() const;
+  // Whether text shows in the log within five seconds. A reply follows the lines logged for
+  // its request, but lines logged elsewhere may wait a moment before ekd writes them.
+  bool logShows(std::string_view text) const;
   // The environment every client of this daemon needs (EKORA_RUNTIME_DIR and friends).
   std::map<std::string, std::string> environment() const;
   // Points this process's own EKORA_* variables at the daemon, for in-process clients.

@@ -161,6 +161,11 @@ void SerialQueue::sync(const std::function<void()>& block) {
   }
 }
 
+bool SerialQueue::hasWaiting() const {
+  std::lock_guard lock(mutex_);
+  return !blocks_.empty();
+}
+
 bool SerialQueue::isCurrent() const {
   return std::find(tCurrent.begin(), tCurrent.end(), this) != tCurrent.end();
 }

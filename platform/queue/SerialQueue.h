@@ -57,6 +57,8 @@ class SerialQueue : public std::enable_shared_from_this<SerialQueue> {
 
   // Whether the calling thread is running a block of this queue (also inside a sync).
   bool isCurrent() const;
+  // Whether blocks (or sync callers) wait for their turn.
+  bool hasWaiting() const;
   const std::string& label() const { return label_; }
 
   // The label of the innermost queue the calling thread runs on, or "" outside any queue.
@@ -72,7 +74,7 @@ class SerialQueue : public std::enable_shared_from_this<SerialQueue> {
 
   const std::string label_;
   asio::io_context& context_;
-  std::mutex mutex_;
+  mutable std::mutex mutex_;
   std::condition_variable handedOver_;
   // Blocks to run; a null block marks where a sync caller takes the queue over.
   std::deque<std::function<void()>> blocks_;

@@ -28,6 +28,28 @@ TEST(SerialQueue, RunsAsyncBlocksInSubmissionOrder) {
   for (int i = 0; i < 1000; ++i) EXPECT_EQ(seen[i], i);
 }
 
+TEST(SerialQueue, KnowsWhetherBlocksWaitBehindTheRunningOne) {
+  QueuePool pool(2);
+  auto queue = SerialQueue::make("waiting", pool.context());
+  EXPECT_FALSE(queue->hasWaiting());
+  std::promise<void> release;
+  std::promise<bool> firstSaw, secondSaw;
+  std::promise<void> started;
+  queue->async([&] {
+    started.set_value();
+    release.get_future().wait();
+    firstSaw.set_value(queue->hasWaiting());
+  });
+  started.get_future().wait();
+  EXPECT_FALSE(queue->hasWaiting());  // the running block does not count
+  queue->async([&] { secondSaw.set_value(queue->hasWaiting()); });
+  EXPECT_TRUE(queue->hasWaiting());
+  release.set_value();
+  EXPECT_TRUE(firstSaw.get_future().get());
+  EXPECT_FALSE(secondSaw.get_future().get());
+  EXPECT_FALSE(queue->hasWaiting());
+}
+
 TEST(SerialQueue, NeverRunsTwoBlocksAtOnce) {
   QueuePool pool(4);
   auto queue = SerialQueue::make("exclusive", pool.context());
