@@ -1,5 +1,7 @@
 #include "bench/FrameIo.h"
 
+#include <poll.h>
+
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -11,7 +13,19 @@ namespace ek::bench {
 
 namespace {
 constexpr size_t kReadChunk = 64 * 1024;
+
+// poll for POLLIN until the deadline, or without end.
+int pollReadable(int fd, const std::optional<std::chrono::steady_clock::time_point>& deadline) {
+  int waitMs = -1;
+  if (deadline) {
+    auto left =
+        std::chrono::ceil<std::chrono::milliseconds>(*deadline - std::chrono::steady_clock::now());
+    waitMs = static_cast<int>(std::clamp<int64_t>(left.count(), 0, 1 << 30));
+  }
+  pollfd readable{fd, POLLIN, 0};
+  return ::poll(&readable, 1, waitMs);
 }
+}  // namespace
 
 FrameReader::Status FrameReader::fill(
     int fd, size_t needed, const std::optional<std::chrono::steady_clock::time_point>& deadline) {
@@ -23,6 +37,14 @@ FrameReader::Status FrameReader::fill(
     }
     size_t want = std::max(needed, end_ + kReadChunk);
     if (buffer_.size() < want) buffer_.resize(want);
+    if (wait_ == Wait::ForReadiness) {
+      int ready = pollReadable(fd, deadline);
+      if (ready == 0) return Status::TimedOut;
+      if (ready < 0) {
+        if (errno == EINTR) continue;
+        return Status::Failed;
+      }
+    }
     ssize_t got = ::recv(fd, buffer_.data() + end_, buffer_.size() - end_, 0);
     if (got > 0) {
       end_ += static_cast<size_t>(got);

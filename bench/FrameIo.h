@@ -17,6 +17,14 @@ namespace ek::bench {
 class FrameReader {
  public:
   enum class Status { Frame, Closed, Failed, TooLarge, TimedOut };
+  // How a read waits for bytes. A thread asleep in recv is woken by every wake-up of the
+  // socket, also the write-space ones that the peer's own reads cause; a client on an event
+  // loop, as the client library is, waits for readiness and sleeps through those. The load
+  // generator waits as such a client does, so that the server is not charged for wake-ups a
+  // real client never has; the echo server keeps the plain recv, the cheapest answer.
+  enum class Wait { InRecv, ForReadiness };
+
+  explicit FrameReader(Wait wait = Wait::InRecv) : wait_(wait) {}
 
   // Reads the next frame. On Frame, header and body describe it; body stays valid until the
   // next call. With a deadline, gives up (TimedOut) once a recv returns after it; the socket's
@@ -32,6 +40,7 @@ class FrameReader {
   Status fill(int fd, size_t needed,
               const std::optional<std::chrono::steady_clock::time_point>& deadline);
 
+  Wait wait_;
   std::vector<uint8_t> buffer_;
   size_t start_ = 0;     // first byte of the frame handed out last
   size_t consumed_ = 0;  // size of that frame, dropped at the next call

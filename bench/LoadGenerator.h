@@ -30,6 +30,9 @@ struct LoadOptions {
   // is checked as strictly but only its error members are built: the figures then measure the
   // daemon rather than this client's decoding of large replies.
   bool decodeReplies = false;
+  // How a connection waits for its reply (FrameReader::Wait): for readiness by default, as the
+  // client library's event loop does; asleep in recv with this set.
+  bool waitInRecv = false;
 };
 
 // Latency figures in microseconds.

@@ -102,15 +102,20 @@ TEST(LoadResultTest, CombineAddsCountsTimesAndLatencies) {
 }
 
 TEST(LoadGeneratorTest, CountedRunCompletesExactlyThatManyRoundTrips) {
-  auto server = startServer();
-  ASSERT_TRUE(server);
-  LoadResult result = runOk(countedRun(*server, 300, 3));
-  EXPECT_EQ(result.requests, 300u);
-  EXPECT_EQ(result.latenciesNs.size(), 300u);
-  EXPECT_EQ(result.failures, 0u);
-  EXPECT_EQ(result.errorReplies, 0u);
-  EXPECT_GT(result.seconds, 0);
-  EXPECT_EQ(server->accepted(), 3u);
+  // Waiting for readiness or asleep in recv.
+  for (bool waitInRecv : {false, true}) {
+    auto server = startServer();
+    ASSERT_TRUE(server);
+    LoadOptions options = countedRun(*server, 300, 3);
+    options.waitInRecv = waitInRecv;
+    LoadResult result = runOk(options);
+    EXPECT_EQ(result.requests, 300u);
+    EXPECT_EQ(result.latenciesNs.size(), 300u);
+    EXPECT_EQ(result.failures, 0u);
+    EXPECT_EQ(result.errorReplies, 0u);
+    EXPECT_GT(result.seconds, 0);
+    EXPECT_EQ(server->accepted(), 3u);
+  }
 }
 
 TEST(LoadGeneratorTest, TimedRunStopsByItselfWithRequests) {
@@ -368,21 +373,24 @@ TEST_F(FrameReaderTest, ReadsTwoFramesArrivingInOneWrite) {
 }
 
 TEST_F(FrameReaderTest, ReassemblesAFrameSplitAcrossWrites) {
-  std::vector<uint8_t> body(200000, 0x5a);
-  std::vector<uint8_t> bytes = frame(7, body);
-  std::thread writer([&] {
-    for (size_t at = 0; at < bytes.size(); at += 1000) {
-      size_t n = std::min<size_t>(1000, bytes.size() - at);
-      ASSERT_TRUE(writeAll(fds_[1], bytes.data() + at, n));
-    }
-  });
-  FrameReader reader;
-  wyre::FrameHeader header;
-  std::span<const uint8_t> received;
-  ASSERT_EQ(reader.next(reading(), header, received), FrameReader::Status::Frame);
-  writer.join();
-  EXPECT_EQ(header.id, 7u);
-  EXPECT_EQ(std::vector<uint8_t>(received.begin(), received.end()), body);
+  for (FrameReader::Wait wait : {FrameReader::Wait::InRecv, FrameReader::Wait::ForReadiness}) {
+    std::vector<uint8_t> body(200000, 0x5a);
+    std::vector<uint8_t> bytes = frame(7, body);
+    std::thread writer([&] {
+      for (size_t at = 0; at < bytes.size(); at += 1000) {
+        size_t n = std::min<size_t>(1000, bytes.size() - at);
+        ASSERT_TRUE(writeAll(fds_[1], bytes.data() + at, n));
+      }
+    });
+    FrameReader reader(wait);
+    wyre::FrameHeader header;
+    std::span<const uint8_t> received;
+    ASSERT_EQ(reader.next(reading(), header, received), FrameReader::Status::Frame);
+    writer.join();
+    EXPECT_EQ(header.id, 7u);
+    EXPECT_EQ(std::vector<uint8_t>(received.begin(), received.end()), body);
+    EXPECT_EQ(reader.buffered(), 0u);
+  }
 }
 
 TEST_F(FrameReaderTest, RefusesAHeaderAnnouncingMoreThanAFrameMayCarry) {
@@ -412,6 +420,12 @@ TEST_F(FrameReaderTest, SilentPeerTimesOut) {
   wyre::FrameHeader header;
   std::span<const uint8_t> body;
   EXPECT_EQ(reader.next(reading(), header, body), FrameReader::Status::TimedOut);
+  // Waiting for readiness, the deadline bounds the wait by itself.
+  FrameReader waiting(FrameReader::Wait::ForReadiness);
+  ASSERT_TRUE(setIoTimeout(reading(), std::chrono::hours(1)));
+  EXPECT_EQ(waiting.next(reading(), header, body,
+                         std::chrono::steady_clock::now() + std::chrono::milliseconds(20)),
+            FrameReader::Status::TimedOut);
 }
 
 TEST(LoadGeneratorTest, WarmupRequestsAreNotCounted) {

@@ -57,6 +57,7 @@ struct Options {
   bool json = false;
   bool encodeReply = false;
   bool decodeReplies = false;
+  bool waitInRecv = false;
   std::string request;
   std::string requestsFile;
 };
@@ -344,6 +345,9 @@ int main(int argc, char** argv) {
   app.add_flag("--decode-replies", options.decodeReplies,
                "build every reply whole in the value model, as a client would; by default only "
                "a reply's error members are built and the rest is only checked");
+  app.add_flag("--wait-in-recv", options.waitInRecv,
+               "let each connection wait for its reply asleep in recv instead of waiting for "
+               "readiness as the client library's event loop does");
   app.add_flag("--json", options.json, "print one JSON object");
   auto* requestsFile = app.add_option(
       "--requests", options.requestsFile,
@@ -433,6 +437,7 @@ int main(int argc, char** argv) {
       load.duration = ek::bench::Seconds(options.duration);
       if (options.count) load.count = options.count;
       load.decodeReplies = options.decodeReplies;
+      load.waitInRecv = options.waitInRecv;
       load.replyTimeout = std::chrono::milliseconds(
           std::max<int64_t>(1, static_cast<int64_t>(options.timeout * 1000)));
       ek::Result<LoadResult> result =
