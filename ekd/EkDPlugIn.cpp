@@ -277,12 +277,12 @@ DictionaryRef EkDPlugIn::infoDmap() const {
 }
 
 EkDPlugIn::AnnotationNote EkDPlugIn::annotationNote() const {
-  std::lock_guard lock(noteMutex_);
+  std::lock_guard lock(infoMutex_);
   return annotationNote_;
 }
 
 void EkDPlugIn::setAnnotationNote(AnnotationNote note) const {
-  std::lock_guard lock(noteMutex_);
+  std::lock_guard lock(infoMutex_);
   annotationNote_ = std::move(note);
 }
 

@@ -4,6 +4,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -185,9 +186,15 @@ class EkDPlugIn : public EkPlugInCore {
   // The database's note of this plug-in's annotation as a reply carries it (CBOR), with the
   // annotation store's generation it was read in (0: not read yet). A reply of hundreds of
   // forms then finds the annotations beside the records it walks already.
+  // Ten thousand records keep one each: the bytes share one allocation with their count.
+  struct EncodedAnnotation {
+    std::shared_ptr<const uint8_t[]> bytes;
+    uint32_t size = 0;
+    std::span<const uint8_t> span() const { return {bytes.get(), size}; }
+  };
   struct AnnotationNote {
     uint64_t generation = 0;
-    std::shared_ptr<const std::vector<uint8_t>> encoded;
+    EncodedAnnotation encoded;
   };
   AnnotationNote annotationNote() const;
   void setAnnotationNote(AnnotationNote note) const;
@@ -209,8 +216,7 @@ class EkDPlugIn : public EkPlugInCore {
   mutable std::mutex infoMutex_;
   mutable CurrentInfoRef current_;
   mutable std::optional<Uuid> vrKnowledgeUUID_;
-  mutable std::mutex noteMutex_;
-  mutable AnnotationNote annotationNote_;
+  mutable AnnotationNote annotationNote_;  // guarded by infoMutex_
 };
 
 // File-provider action names of an extension dictionary ("ZuExtensionFileProviderActions",

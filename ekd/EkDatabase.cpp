@@ -352,8 +352,12 @@ std::vector<EkDatabase::EncodedAnnotation> EkDatabase::encodedAnnotationsForPlug
   }
   if (noted) return encoded;
 
-  static const EncodedAnnotation kNone =
-      std::make_shared<const std::vector<uint8_t>>(cbor::encode(Value(Dictionary{})));
+  auto kept = [](const std::vector<uint8_t>& bytes) {
+    std::shared_ptr<uint8_t[]> copy = std::make_shared_for_overwrite<uint8_t[]>(bytes.size());
+    std::copy(bytes.begin(), bytes.end(), copy.get());
+    return EncodedAnnotation{std::move(copy), static_cast<uint32_t>(bytes.size())};
+  };
+  static const EncodedAnnotation kNone = kept(cbor::encode(Value(Dictionary{})));
   sync_->sync([&] {
     const uint64_t current = annotations_->generation();
     for (size_t i = 0; i < plugIns.size(); ++i) {
@@ -361,10 +365,7 @@ std::vector<EkDatabase::EncodedAnnotation> EkDatabase::encodedAnnotationsForPlug
       if (note.generation != current) {
         const Dictionary* annotation = annotations_->findAnnotation(plugIns[i]->annotationKey());
         note.generation = current;
-        note.encoded =
-            annotation
-                ? std::make_shared<const std::vector<uint8_t>>(cbor::encode(Value(*annotation)))
-                : kNone;
+        note.encoded = annotation ? kept(cbor::encode(Value(*annotation))) : kNone;
         plugIns[i]->setAnnotationNote(note);
       }
       encoded[i] = std::move(note.encoded);

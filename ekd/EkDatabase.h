@@ -94,7 +94,7 @@ class EkDatabase : public vantor::RegistryObserver {
   // of them are as the store held them at one moment, after every change made before the
   // call. Records keep what was read (EkDPlugIn::AnnotationNote), so while the store does not
   // change, this neither enters the queue nor looks anything up.
-  using EncodedAnnotation = std::shared_ptr<const std::vector<uint8_t>>;
+  using EncodedAnnotation = EkDPlugIn::EncodedAnnotation;
   std::vector<EncodedAnnotation> encodedAnnotationsForPlugIns(
       std::span<const EkDPlugIn* const> plugIns);
   // Merges (or, when absent, removes) and saves at once. Posts nothing: the request handlers

@@ -395,8 +395,8 @@ TEST_F(DatabaseTest, AnnotationsMergeThroughTheDatabaseAndPostOnlyWhenAsked) {
 
 // The annotations a reply carries encoded, which records keep between replies.
 Dictionary decodedAnnotation(const EkDatabase::EncodedAnnotation& encoded) {
-  if (!encoded) return Dictionary{{"missing", Value(true)}};
-  Result<Value> value = cbor::decode(*encoded);
+  if (!encoded.bytes) return Dictionary{{"missing", Value(true)}};
+  Result<Value> value = cbor::decode(encoded.span());
   if (!value.ok() || !value->dictionary()) return Dictionary{{"undecodable", Value(true)}};
   return *value->dictionary();
 }

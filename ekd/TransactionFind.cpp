@@ -54,7 +54,7 @@ void Transaction::findPlugIn() {
     return;
   }
   doneWithEncoded(protocol::kMatches, [&](std::vector<uint8_t>& out) {
-    const EkDFormCache::Added added{*annotation, members};
+    const EkDFormCache::Added added{annotation.span(), members};
     out.reserve(out.size() + EkDFormCache::sizeBound(*form, added));
     EkDFormCache::write(*form, added, out);
   });

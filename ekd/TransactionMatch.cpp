@@ -283,12 +283,13 @@ void Transaction::matchPlugIns() {
   doneWithEncoded(protocol::kMatches, [&results, &annotations](std::vector<uint8_t>& out) {
     size_t bound = 9;
     for (size_t i = 0; i < results.size(); ++i) {
-      bound += EkDFormCache::sizeBound(*results[i]->form, {*annotations[i], results[i]->added});
+      bound +=
+          EkDFormCache::sizeBound(*results[i]->form, {annotations[i].span(), results[i]->added});
     }
     out.reserve(out.size() + bound);
     cbor::encodeArrayHead(results.size(), out);
     for (size_t i = 0; i < results.size(); ++i) {
-      EkDFormCache::write(*results[i]->form, {*annotations[i], results[i]->added}, out);
+      EkDFormCache::write(*results[i]->form, {annotations[i].span(), results[i]->added}, out);
     }
   });
 }
