@@ -7,6 +7,7 @@
 #include <sys/wait.h>
 
 #include <atomic>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <functional>
@@ -477,6 +478,19 @@ TEST_F(StderrLogTest, BufferedLinesWaitUntilAnErrorAFlushOrExit) {
   });
   EXPECT_EQ(run.status, 0);
   EXPECT_NE(run.written.find("ops: last, written at exit\n"), std::string::npos) << run.written;
+}
+
+TEST_F(StderrLogTest, BufferedLinesAreWrittenFromASignalHandler) {
+  ChildRun run = inChild([](int pipe) {
+    bufferLines(std::chrono::hours(1));
+    std::signal(SIGUSR1, [](int) { flushFromSignal(); });
+    ops().defaultLevel("before the crash");
+    if (!arrived(pipe).empty()) return 1;
+    std::raise(SIGUSR1);
+    if (arrived(pipe).find("ops: before the crash\n") == std::string::npos) return 2;
+    return 0;
+  });
+  EXPECT_EQ(run.status, 0) << run.written;
 }
 
 TEST_F(StderrLogTest, BufferedLinesAreWrittenAfterTheDelayEvenAfterAQuietSpell) {
