@@ -202,7 +202,8 @@ int processId() {
 }
 
 // Lines of standard error waiting to be written together (bufferLines). One writer thread
-// writes them every delay while lines come, and sleeps once a second has passed without any.
+// writes them every delay while lines come, and sleeps once a second has passed without a new
+// line: a line wakes it only after such a quiet spell, never one line at a time.
 class LineBuffer {
  public:
   static LineBuffer& shared() {
@@ -224,6 +225,7 @@ class LineBuffer {
   void add(const std::string& line, bool now) {
     std::lock_guard lock(mutex_);
     pending_ += line;
+    lastLine_ = std::chrono::steady_clock::now();
     if (now || pending_.size() >= kMaxPending) {
       writeLocked();
     } else if (sleeping_) {
@@ -257,17 +259,14 @@ class LineBuffer {
 
   void run() {
     std::unique_lock lock(mutex_);
-    auto quietSince = std::chrono::steady_clock::now();
     for (;;) {
-      if (pending_.empty() && std::chrono::steady_clock::now() - quietSince >= kQuietBeforeSleep) {
+      // Lines written by flush() count as lines: the writer stays awake while they come.
+      if (pending_.empty() && std::chrono::steady_clock::now() - lastLine_ >= kQuietBeforeSleep) {
         sleeping_ = true;
         wake_.wait(lock, [this] { return !sleeping_; });
       }
       wake_.wait_for(lock, delay_);
-      if (!pending_.empty()) {
-        writeLocked();
-        quietSince = std::chrono::steady_clock::now();
-      }
+      writeLocked();
     }
   }
 
@@ -278,6 +277,7 @@ class LineBuffer {
   std::condition_variable wake_;
   std::chrono::milliseconds delay_{10};
   bool sleeping_ = false;
+  std::chrono::steady_clock::time_point lastLine_;
   std::string pending_;
 };
 
