@@ -26,6 +26,9 @@ class FrameReader {
 
   explicit FrameReader(Wait wait = Wait::InRecv) : wait_(wait) {}
 
+  // Forgets what was received, for a new connection; the way of waiting stays.
+  void reset() { *this = FrameReader(wait_); }
+
   // Reads the next frame. On Frame, header and body describe it; body stays valid until the
   // next call. With a deadline, gives up (TimedOut) once a recv returns after it; the socket's
   // SO_RCVTIMEO bounds how long one recv blocks. A header announcing more than

@@ -69,7 +69,6 @@ const char* describe(FrameReader::Status status) {
 
 struct Worker {
   int fd = -1;
-  FrameReader::Wait wait = FrameReader::Wait::ForReadiness;
   FrameReader reader;
   // The requests, sent in turn from next on; frame is header + the body being sent. With one
   // request the frame is built once and only the id changes between sends.
@@ -83,7 +82,7 @@ struct Worker {
   void disconnect() {
     if (fd >= 0) ::close(fd);
     fd = -1;
-    reader = FrameReader(wait);
+    reader.reset();
   }
 
   bool connect(const LoadOptions& options) {
@@ -237,8 +236,8 @@ Result<LoadResult> runLoad(const LoadOptions& options,
   for (size_t i = 0; i < workers.size(); ++i) {
     Worker& worker = workers[i];
     worker.bodies = bodies;
-    worker.wait = options.waitInRecv ? FrameReader::Wait::InRecv : FrameReader::Wait::ForReadiness;
-    worker.reader = FrameReader(worker.wait);
+    worker.reader = FrameReader(options.waitInRecv ? FrameReader::Wait::InRecv
+                                                   : FrameReader::Wait::ForReadiness);
     worker.next = firstRequestOf(static_cast<unsigned>(i), options.connections, bodies.size());
     worker.frame.resize(wyre::kHeaderSize);
     if (bodies.size() == 1) {

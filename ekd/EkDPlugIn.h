@@ -183,15 +183,16 @@ class EkDPlugIn : public EkPlugInCore {
 
   const EkDPlugInContext& context() const { return context_; }
 
-  // The database's note of this plug-in's annotation as a reply carries it (CBOR), with the
-  // annotation store's generation it was read in (0: not read yet). A reply of hundreds of
-  // forms then finds the annotations beside the records it walks already.
-  // Ten thousand records keep one each: the bytes share one allocation with their count.
+  // An annotation as a reply carries it (CBOR). Ten thousand records keep one each: the bytes
+  // share one allocation with their count.
   struct EncodedAnnotation {
     std::shared_ptr<const uint8_t[]> bytes;
     uint32_t size = 0;
     std::span<const uint8_t> span() const { return {bytes.get(), size}; }
   };
+  // The database's note of this plug-in's annotation, with the annotation store's generation
+  // it was read in (0: not read yet). A reply of hundreds of forms then finds the annotations
+  // beside the records it walks already.
   struct AnnotationNote {
     uint64_t generation = 0;
     EncodedAnnotation encoded;
