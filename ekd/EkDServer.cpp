@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <malloc.h>
 
+#include <chrono>
 #include <future>
 #include <mutex>
 
@@ -18,6 +19,9 @@ namespace ek {
 namespace {
 
 constexpr size_t kMaxHostWatches = 256;
+// Long enough that a host's burst of requests is over, short enough that the footprint is
+// back before anyone looks.
+constexpr auto kHeapTrimQuiet = std::chrono::milliseconds(500);
 
 std::shared_ptr<EkDServer> gServer;
 std::mutex gServerMutex;
@@ -83,6 +87,7 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
   // without waking another thread, and handlers run one at a time all the same.
   server->mainQueue_ = SerialQueue::make("service", wyre::ioContext());
   server->syncQueue_ = SerialQueue::make("serverSync");
+  server->heapTrim_ = EkDHeapTrim::make(wyre::ioContext(), kHeapTrimQuiet);
 
   auto listener = wyre::Listener::create(serviceName, server->wyreQueue_);
   if (!listener) {
@@ -132,6 +137,11 @@ void EkDServer::submitWork(std::function<void()> work) {
   // Called as a connection's read handler hands over a request: the thread that read it runs
   // it next, instead of waking the other I/O thread for it.
   mainQueue_->asyncContinuation(std::move(work));
+  heapTrim_->activity();
+}
+
+void EkDServer::memoryChurned() {
+  heapTrim_->activity();
 }
 
 void EkDServer::stop() {

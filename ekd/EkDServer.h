@@ -11,6 +11,7 @@
 
 #include <asio/posix/stream_descriptor.hpp>
 
+#include "ekd/EkDHeapTrim.h"
 #include "ekd/EkDatabase.h"
 #include "platform/codesign/CodeSigning.h"
 #include "platform/notify/Notifications.h"
@@ -71,6 +72,9 @@ class EkDServer : public EkDatabase,
   // connection's handler, the work runs on that thread once the handler returns, which must
   // not wait for it (SerialQueue::asyncContinuation).
   void submitWork(std::function<void()> work);
+  // Something used or freed memory (a request, a client gone): the heap is trimmed once the
+  // daemon has been quiet for a while. Requests through submitWork count already.
+  void memoryChurned();
   // Cancels the listener and releases every hold. Called just before the process exits.
   void stop();
 
@@ -116,6 +120,7 @@ class EkDServer : public EkDatabase,
   std::unordered_map<pid_t, std::shared_ptr<asio::posix::stream_descriptor>>
       hostWatches_;  // on syncQueue_
   std::shared_ptr<EkDUserPrefs> userPrefs_;
+  std::shared_ptr<EkDHeapTrim> heapTrim_;
 };
 
 }  // namespace ek

@@ -79,6 +79,8 @@ void EkDWyreClient::dead() {
   // First: a hold placed from now on is dropped rather than outliving its client.
   acceptWork_ = false;
   server_->unholdClient(shared_from_this());
+  // Its connection's buffers go with it.
+  server_->memoryChurned();
   log::ops().debug("client %d is dead", pid_);
   EK_PROBE1(client_done, pid_);
 }

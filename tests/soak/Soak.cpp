@@ -1195,14 +1195,22 @@ std::optional<std::map<int, std::string>> Soak::settledDescriptors() {
 }
 
 uint64_t Soak::settledRss() {
-  // The median of a few samples of an idle daemon.
+  // An idle daemon gives freed heap back shortly after its last request: wait for a second
+  // without change, then take the median of the last samples.
   std::vector<uint64_t> samples;
-  for (int i = 0; i < 5; ++i) {
+  auto deadline = Clock::now() + kSettleTimeout;
+  while (true) {
     samples.push_back(rssKiB(daemon_.pid()).value_or(0));
+    if (samples.size() >= 10 && std::all_of(samples.end() - 10, samples.end(),
+                                            [&](uint64_t rss) { return rss == samples.back(); })) {
+      break;
+    }
+    if (Clock::now() >= deadline) break;
     std::this_thread::sleep_for(milliseconds(100));
   }
-  std::sort(samples.begin(), samples.end());
-  return samples[samples.size() / 2];
+  std::vector<uint64_t> last(samples.end() - std::min<size_t>(samples.size(), 5), samples.end());
+  std::sort(last.begin(), last.end());
+  return last[last.size() / 2];
 }
 
 bool Soak::terminateDaemon() {
