@@ -80,9 +80,3 @@ bool Uuid::isNull() const {
 
 }  // namespace ek
 
-size_t std::hash<ek::Uuid>::operator()(const ek::Uuid& uuid) const noexcept {
-  uint64_t a, b;
-  std::memcpy(&a, uuid.bytes.data(), 8);
-  std::memcpy(&b, uuid.bytes.data() + 8, 8);
-  return static_cast<size_t>(a ^ (b * 0x9E3779B97F4A7C15ULL));
-}

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <set>
+#include <unordered_set>
 
 #include "platform/value/Result.h"
 
@@ -35,6 +36,23 @@ TEST(Uuid, RandomIsVersionFourAndDistinct) {
     seen.insert(u);
   }
   EXPECT_EQ(seen.size(), 100u);
+}
+
+TEST(Uuid, EveryByteCountsForEqualityAndOrder) {
+  const Uuid base = *Uuid::parse("E621E1F8-C36C-495A-93FC-0C247A3E6E5F");
+  for (size_t i = 0; i < base.bytes.size(); ++i) {
+    Uuid other = base;
+    other.bytes[i] ^= 0x01;
+    EXPECT_NE(other, base) << "byte " << i;
+    EXPECT_EQ(other < base, other.bytes[i] < base.bytes[i]) << "byte " << i;
+    Uuid same = other;
+    EXPECT_EQ(same, other);
+    EXPECT_EQ(std::hash<Uuid>()(same), std::hash<Uuid>()(other));
+  }
+  std::unordered_set<Uuid> set;
+  for (int i = 0; i < 1000; ++i) set.insert(Uuid::random());
+  EXPECT_EQ(set.size(), 1000u);
+  for (const Uuid& uuid : set) EXPECT_EQ(set.count(uuid), 1u);
 }
 
 TEST(Value, IntegersNormaliseToUnsignedUnlessNegative) {
