@@ -79,4 +79,3 @@ bool Uuid::isNull() const {
 }
 
 }  // namespace ek
-
