@@ -36,7 +36,6 @@ void EkDHeapTrim::expired() {
     return;
   }
   trim_();
-  trims_.fetch_add(1);
   armed_.store(false);
   // Activity between the reading of last_ and the clearing of armed_ saw the timer armed and
   // left it alone: take it on here.

@@ -4,7 +4,6 @@
 #include <asio/steady_timer.hpp>
 #include <atomic>
 #include <chrono>
-#include <cstdint>
 #include <functional>
 #include <memory>
 
@@ -28,8 +27,6 @@ class EkDHeapTrim : public std::enable_shared_from_this<EkDHeapTrim> {
   // armed.
   void activity();
 
-  uint64_t trims() const { return trims_.load(); }
-
  private:
   EkDHeapTrim(asio::io_context& context, Clock::duration quiet, std::function<void()> trim);
   // Only the thread that set armed_ touches timer_ until armed_ is cleared again.
@@ -41,7 +38,6 @@ class EkDHeapTrim : public std::enable_shared_from_this<EkDHeapTrim> {
   const std::function<void()> trim_;
   std::atomic<Clock::rep> last_{0};
   std::atomic<bool> armed_{false};
-  std::atomic<uint64_t> trims_{0};
 };
 
 }  // namespace ek
