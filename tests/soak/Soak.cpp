@@ -1195,23 +1195,21 @@ std::optional<std::map<int, std::string>> Soak::settledDescriptors() {
 }
 
 uint64_t Soak::settledRss() {
-  // An idle daemon gives freed heap back shortly after its last request: wait for a second
-  // without change, then take the median of the last samples.
-  std::vector<uint64_t> samples;
-  // Under a sanitizer the figure is only shown: no need to wait for it.
+  // An idle daemon gives freed heap back shortly after its last request: the figure is taken
+  // once it has stayed the same for a second. Under a sanitizer it is only shown: no need to
+  // wait for it.
   auto deadline = Clock::now() + (kCheckRss ? kSettleTimeout : milliseconds(500));
-  while (true) {
-    samples.push_back(rssKiB(daemon_.pid()).value_or(0));
-    if (samples.size() >= 10 && std::all_of(samples.end() - 10, samples.end(),
-                                            [&](uint64_t rss) { return rss == samples.back(); })) {
-      break;
-    }
-    if (Clock::now() >= deadline) break;
+  uint64_t last = rssKiB(daemon_.pid()).value_or(0);
+  auto since = Clock::now();
+  while (Clock::now() < deadline && Clock::now() - since < seconds(1)) {
     std::this_thread::sleep_for(milliseconds(100));
+    uint64_t current = rssKiB(daemon_.pid()).value_or(0);
+    if (current != last) {
+      last = current;
+      since = Clock::now();
+    }
   }
-  std::vector<uint64_t> last(samples.end() - std::min<size_t>(samples.size(), 5), samples.end());
-  std::sort(last.begin(), last.end());
-  return last[last.size() / 2];
+  return last;
 }
 
 bool Soak::terminateDaemon() {
