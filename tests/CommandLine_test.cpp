@@ -1,6 +1,8 @@
 // ekd's and ekctl's command lines and exit statuses, against a real daemon.
 #include <gtest/gtest.h>
 
+#include <nlohmann/json.hpp>
+
 #include "tests/EkdProcess.h"
 
 namespace ek::test {
@@ -87,6 +89,55 @@ TEST_F(EkctlAgainstDaemon, UsageErrorsExitTwo) {
     auto result = daemon_->ekctl(args);
     EXPECT_EQ(result.status, 2) << (args.empty() ? "(none)" : args[0]) << ": " << result.err;
   }
+}
+
+TEST_F(EkctlAgainstDaemon, OptionsMayFollowTheCommand) {
+  auto result = daemon_->ekctl({"bulk", "--json", "--timeout", "5"});
+  EXPECT_EQ(result.status, 0) << result.err;
+  EXPECT_EQ(result.out, "{}\n");
+  auto zero = daemon_->ekctl({"bulk", "--timeout", "0"});
+  EXPECT_EQ(zero.status, 2);
+  EXPECT_LT(zero.err.size(), 120u) << zero.err;
+}
+
+// Plain JSON for jq: one shape per command, typed values as text.
+TEST_F(EkctlAgainstDaemon, ListAndInfoAnswerPlainJson) {
+  std::string app = (daemon_->root().path() / "Notes.app").string();
+  std::filesystem::copy(std::filesystem::path(EXAMPLES_DIR) / "Applications/Notes.app", app,
+                        std::filesystem::copy_options::recursive);
+  ASSERT_EQ(daemon_->ekctl({"add", app, "-o", "json"}).out, "{\n  \"ok\": true\n}\n");
+  auto listed = daemon_->ekctl({"list", "--point", "com.corvane.share", "-o", "json"});
+  ASSERT_EQ(listed.status, 0) << listed.err;
+  auto plugIns = nlohmann::json::parse(listed.out);
+  ASSERT_TRUE(plugIns.is_array());
+  ASSERT_EQ(plugIns.size(), 1u) << listed.out;
+  std::string uuid = plugIns[0]["uuid"];
+  EXPECT_EQ(plugIns[0]["identifier"], "com.corvane.example.notes.share");
+  EXPECT_TRUE(plugIns[0]["extensions"]["."].is_string());
+  EXPECT_EQ(daemon_->ekctl({"list", "--app", "/elsewhere.app", "-o", "json"}).out, "[]\n");
+
+  for (const std::string& target :
+       {std::string("com.corvane.example.notes.share"), uuid, app + "/PlugIns/Share.appex"}) {
+    auto info = daemon_->ekctl({"info", target, "-o", "json"});
+    ASSERT_EQ(info.status, 0) << target << ": " << info.err;
+    EXPECT_EQ(nlohmann::json::parse(info.out)["uuid"], uuid) << target;
+  }
+  auto missing = daemon_->ekctl({"info", "com.example.none", "-o", "json"});
+  EXPECT_EQ(missing.status, 1);
+  EXPECT_EQ(nlohmann::json::parse(missing.out)["error"]["code"], 4);
+}
+
+TEST_F(EkctlAgainstDaemon, RefusedRemovalSaysWhichEntitlementAndWhere) {
+  auto result = daemon_->ekctl({"remove", "/nonexistent.app"});
+  EXPECT_EQ(result.status, 1);
+  EXPECT_NE(result.err.find("com.corvane.private.ekora.manager"), std::string::npos) << result.err;
+  EXPECT_NE(result.err.find(ekctlPath() + ".entitlements"), std::string::npos) << result.err;
+}
+
+TEST(Ekctl, PrintsItsVersion) {
+  auto result = runCommand({ekctlPath(), "--version"});
+  EXPECT_EQ(result.status, 0);
+  EXPECT_EQ(result.out.rfind("ekctl ", 0), 0u) << result.out;
 }
 
 TEST(Ekctl, UnreachableDaemonIsATransportError) {

@@ -2,8 +2,11 @@
 
 #include <openssl/evp.h>
 
+#include <fmt/format.h>
+
 #include <algorithm>
 #include <cmath>
+#include <ctime>
 #include <limits>
 #include <nlohmann/json.hpp>
 #include <optional>
@@ -239,7 +242,39 @@ Json typedNumberJson(double number) {
   return Json(number);
 }
 
-Json toJson(const Value& value) {
+// RFC 3339 in UTC, with the fraction of a second only when there is one.
+Json plainDate(double seconds) {
+  if (!std::isfinite(seconds)) return Json();
+  double whole = std::floor(seconds);
+  if (whole < -62135596800.0 || whole > 253402300799.0) return Json(seconds);
+  time_t time = static_cast<time_t>(whole);
+  struct tm utc {};
+  gmtime_r(&time, &utc);
+  std::string text = fmt::format("{:04}-{:02}-{:02}T{:02}:{:02}:{:02}", utc.tm_year + 1900,
+                                 utc.tm_mon + 1, utc.tm_mday, utc.tm_hour, utc.tm_min, utc.tm_sec);
+  if (int millis = static_cast<int>(std::lround((seconds - whole) * 1000)); millis > 0) {
+    text += fmt::format(".{:03}", std::min(millis, 999));
+  }
+  return Json(text + "Z");
+}
+
+Json toJson(const Value& value, bool plain) {
+  if (plain) {
+    switch (value.type()) {
+      case ValueType::Double: {
+        double number = *value.doubleNumber();
+        return std::isfinite(number) ? Json(number) : Json();
+      }
+      case ValueType::Data:
+        return Json(encodeBase64(*value.data()));
+      case ValueType::Uuid:
+        return Json(value.uuid()->string());
+      case ValueType::Date:
+        return plainDate(value.date()->seconds);
+      default:
+        break;
+    }
+  }
   switch (value.type()) {
     case ValueType::String:
       return Json(*value.string());
@@ -259,12 +294,12 @@ Json toJson(const Value& value) {
       return Json::object({{kDateMember, typedNumberJson(value.date()->seconds)}});
     case ValueType::Array: {
       Json array = Json::array();
-      for (const Value& element : *value.array()) array.push_back(toJson(element));
+      for (const Value& element : *value.array()) array.push_back(toJson(element, plain));
       return array;
     }
     case ValueType::Dictionary: {
       Json object = Json::object();
-      for (const auto& [key, member] : *value.dictionary()) object[key] = toJson(member);
+      for (const auto& [key, member] : *value.dictionary()) object[key] = toJson(member, plain);
       return object;
     }
   }
@@ -281,7 +316,11 @@ Result<Value> parse(std::string_view text) {
 
 std::string write(const Value& value, bool pretty) {
   // Invalid UTF-8 in a string built in-process becomes U+FFFD rather than an exception.
-  return toJson(value).dump(pretty ? 2 : -1, ' ', false, Json::error_handler_t::replace);
+  return toJson(value, false).dump(pretty ? 2 : -1, ' ', false, Json::error_handler_t::replace);
+}
+
+std::string writePlain(const Value& value, bool pretty) {
+  return toJson(value, true).dump(pretty ? 2 : -1, ' ', false, Json::error_handler_t::replace);
 }
 
 }  // namespace ek::wirejson

@@ -22,4 +22,10 @@ Result<Value> parse(std::string_view text);
 // "$uuid", "$data", "$date" or "$real", which the notation cannot tell from a typed value.
 std::string write(const Value& value, bool pretty = false);
 
+// Writes plain JSON for tools such as jq, which cannot be parsed back into the same values:
+// UUIDs as upper-case text, dates as RFC 3339 text in UTC ("2026-11-25T10:04:05Z"), data as
+// base64 text, doubles as numbers (null when not finite). Key order and pretty printing as in
+// write.
+std::string writePlain(const Value& value, bool pretty = false);
+
 }  // namespace ek::wirejson

@@ -182,6 +182,22 @@ TEST(WireJson, WritesCompactSortedOutput) {
   for (const Written& c : cases) EXPECT_EQ(write(c.value), c.text) << c.name;
 }
 
+TEST(WireJson, WritesPlainJsonWithTypedValuesAsText) {
+  const Written cases[] = {
+      {"real", 0.1, "0.1"},
+      {"realNaN", std::numeric_limits<double>::quiet_NaN(), "null"},
+      {"uuidUpperCase", *Uuid::parse("e621e1f8-c36c-495a-93fc-0c247a3e6e5f"),
+       R"("E621E1F8-C36C-495A-93FC-0C247A3E6E5F")"},
+      {"data", Data{'A', 'B'}, R"("QUI=")"},
+      {"date", Date{1700000000}, R"("2023-11-14T22:13:20Z")"},
+      {"dateFraction", Date{1700000000.25}, R"("2023-11-14T22:13:20.250Z")"},
+      {"dateBeforeEpoch", Date{-1}, R"("1969-12-31T23:59:59Z")"},
+      {"dateOutOfRange", Date{1e18}, "1e+18"},
+      {"nested", Dictionary{{"u", Array{Date{0}}}}, R"({"u":["1970-01-01T00:00:00Z"]})"},
+  };
+  for (const Written& c : cases) EXPECT_EQ(writePlain(c.value), c.text) << c.name;
+}
+
 TEST(WireJson, WritesPrettyOutputWithTwoSpaces) {
   Value value(Dictionary{{"b", Array{1, true}}, {"a", 2.5}, {"e", Array{}}});
   EXPECT_EQ(write(value, true),

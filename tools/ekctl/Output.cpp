@@ -74,6 +74,61 @@ std::string replyAsTable(std::string_view command, const Value& reply) {
   return keyValues(*body);
 }
 
+std::string replyAsPlainJson(std::string_view command, const Value& reply) {
+  const Dictionary* body = reply.dictionary();
+  if (!body || body->empty()) return "{\n  \"ok\": true\n}\n";
+  if (const Value* code = reply.get(protocol::kErrorCode)) {
+    Dictionary error{{"code", *code}};
+    if (const Value* message = reply.get(protocol::kError)) error.emplace("message", *message);
+    return wirejson::writePlain(Value(Dictionary{{"error", Value(std::move(error))}}), true) + "\n";
+  }
+  const Value* matches = reply.get(protocol::kMatches);
+  bool plugIns = command == "match" || command == "list" || command == "find" || command == "info";
+  if (plugIns && matches) return wirejson::writePlain(*matches, true) + "\n";
+  return wirejson::writePlain(reply, true) + "\n";
+}
+
+Result<Value> keepPlugIns(Value reply, const std::function<bool(const Value& form)>& keep) {
+  Dictionary* body = reply.dictionary();
+  auto it = body ? body->find(protocol::kMatches) : Dictionary::iterator{};
+  if (!body || it == body->end() || !it->second.array()) {
+    return EkError::ekora(protocol::kErrorInvalidRequest, "the reply holds no list of plug-ins");
+  }
+  Array& forms = *it->second.array();
+  std::erase_if(forms, [&](const Value& form) { return !keep(form); });
+  return reply;
+}
+
+Result<Value> onePlugInNamed(Value reply, const std::string& identifier) {
+  auto kept = EK_TRY(keepPlugIns(std::move(reply), [&](const Value& form) {
+    const std::string* name = form.getString("identifier");
+    return name && *name == identifier;
+  }));
+  Array& forms = *kept.dictionary()->at(std::string(protocol::kMatches)).array();
+  if (forms.empty()) {
+    return EkError::ekora(protocol::kErrorInvalidRequest,
+                          fmt::format("no plug-in with identifier {} is visible to this client; "
+                                      "try its UUID or bundle path",
+                                      identifier));
+  }
+  Value found = std::move(forms.back());
+  forms.clear();
+  Dictionary shaped;
+  shaped.emplace(protocol::kMatches, std::move(found));
+  return Value(std::move(shaped));
+}
+
+std::optional<std::string> nextStep(std::string_view command, const EkError& error,
+                                    const std::string& executable) {
+  if (error.code != protocol::kErrorNotPermitted) return std::nullopt;
+  if (command != "remove" && command != "match" && command != "list") return std::nullopt;
+  return fmt::format(
+      "this needs the entitlement {} of the calling program: a dmap dictionary in {}.entitlements "
+      "with that key set to true, owned by root or by the daemon's user and writable by nobody "
+      "else (the daemon's log says why a file was refused)",
+      protocol::kEntitlementManager, executable);
+}
+
 std::string urlArgument(const std::string& text) {
   if (text.find("://") != std::string::npos || text.rfind("file:", 0) == 0) return text;
   std::string path = text;

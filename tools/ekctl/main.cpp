@@ -20,6 +20,7 @@
 #include "Ekora/EkDaemonClient.h"
 #include "Ekora/EkProtocol.h"
 #include "platform/json/WireJson.h"
+#include "platform/log/Log.h"
 #include "platform/notify/Notifications.h"
 #include "platform/prefs/Preferences.h"
 #include "tools/ekctl/Output.h"
@@ -30,11 +31,38 @@ using namespace ek;
 
 enum Exit { kSuccess = 0, kReplyError = 1, kUsage = 2, kTransport = 3 };
 
+constexpr std::string_view kPointKey = "ZuExtensionPointIdentifier";
+constexpr std::string_view kElectionKey = "ZuUserElection";
+
 struct Options {
   std::string service{protocol::kServiceName};
   bool json = false;
+  // "table", "json" or "wire"; empty: a table on a terminal, wire JSON otherwise.
+  std::string output;
   int timeoutSeconds = 30;
 };
+
+// Which instance to reach: a user's own (the default for every user but root) or the
+// system's. Either overrides EKORA_RUNTIME_DIR and EKORA_STATE_DIR for this process.
+void chooseInstance(bool user, bool system) {
+  if (system) {
+    ::setenv("EKORA_RUNTIME_DIR", "/run/ekora", 1);
+    ::setenv("EKORA_STATE_DIR", "/var/lib/ekora", 1);
+    return;
+  }
+  if (!user) return;
+  const char* runtime = std::getenv("XDG_RUNTIME_DIR");
+  std::string runtimeDir = runtime && *runtime == '/' ? std::string(runtime) + "/ekora"
+                                                      : fmt::format("/tmp/ekora-{}", ::getuid());
+  ::setenv("EKORA_RUNTIME_DIR", runtimeDir.c_str(), 1);
+  const char* state = std::getenv("XDG_STATE_HOME");
+  const char* home = std::getenv("HOME");
+  if (state && *state == '/') {
+    ::setenv("EKORA_STATE_DIR", (std::string(state) + "/ekora").c_str(), 1);
+  } else if (home && *home == '/') {
+    ::setenv("EKORA_STATE_DIR", (std::string(home) + "/.local/state/ekora").c_str(), 1);
+  }
+}
 
 [[noreturn]] void usageError(const std::string& message) {
   std::fprintf(stderr, "ekctl: %s\n", message.c_str());
@@ -89,7 +117,15 @@ std::vector<std::string> absolutePaths(const std::vector<std::string>& paths) {
   return result;
 }
 
+std::string executablePath() {
+  char buffer[4096];
+  ssize_t n = ::readlink("/proc/self/exe", buffer, sizeof buffer - 1);
+  return n > 0 ? std::string(buffer, static_cast<size_t>(n)) : std::string("ekctl");
+}
+
 using Sender = std::function<void(EkDaemonClient&, EkDaemonClient::Reply)>;
+// Turns a successful reply into what the command shows, or into an error.
+using Shaper = std::function<Result<Value>(Value)>;
 
 // Sends one request and waits for its reply.
 std::optional<Result<Value>> exchange(const Options& options, const Sender& sender,
@@ -106,7 +142,7 @@ std::optional<Result<Value>> exchange(const Options& options, const Sender& send
 }
 
 int run(const Options& options, std::string_view command, const Sender& sender,
-        std::shared_ptr<EkDaemonClient>* keep = nullptr) {
+        std::shared_ptr<EkDaemonClient>* keep = nullptr, const Shaper& shape = nullptr) {
   auto reply = exchange(options, sender, keep);
   if (!reply) {
     std::fprintf(stderr, "ekctl: no reply from %s within %d s\n", options.service.c_str(),
@@ -123,14 +159,35 @@ int run(const Options& options, std::string_view command, const Sender& sender,
     std::cout << wirejson::write(body) << "\n";
     return kSuccess;
   }
+  std::string format = options.output;
+  if (format.empty()) format = options.json || !isatty(STDOUT_FILENO) ? "wire" : "table";
   auto error = EkDaemonClient::errorInReply(body);
-  bool asJson = options.json || !isatty(STDOUT_FILENO);
+  if (!error && shape) {
+    auto shaped = shape(std::move(body));
+    if (!shaped) {
+      error = shaped.error();
+      body = Value(Dictionary{{std::string(protocol::kErrorCode), Value(error->code)},
+                              {std::string(protocol::kError), Value(error->message)}});
+    } else {
+      body = std::move(shaped).value();
+    }
+  }
   if (error) {
-    if (asJson) std::cout << wirejson::write(body) << "\n";
+    if (format == "wire") std::cout << wirejson::write(body) << "\n";
+    if (format == "json") std::cout << ekctl::replyAsPlainJson(command, body);
     std::fprintf(stderr, "ekctl: error %d: %s\n", error->code, error->message.c_str());
+    if (auto hint = ekctl::nextStep(command, *error, executablePath())) {
+      std::fprintf(stderr, "ekctl: %s\n", hint->c_str());
+    }
     return kReplyError;
   }
-  std::cout << (asJson ? ekctl::replyAsJson(body) : ekctl::replyAsTable(command, body));
+  if (format == "wire") {
+    std::cout << ekctl::replyAsJson(body);
+  } else if (format == "json") {
+    std::cout << ekctl::replyAsPlainJson(command, body);
+  } else {
+    std::cout << ekctl::replyAsTable(command, body);
+  }
   return kSuccess;
 }
 
@@ -231,13 +288,27 @@ int defaults(std::string_view action, const DefaultsArguments& args) {
 }  // namespace
 
 int main(int argc, char** argv) {
+  // The client library's own lines would only interleave with the replies; EKORA_LOG still
+  // turns them on.
+  if (!std::getenv("EKORA_LOG")) log::configure("error");
   Options options;
   CLI::App app{"ekctl: query and manage the plug-in daemon"};
   app.require_subcommand(1);
+  // Options of ekctl itself may follow the command as well as precede it.
+  app.fallthrough();
+  app.set_version_flag("--version", std::string("ekctl ") + EKORA_VERSION);
   app.add_option("-S", options.service, "service name of the daemon");
-  app.add_flag("--json", options.json, "print replies as JSON");
-  app.add_option("--timeout", options.timeoutSeconds, "seconds to wait for a reply")
-      ->check(CLI::PositiveNumber);
+  app.add_flag("--json", options.json, "print replies as wire JSON (the same as -o wire)");
+  app.add_option("-o,--output", options.output,
+                 "table, json (plain JSON for tools such as jq) or wire (wire JSON)")
+      ->check(CLI::IsMember({"table", "json", "wire"}));
+  app.add_option("--timeout", options.timeoutSeconds, "seconds to wait for a reply (1 to 3600)")
+      ->check(CLI::Range(1, 3600).description(""));
+  bool userInstance = false, systemInstance = false;
+  auto* userFlag = app.add_flag("--user", userInstance,
+                                "reach the calling user's own ekd (the default but for root)");
+  app.add_flag("--system", systemInstance, "reach the system's ekd (the default for root)")
+      ->excludes(userFlag);
 
   std::string rawJson, rulesJson, envJson, setJson, annotationsJson, uuidText, urlText;
   std::vector<std::string> paths, refs, uuidTexts;
@@ -254,6 +325,15 @@ int main(int argc, char** argv) {
   auto* match = app.add_subcommand("match", "discover plug-ins matching rules");
   match->add_option("--flags", flags);
   match->add_option("RULES", rulesJson, "a JSON dictionary of attribute rules");
+  std::string pointFilter, appFilter, infoTarget;
+  bool electedOnly = false;
+  auto* list = app.add_subcommand("list", "list the plug-ins this client may discover");
+  list->add_option("--point", pointFilter, "only plug-ins of this extension point");
+  list->add_option("--app", appFilter, "only plug-ins inside this application bundle");
+  list->add_flag("--elected", electedOnly, "only plug-ins the user elected");
+  list->add_option("--flags", flags);
+  auto* info = app.add_subcommand("info", "show one plug-in");
+  info->add_option("PLUGIN", infoTarget, "a plug-in's identifier, UUID or bundle path")->required();
   auto* find = app.add_subcommand("find", "look one plug-in up");
   auto* findUuid = find->add_option("--uuid", uuidText);
   auto* findUrl = find->add_option("--url", urlText);
@@ -300,10 +380,14 @@ int main(int argc, char** argv) {
     return app.exit(e);
   } catch (const CLI::CallForAllHelp& e) {
     return app.exit(e);
+  } catch (const CLI::CallForVersion& e) {
+    return app.exit(e);
   } catch (const CLI::ParseError& e) {
     app.exit(e);
     return kUsage;
   }
+
+  chooseInstance(userInstance, systemInstance);
 
   if (raw->parsed()) {
     if (rawJson.empty()) {
@@ -331,6 +415,45 @@ int main(int argc, char** argv) {
     return run(options, "match", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
       c.matchPlugIns(rules, flags, std::move(r));
     });
+  }
+  if (list->parsed()) {
+    Dictionary rules;
+    if (!pointFilter.empty()) rules.emplace(kPointKey, pointFilter);
+    if (electedOnly) rules.emplace(kElectionKey, "1");
+    std::string prefix;
+    if (!appFilter.empty()) prefix = absolutePaths({appFilter}).front() + "/";
+    Shaper shape = [prefix](Value reply) -> Result<Value> {
+      return ekctl::keepPlugIns(std::move(reply), [&](const Value& form) {
+        const std::string* path = form.getString("path");
+        return prefix.empty() || (path && path->starts_with(prefix));
+      });
+    };
+    return run(
+        options, "match",
+        [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+          c.matchPlugIns(rules, flags, std::move(r));
+        },
+        nullptr, shape);
+  }
+  if (info->parsed()) {
+    if (auto uuid = Uuid::parse(infoTarget)) {
+      return run(options, "find", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+        c.findPlugInByUUID(*uuid, std::move(r));
+      });
+    }
+    if (infoTarget.find('/') != std::string::npos || infoTarget.starts_with(".")) {
+      std::string url = ekctl::urlArgument(infoTarget);
+      return run(options, "find", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+        c.findPlugInByPathURL(url, std::move(r));
+      });
+    }
+    Shaper shape = [&](Value reply) { return ekctl::onePlugInNamed(std::move(reply), infoTarget); };
+    return run(
+        options, "find",
+        [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+          c.matchPlugIns(Dictionary{}, flags, std::move(r));
+        },
+        nullptr, shape);
   }
   if (find->parsed()) {
     if (uuidText.empty() == urlText.empty()) usageError("find takes one of --uuid or --url");
