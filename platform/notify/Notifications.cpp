@@ -275,7 +275,17 @@ Result<std::vector<std::pair<std::string, uint64_t>>> Watcher::next(
         if (found == names_.end() || *found != name) continue;
         size_t index = static_cast<size_t>(found - names_.begin());
         uint64_t current = generation(name, directory_);
-        seen_[index] = current;
+        if (event.mask & IN_MOVED_TO) {
+          // Posts are serialised and each adds one and renames once, so this event stands for
+          // the generation after the last one reported, even when later posts have already
+          // moved the file on. An event for a post counted when the watch began is skipped.
+          if (seen_[index] >= current) continue;
+          current = ++seen_[index];
+        } else {
+          // Written in place by hand: whatever it says now.
+          if (current == seen_[index]) continue;
+          seen_[index] = current;
+        }
         entries.emplace_back(*found, current);
       }
       if (overflow) {
