@@ -454,6 +454,23 @@ TEST_F(DatabaseTest, EncodedAnnotationsFollowEveryChangeOfTheStore) {
   database_->databaseQueue()->sync(
       [&] { ASSERT_TRUE(database_->annotations().loadDb(file).ok()); });
   EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
+
+  // Changes whose save fails are undone, and so is what the records noted of them meanwhile.
+  fs::remove(annotationPath());
+  fs::create_directories(fs::path(annotationPath()) / "in-the-way");
+  const Dictionary seven{{"election", Value(uint64_t{7})}};
+  database_->beginAnnotationChanges();
+  EXPECT_TRUE(database_->setAnnotation(seven, *other).ok());
+  EXPECT_TRUE(database_->setAnnotation(std::nullopt, *original).ok());
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, seven}));
+  Result<void> committed = database_->commitAnnotationChanges();
+  ASSERT_FALSE(committed.ok());
+  EXPECT_EQ(committed.error().domain, kPosixErrorDomain);
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
+  Result<void> single = database_->setAnnotation(seven, *other);
+  ASSERT_FALSE(single.ok());
+  EXPECT_EQ(single.error().domain, kPosixErrorDomain);
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
 }
 
 // One answer is one moment of the store: a writer numbering two plug-ins' annotations, first
