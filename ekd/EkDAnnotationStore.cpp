@@ -247,11 +247,8 @@ Result<void> EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& 
   }
   place(key, std::move(value), std::move(text));
   generation_.fetch_add(1, std::memory_order_release);
-  if (deferring_) {
-    pendingSave_ = true;
-    return {};
-  }
   pendingSave_ = true;
+  if (deferring_) return {};
   return saveDeferred();
 }
 
