@@ -210,21 +210,25 @@ Result<void> EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& 
   std::optional<Value> value;
   std::optional<std::string> text;
   if (annotation) {
+    // The limit holds for what a change brings, not for the merged whole: an annotation that
+    // grew large before the limit existed can still have its election changed.
+    Result<std::string> change = dmap::writeEntry(key, Value(*annotation), kEntryLevel);
+    if (change.ok() && change->size() > kMaxAnnotationSize) {
+      return EkError::ekora(kBadAnnotationCode,
+                            fmt::format("the annotation of {} is {} bytes once encoded, over the "
+                                        "limit of {}",
+                                        key, change->size(), kMaxAnnotationSize));
+    }
     const Dictionary* current = findAnnotation(key);
     Dictionary merged = current ? *current : Dictionary{};
     for (const auto& [name, entry] : *annotation) merged.insert_or_assign(name, entry);
     value = Value(std::move(merged));
-    Result<std::string> written = dmap::writeEntry(key, *value, kEntryLevel);
+    Result<std::string> written =
+        change.ok() ? dmap::writeEntry(key, *value, kEntryLevel) : std::move(change);
     if (!written.ok()) {
       return EkError::ekora(
           kBadAnnotationCode,
           fmt::format("the annotation of {} cannot be stored: {}", key, written.error().message));
-    }
-    if (written->size() > kMaxAnnotationSize) {
-      return EkError::ekora(kBadAnnotationCode,
-                            fmt::format("the annotation of {} is {} bytes once encoded, over the "
-                                        "limit of {}",
-                                        key, written->size(), kMaxAnnotationSize));
     }
     text = std::move(written).value();
   }

@@ -29,7 +29,7 @@ class EkDAnnotationStore {
   EkDAnnotationStore(const EkDAnnotationStore&) = delete;
   EkDAnnotationStore& operator=(const EkDAnnotationStore&) = delete;
 
-  // The largest annotation, as its entry is written in the file.
+  // The largest change of an annotation, written as an entry of the file.
   static constexpr size_t kMaxAnnotationSize = 64 * 1024;
 
   // Opens the store on path (absent: defaultDatabaseURL()) and loads it. A file that is
@@ -51,8 +51,8 @@ class EkDAnnotationStore {
   // removes the plug-in's whole annotation when absent; then saves, unless saves are deferred.
   // A change that fails leaves the table as it was:
   //  - refused before anything changes: an annotation the file cannot carry or larger than
-  //    kMaxAnnotationSize (the Ekora error 18), or one that would make the file larger than a
-  //    reader accepts (the POSIX error EFBIG);
+  //    kMaxAnnotationSize once written (the Ekora error 18), or one that would make the file
+  //    larger than a reader accepts (the POSIX error EFBIG);
   //  - a failed save is logged and answered (the POSIX domain and errno for a system failure),
   //    and the change is undone.
   Result<void> setAnnotation(const std::optional<Dictionary>& annotation, const EkDPlugIn& plugIn);

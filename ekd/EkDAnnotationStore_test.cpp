@@ -456,7 +456,10 @@ TEST_F(EkDAnnotationStoreTest, NoBackupWhenTheFileWasFineOrMissing) {
 // ---- Refusals and failed saves ---------------------------------------------------------------
 
 TEST_F(EkDAnnotationStoreTest, ChangesTheFileCannotHoldAreRefusedAndLeaveEverythingAsItWas) {
-  const Dictionary before{{"com.example.one", Dictionary{{"election", 1}}}};
+  // Stored before annotations had a limit.
+  const Dictionary big{{"extension", Dictionary{{"s", std::string(70 * 1024, 'b')}}}};
+  const Dictionary before{{"com.example.big", big},
+                          {"com.example.one", Dictionary{{"election", 1}}}};
   fs::path file = fileWith(currentFile(before));
   const std::string bytes = readBytes(file);
   auto store = EkDAnnotationStore::initWithDatabase(file.string());
@@ -482,9 +485,10 @@ TEST_F(EkDAnnotationStoreTest, ChangesTheFileCannotHoldAreRefusedAndLeaveEveryth
     EXPECT_EQ(store->generation(), generation);
   }
   EXPECT_EQ(readBytes(file), bytes);
-  // The next change is saved as usual.
+  // The next change is saved as usual, also one of an annotation above the limit.
   ASSERT_TRUE(store->setAnnotation(Dictionary{{"election", 2}}, "com.example.two").ok());
-  EXPECT_EQ(tableIn(file).size(), 2u);
+  ASSERT_TRUE(store->setAnnotation(Dictionary{{"election", 1}}, "com.example.big").ok());
+  EXPECT_EQ(tableIn(file).size(), 3u);
 }
 
 TEST_F(EkDAnnotationStoreTest, FailedSaveUndoesEveryChangeSinceTheLastOne) {
