@@ -445,7 +445,34 @@ SqliteRegistry::~SqliteRegistry() {
   closeDatabase();
 }
 
+namespace {
+
+// SQLite's own reports: damage and failed I/O loudly, recovery notices as they come, the rest
+// (every failing statement passes through here too) only when asked for.
+void forwardSqliteLog(void*, int code, const char* message) {
+  switch (code & 0xff) {
+    case SQLITE_CORRUPT:
+    case SQLITE_NOTADB:
+    case SQLITE_IOERR:
+    case SQLITE_CANTOPEN:
+    case SQLITE_FULL:
+      log::vr().error("SQLite: %s (%s)", message, sqlite3_errstr(code));
+      break;
+    case SQLITE_NOTICE:
+      log::vr().defaultLevel("SQLite: %s", message);
+      break;
+    default:
+      log::vr().debug("SQLite: %s (%s)", message, sqlite3_errstr(code));
+  }
+}
+
+}  // namespace
+
 Result<std::shared_ptr<SqliteRegistry>> SqliteRegistry::open(Options options) {
+  // Only before SQLite's first use; later (another user of SQLite in the process) it is
+  // refused, and SQLite stays quiet as before.
+  static std::once_flag logging;
+  std::call_once(logging, [] { sqlite3_config(SQLITE_CONFIG_LOG, forwardSqliteLog, nullptr); });
   if (options.stateDir.empty()) options.stateDir = paths::stateDir();
   if (options.systemRoot.empty()) options.systemRoot = paths::systemRoot();
   if (options.databasePath.empty()) {
