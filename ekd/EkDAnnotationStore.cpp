@@ -13,6 +13,8 @@
 #include <filesystem>
 #include <utility>
 
+#include <fmt/format.h>
+
 #include "ekd/EkDPlugIn.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/io/UniqueFd.h"
@@ -45,8 +47,19 @@ constexpr std::string_view kLogNoContainer = "failed to get storage container: e
 constexpr std::string_view kFatalNoContainer = "unable to locate user container: error %llu";
 constexpr std::string_view kLogKeptBadFile = "kept unusable annotation database %{public}@ as %@";
 constexpr std::string_view kLogKeepBadFileFailed =
-    "unable to keep unusable annotation database:%{public}@ aside error:%{public}@ (not "
-    "overwriting it)";
+    "unable to keep unusable annotation database:%{public}@ aside error:%{public}@ (replacing "
+    "it)";
+constexpr std::string_view kLogUnwritableEntry =
+    "dropping annotation %{public}@ of %{public}@: it cannot be written back: %{public}@";
+constexpr std::string_view kLogRemovedTemporaries =
+    "removed %zu temporary files a previous daemon left beside %{public}@";
+
+// Annotations that cannot be stored are refused with the code of a malformed annotation.
+constexpr int32_t kBadAnnotationCode = 18;
+// The entries of "data" are this deep in the document.
+constexpr size_t kEntryLevel = 2;
+// What the document holds besides the entries' texts, generously.
+constexpr size_t kDocumentFrame = 1024;
 
 // Backup names tried for one timestamp before giving up: "<file>.bad-<stamp>", then "-1" ...
 constexpr int kMaxBackupNames = 100;
@@ -138,6 +151,11 @@ std::unique_ptr<EkDAnnotationStore> EkDAnnotationStore::initWithDatabase(
     std::optional<std::string> path) {
   std::unique_ptr<EkDAnnotationStore> store(new EkDAnnotationStore());
   store->annotationsURL_ = path ? std::move(*path) : defaultDatabaseURL();
+  // Only this daemon writes the file, so a temporary beside it is a killed daemon's leftover.
+  if (Result<size_t> removed = dmap::removeStaleTemporaries(store->annotationsURL_);
+      removed.ok() && *removed > 0) {
+    log::ops().defaultLevel(kLogRemovedTemporaries, *removed, store->annotationsURL_);
+  }
 
   bool dataUsable = true;
   Result<void> loaded = store->load(store->annotationsURL_, dataUsable);
@@ -181,42 +199,139 @@ std::optional<Dictionary> EkDAnnotationStore::annotationForPlugIn(const EkDPlugI
   return annotationForIdentifier(plugIn.annotationKey());
 }
 
-void EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
-                                       const EkDPlugIn& plugIn) {
-  setAnnotation(annotation, plugIn.annotationKey());
+Result<void> EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
+                                               const EkDPlugIn& plugIn) {
+  return setAnnotation(annotation, plugIn.annotationKey());
 }
 
-void EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
-                                       const std::string& key) {
+Result<void> EkDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
+                                               const std::string& key) {
+  writeEveryEntry();
+  std::optional<Value> value;
+  std::optional<std::string> text;
   if (annotation) {
-    Dictionary merged = annotationForIdentifier(key).value_or(Dictionary{});
-    for (const auto& [name, value] : *annotation) merged.insert_or_assign(name, value);
-    auto entry = annotations_.insert_or_assign(key, Value(std::move(merged))).first;
+    // The limit holds for what a change brings, not for the merged whole: an annotation that
+    // grew large before the limit existed can still have its election changed.
+    Result<std::string> change = dmap::writeEntry(key, Value(*annotation), kEntryLevel);
+    if (change.ok() && change->size() > kMaxAnnotationSize) {
+      return EkError::ekora(kBadAnnotationCode,
+                            fmt::format("the annotation of {} is {} bytes once encoded, over the "
+                                        "limit of {}",
+                                        key, change->size(), kMaxAnnotationSize));
+    }
+    const Dictionary* current = findAnnotation(key);
+    Dictionary merged = current ? *current : Dictionary{};
+    for (const auto& [name, entry] : *annotation) merged.insert_or_assign(name, entry);
+    value = Value(std::move(merged));
+    Result<std::string> written =
+        change.ok() ? dmap::writeEntry(key, *value, kEntryLevel) : std::move(change);
+    if (!written.ok()) {
+      return EkError::ekora(
+          kBadAnnotationCode,
+          fmt::format("the annotation of {} cannot be stored: {}", key, written.error().message));
+    }
+    text = std::move(written).value();
+  }
+  auto slot = std::lower_bound(
+      written_.begin(), written_.end(), key,
+      [](const WrittenEntry& entry, std::string_view name) { return entry.key < name; });
+  const bool present = slot != written_.end() && slot->key == key;
+  const size_t replaced = present ? slot->text.size() : 0;
+  const size_t added = text ? text->size() : 0;
+  // A reader refuses a file over the limit: such a file would lose every annotation.
+  if (added > replaced && writtenBytes_ - replaced + added + kDocumentFrame > dmap::kMaxFileSize) {
+    return EkError::posix(EFBIG, fmt::format("the annotation of {} would make {} larger than {} "
+                                             "bytes",
+                                             key, annotationsURL_, dmap::kMaxFileSize));
+  }
+  if (!before_.contains(key)) {
+    const Value* stored = index_.contains(key) ? index_.at(key) : nullptr;
+    before_.emplace(key, Before{stored ? std::optional<Value>(*stored) : std::nullopt,
+                                present ? std::optional<std::string>(slot->text) : std::nullopt});
+  }
+  place(key, std::move(value), std::move(text));
+  generation_.fetch_add(1, std::memory_order_release);
+  pendingSave_ = true;
+  if (deferring_) return {};
+  return saveDeferred();
+}
+
+void EkDAnnotationStore::place(const std::string& key, std::optional<Value> value,
+                               std::optional<std::string> text) {
+  if (value) {
+    auto entry = annotations_.insert_or_assign(key, std::move(*value)).first;
     index_.insert_or_assign(entry->first, &entry->second);
   } else {
     // The index's key refers to the table's: it goes first.
     index_.erase(key);
     annotations_.erase(key);
   }
-  generation_.fetch_add(1, std::memory_order_release);
-  stale_.insert(key);
-  if (deferring_) {
-    pendingSave_ = true;
+  auto slot = std::lower_bound(
+      written_.begin(), written_.end(), key,
+      [](const WrittenEntry& entry, std::string_view name) { return entry.key < name; });
+  const bool present = slot != written_.end() && slot->key == key;
+  if (present) writtenBytes_ -= slot->text.size();
+  if (!text) {
+    if (present) written_.erase(slot);
     return;
   }
-  Result<void> saved = saveDb();
-  if (!saved.ok()) log::ops().error(kLogSaveFailed, annotationsURL_, saved.error());
+  writtenBytes_ += text->size();
+  if (present) {
+    slot->text = std::move(*text);
+  } else {
+    written_.insert(slot, {key, std::move(*text)});
+  }
+}
+
+void EkDAnnotationStore::undoChanges() {
+  for (auto& [key, before] : before_) place(key, std::move(before.value), std::move(before.text));
+  before_.clear();
+  pendingSave_ = false;
+  // A new generation, not the old one again: what readers noted from the undone changes was
+  // noted under the generations in between.
+  generation_.fetch_add(1, std::memory_order_release);
+}
+
+void EkDAnnotationStore::writeEveryEntry() {
+  if (!allStale_) return;
+  written_.clear();
+  written_.reserve(annotations_.size());
+  writtenBytes_ = 0;
+  for (auto it = annotations_.begin(); it != annotations_.end();) {
+    Result<std::string> text = dmap::writeEntry(it->first, it->second, kEntryLevel);
+    if (!text.ok()) {
+      log::ops().error(kLogUnwritableEntry, it->first, annotationsURL_, text.error());
+      keepBadFile_ = true;
+      index_.erase(it->first);
+      it = annotations_.erase(it);
+      generation_.fetch_add(1, std::memory_order_release);
+      continue;
+    }
+    writtenBytes_ += text->size();
+    written_.push_back({it->first, std::move(text).value()});
+    ++it;
+  }
+  allStale_ = false;
 }
 
 void EkDAnnotationStore::deferSaves() {
   deferring_ = true;
 }
 
-void EkDAnnotationStore::saveDeferred() {
+Result<void> EkDAnnotationStore::saveDeferred() {
   deferring_ = false;
-  if (!std::exchange(pendingSave_, false)) return;
+  if (!std::exchange(pendingSave_, false)) {
+    before_.clear();
+    return {};
+  }
   Result<void> saved = saveDb();
-  if (!saved.ok()) log::ops().error(kLogSaveFailed, annotationsURL_, saved.error());
+  if (!saved.ok()) {
+    log::ops().error(kLogSaveFailed, annotationsURL_, saved.error());
+    undoChanges();
+    return saved;
+  }
+  before_.clear();
+  return {};
 }
 
 Result<void> EkDAnnotationStore::loadDb(const std::string& path) {
@@ -252,44 +367,14 @@ Result<void> EkDAnnotationStore::load(const std::string& path, bool& dataUsable)
   for (const auto& [key, annotation] : annotations_) index_.emplace(key, &annotation);
   generation_.fetch_add(1, std::memory_order_release);
   written_.clear();
-  stale_.clear();
+  writtenBytes_ = 0;
+  before_.clear();
   allStale_ = true;
   return {};
 }
 
 Result<void> EkDAnnotationStore::saveDb() {
-  // Every entry's text is kept from the save that first wrote it: a change writes its own
-  // entry again and copies the others' texts into the document, without visiting the other
-  // annotations (with 10,000 of them, walking both trees cost more than writing the change).
-  if (allStale_) {
-    written_.clear();
-    written_.reserve(annotations_.size());
-    for (const auto& [key, annotation] : annotations_) {
-      written_.push_back({key, EK_TRY(dmap::writeEntry(key, annotation, 2))});
-    }
-    allStale_ = false;
-    stale_.clear();
-  }
-  // A key leaves stale_ only once its text is current, so a failed save is retried in full.
-  while (!stale_.empty()) {
-    auto key = stale_.begin();
-    auto slot = std::lower_bound(
-        written_.begin(), written_.end(), *key,
-        [](const WrittenEntry& entry, std::string_view name) { return entry.key < name; });
-    const bool written = slot != written_.end() && slot->key == *key;
-    auto annotation = annotations_.find(*key);
-    if (annotation == annotations_.end()) {
-      if (written) written_.erase(slot);
-    } else {
-      std::string text = EK_TRY(dmap::writeEntry(*key, annotation->second, 2));
-      if (written) {
-        slot->text = std::move(text);
-      } else {
-        written_.insert(slot, {*key, std::move(text)});
-      }
-    }
-    stale_.erase(key);
-  }
+  writeEveryEntry();
   std::vector<const std::string*> entries;
   entries.reserve(written_.size());
   for (const WrittenEntry& entry : written_) entries.push_back(&entry.text);
@@ -302,13 +387,15 @@ Result<void> EkDAnnotationStore::saveDb() {
 
   if (keepBadFile_) {
     Result<void> kept = keepBadFileAside();
-    if (!kept.ok()) {
+    if (kept.ok()) {
+      keepBadFile_ = false;
+    } else {
       log::ops().error(kLogKeepBadFileFailed, annotationsURL_, kept.error());
-      return kept;
     }
-    keepBadFile_ = false;
   }
-  return dmap::writeBytesAtomically(annotationsURL_, bytes);
+  EK_TRY(dmap::writeBytesAtomically(annotationsURL_, bytes));
+  keepBadFile_ = false;
+  return {};
 }
 
 Result<void> EkDAnnotationStore::keepBadFileAside() const {

@@ -339,6 +339,20 @@ std::string EkDPlugIn::annotationKey() const {
   return identifier().value_or(std::string());
 }
 
+std::optional<int64_t> EkDPlugIn::electionNumber(const Value& value) {
+  if (const uint64_t* number = value.unsignedNumber()) return static_cast<int64_t>(*number);
+  if (const int64_t* number = value.negativeNumber()) return *number;
+  if (const double* number = value.doubleNumber()) {
+    if (std::isnan(*number)) return 0;
+    // 2^63 is exactly representable; everything from there up saturates.
+    if (*number >= 9223372036854775808.0) return std::numeric_limits<int64_t>::max();
+    if (*number <= -9223372036854775808.0) return std::numeric_limits<int64_t>::min();
+    return static_cast<int64_t>(*number);
+  }
+  if (const bool* flag = value.boolean()) return *flag ? 1 : 0;
+  return std::nullopt;
+}
+
 // ---- Validation ------------------------------------------------------------------------------
 
 std::optional<EkError> EkDPlugIn::diagnose() const {

@@ -124,6 +124,10 @@ class EkDPlugIn : public EkPlugInCore {
   // "com.corvane.developer.replace-plugin" entitlement when that is a string, so a
   // replacement shares the elections of the plug-in it replaces; otherwise its own identifier.
   std::string annotationKey() const;
+  // The integer an election value stands for, wherever one is read or accepted: a number
+  // (wrapped or saturated to 64 bits, NaN as 0), or a boolean as 0 or 1. Absent for any
+  // other value.
+  static std::optional<int64_t> electionNumber(const Value& value);
 
   // Attribute matching. Never fails: anything that cannot be interpreted does not match.
   // Every key/pattern pair of rules must match; absent or empty rules match every plug-in.

@@ -96,20 +96,6 @@ bool isTrue(const Value& value) {
   return flag != nullptr && *flag;
 }
 
-// An election as it is stored may be any number; wrap or saturate rather than overflow.
-int64_t electionNumber(const Value& value) {
-  if (const uint64_t* number = value.unsignedNumber()) return static_cast<int64_t>(*number);
-  if (const int64_t* number = value.negativeNumber()) return *number;
-  if (const double* number = value.doubleNumber()) {
-    if (std::isnan(*number)) return 0;
-    // 2^63 is exactly representable; everything from there up saturates.
-    if (*number >= 9223372036854775808.0) return std::numeric_limits<int64_t>::max();
-    if (*number <= -9223372036854775808.0) return std::numeric_limits<int64_t>::min();
-    return static_cast<int64_t>(*number);
-  }
-  return 0;
-}
-
 // The string elements of an array value, summarised so that a pattern list can be tested
 // against all of them at once. Because the numeric ordering is total and equal only for
 // identical strings, "some element compares so with the operand" reduces to the set, its least
@@ -242,7 +228,7 @@ bool EkDPlugIn::matchKey(std::string_view key, const Value& pattern,
       if (context_.annotations) {
         if (std::optional<Dictionary> annotation = context_.annotations(*this)) {
           auto it = annotation->find(kAnnotationElection);
-          if (it != annotation->end()) election = electionNumber(it->second);
+          if (it != annotation->end()) election = electionNumber(it->second).value_or(0);
         }
       }
       made.emplace(std::to_string(election & ~kElectionFlagBits));

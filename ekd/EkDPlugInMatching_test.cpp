@@ -406,7 +406,8 @@ TEST_F(MatchingTest, ElectionComesFromTheAnnotationWithFlagBitsCleared) {
        true},
       {"largest unsigned wraps", Dictionary{{"election", std::numeric_limits<uint64_t>::max()}},
        "-65281", true},
-      {"boolean is not a number", Dictionary{{"election", true}}, "0", true},
+      {"boolean true is 1", Dictionary{{"election", true}}, "1", true},
+      {"boolean false is 0", Dictionary{{"election", false}}, "0", true},
       {"string is not a number", Dictionary{{"election", "1"}}, "0", true},
   };
   auto plugIn = build();

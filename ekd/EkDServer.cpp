@@ -155,6 +155,7 @@ void EkDServer::stop() {
     released.swap(holds_);
     notifier()->post(protocol::kAnnotationChangeNotification);
   });
+  workspace()->checkpoint();
 }
 
 void EkDServer::watchHostExit(const AuditToken& host) {

@@ -29,19 +29,6 @@ struct ProxyList {
   }
 };
 
-// The integer value of an election, when it is a number.
-std::optional<int64_t> electionValue(const Value& value) {
-  if (const uint64_t* u = value.unsignedNumber()) return static_cast<int64_t>(*u);
-  if (const int64_t* i = value.negativeNumber()) return *i;
-  if (const double* d = value.doubleNumber()) {
-    // NaN and values out of range have no integer value.
-    if (!(*d > -9.2e18 && *d < 9.2e18)) return int64_t{0};
-    return static_cast<int64_t>(*d);
-  }
-  if (const bool* b = value.boolean()) return *b ? 1 : 0;
-  return std::nullopt;
-}
-
 void requireOn(const SerialQueue& queue, const char* operation) {
   if (!queue.isCurrent()) {
     std::fprintf(stderr, "EkDatabase::%s called off the database queue\n", operation);
@@ -175,7 +162,7 @@ bool EkDatabase::electionFilter(const std::vector<std::string>& elections,
     if (!annotation) return std::nullopt;
     auto field = annotation->find(kElectionKey);
     if (field == annotation->end()) return std::nullopt;
-    return electionValue(field->second);
+    return EkDPlugIn::electionNumber(field->second);
   });
   if (!election) {
     election = 0;
@@ -183,7 +170,7 @@ bool EkDatabase::electionFilter(const std::vector<std::string>& elections,
     if (autoElect != entitlements.end()) {
       // Only a number counts here, by its boolean value.
       const Value& value = autoElect->second;
-      if (auto number = electionValue(value)) election = *number != 0 ? 1 : 0;
+      if (auto number = EkDPlugIn::electionNumber(value)) election = *number != 0 ? 1 : 0;
     }
   }
   std::string text = std::to_string(static_cast<uint8_t>(*election & 0xff));
@@ -374,17 +361,17 @@ std::vector<EkDatabase::EncodedAnnotation> EkDatabase::encodedAnnotationsForPlug
   return encoded;
 }
 
-void EkDatabase::setAnnotation(const std::optional<Dictionary>& annotation,
-                               const EkDPlugIn& plugIn) {
-  sync_->sync([&] { annotations_->setAnnotation(annotation, plugIn); });
+Result<void> EkDatabase::setAnnotation(const std::optional<Dictionary>& annotation,
+                                       const EkDPlugIn& plugIn) {
+  return onQueue(*sync_, [&] { return annotations_->setAnnotation(annotation, plugIn); });
 }
 
 void EkDatabase::beginAnnotationChanges() {
   sync_->sync([&] { annotations_->deferSaves(); });
 }
 
-void EkDatabase::commitAnnotationChanges() {
-  sync_->sync([&] { annotations_->saveDeferred(); });
+Result<void> EkDatabase::commitAnnotationChanges() {
+  return onQueue(*sync_, [&] { return annotations_->saveDeferred(); });
 }
 
 void EkDatabase::notifyAnnotationChange() {
@@ -396,11 +383,15 @@ void EkDatabase::autoElect(const EkDPlugIn& plugIn) {
   Dictionary annotation = annotations_->annotationForPlugIn(plugIn).value_or(Dictionary{});
   auto it = annotation.find(kElectionKey);
   if (it != annotation.end()) {
-    auto value = electionValue(it->second);
+    auto value = EkDPlugIn::electionNumber(it->second);
     if (value && *value != 0) return;
   }
   annotation.insert_or_assign(std::string(kElectionKey), Value(uint64_t{1}));
-  annotations_->setAnnotation(annotation, plugIn);
+  // The record is elected again when it is next built.
+  if (Result<void> set = annotations_->setAnnotation(annotation, plugIn); !set.ok()) {
+    log::ops().error("unable to auto-elect %{public}@: %{public}@", plugIn.annotationKey(),
+                     set.error());
+  }
 }
 
 void EkDatabase::pluginsDidInstall(const std::vector<vantor::PlugInProxyPtr>& plugIns) {

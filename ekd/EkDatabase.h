@@ -16,6 +16,7 @@
 #include "platform/notify/Notifications.h"
 #include "platform/queue/SerialQueue.h"
 #include "platform/value/EkError.h"
+#include "platform/value/Result.h"
 #include "platform/value/Uuid.h"
 #include "platform/value/Value.h"
 #include "platform/vantor/Registry.h"
@@ -98,13 +99,15 @@ class EkDatabase : public vantor::RegistryObserver {
   std::vector<EncodedAnnotation> encodedAnnotationsForPlugIns(
       std::span<const EkDPlugIn* const> plugIns);
   // Merges (or, when absent, removes) and saves at once. Posts nothing: the request handlers
-  // post once for all their changes with notifyAnnotationChange.
-  void setAnnotation(const std::optional<Dictionary>& annotation, const EkDPlugIn& plugIn);
+  // post once for all their changes with notifyAnnotationChange. A change that is refused or
+  // cannot be saved is not kept (see EkDAnnotationStore::setAnnotation).
+  Result<void> setAnnotation(const std::optional<Dictionary>& annotation, const EkDPlugIn& plugIn);
   void notifyAnnotationChange();
   // Annotation changes from beginAnnotationChanges() until commitAnnotationChanges() reach
-  // memory at once and the file in one durable write at the commit. Run on the work queue.
+  // memory at once and the file in one durable write at the commit. When that write fails,
+  // every change since the beginning is undone and the error answered. Run on the work queue.
   void beginAnnotationChanges();
-  void commitAnnotationChanges();
+  Result<void> commitAnnotationChanges();
 
   // Elects a plug-in that holds the auto-elect entitlement unless a choice exists. Runs on
   // _sync only.

@@ -234,11 +234,14 @@ TEST_F(DatabaseTest, AutoElectionElectsOnlyWithoutAChoice) {
   auto off = install("com.example.off", Dictionary{{std::string(kAutoElect), Value(false)}});
   database_->annotations();  // touched only on the queue below
   database_->databaseQueue()->sync([&] {
-    database_->annotations().setAnnotation(
-        Dictionary{{"election", Value(uint64_t{2})}, {"extension", Value(Dictionary{})}},
-        "com.example.two");
-    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{0})}},
-                                           "com.example.zero");
+    EXPECT_TRUE(database_->annotations()
+                    .setAnnotation(Dictionary{{"election", Value(uint64_t{2})},
+                                              {"extension", Value(Dictionary{})}},
+                                   "com.example.two")
+                    .ok());
+    EXPECT_TRUE(database_->annotations()
+                    .setAnnotation(Dictionary{{"election", Value(uint64_t{0})}}, "com.example.zero")
+                    .ok());
   });
   for (const auto& proxy : {fresh, two, zero, off}) {
     ASSERT_NE(database_->findPlugIn(proxy.uuid), nullptr);
@@ -283,11 +286,15 @@ TEST_F(DatabaseTest, QueryElectionFilterUsesStoredElectionsAutoElectAndReplaceme
   install("com.example.replacement",
           Dictionary{{std::string(kReplacePlugIn), Value("com.example.elected")}});
   database_->databaseQueue()->sync([&] {
-    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{1})}},
-                                           "com.example.elected");
+    EXPECT_TRUE(
+        database_->annotations()
+            .setAnnotation(Dictionary{{"election", Value(uint64_t{1})}}, "com.example.elected")
+            .ok());
     // Only the low 8 bits take part: 257 counts as 1.
-    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{257})}},
-                                           "com.example.wide");
+    EXPECT_TRUE(
+        database_->annotations()
+            .setAnnotation(Dictionary{{"election", Value(uint64_t{257})}}, "com.example.wide")
+            .ok());
   });
   Dictionary elected{{"ZuExtensionPointIdentifier", Value("com.corvane.share")},
                      {"ZuUserElection", Value("=1")}};
@@ -309,10 +316,12 @@ TEST_F(DatabaseTest, QueryElectionFilterUsesStoredElectionsAutoElectAndReplaceme
   // Every record is cached now; the filter still reads the elections as they are.
   EXPECT_EQ(database_->cacheCount(), 5u);
   database_->databaseQueue()->sync([&] {
-    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{1})}},
-                                           "com.example.none");
-    database_->annotations().setAnnotation(Dictionary{{"election", Value(uint64_t{0})}},
-                                           "com.example.auto");
+    EXPECT_TRUE(database_->annotations()
+                    .setAnnotation(Dictionary{{"election", Value(uint64_t{1})}}, "com.example.none")
+                    .ok());
+    EXPECT_TRUE(database_->annotations()
+                    .setAnnotation(Dictionary{{"election", Value(uint64_t{0})}}, "com.example.auto")
+                    .ok());
   });
   EXPECT_EQ(identifiersOf(database_->findPlugIns(elected)),
             (std::vector<std::string>{"com.example.elected", "com.example.none",
@@ -380,16 +389,18 @@ TEST_F(DatabaseTest, RegistrationErrorsCarryCodeTwo) {
 TEST_F(DatabaseTest, AnnotationsMergeThroughTheDatabaseAndPostOnlyWhenAsked) {
   auto proxy = install("com.example.a");
   auto plugIn = database_->findPlugIn(proxy.uuid);
-  database_->setAnnotation(Dictionary{{"extension", Value(Dictionary{{"k", Value("v")}})}},
-                           *plugIn);
-  database_->setAnnotation(Dictionary{{"election", Value(uint64_t{1})}}, *plugIn);
+  EXPECT_TRUE(
+      database_
+          ->setAnnotation(Dictionary{{"extension", Value(Dictionary{{"k", Value("v")}})}}, *plugIn)
+          .ok());
+  EXPECT_TRUE(database_->setAnnotation(Dictionary{{"election", Value(uint64_t{1})}}, *plugIn).ok());
   auto annotation = database_->annotationForPlugIn(*plugIn);
   ASSERT_TRUE(annotation.has_value());
   EXPECT_EQ(annotation->size(), 2u);
   EXPECT_EQ(notifier_->count("com.corvane.ekora.annotation-change"), 0u);
   database_->notifyAnnotationChange();
   EXPECT_EQ(notifier_->count("com.corvane.ekora.annotation-change"), 1u);
-  database_->setAnnotation(std::nullopt, *plugIn);
+  EXPECT_TRUE(database_->setAnnotation(std::nullopt, *plugIn).ok());
   EXPECT_EQ(database_->annotationForPlugIn(*plugIn), std::nullopt);
 }
 
@@ -423,15 +434,17 @@ TEST_F(DatabaseTest, EncodedAnnotationsFollowEveryChangeOfTheStore) {
   EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, none}));
 
   // Through either record, and asked twice: the second answer comes from what was kept.
-  database_->setAnnotation(elected, *replacement);
+  EXPECT_TRUE(database_->setAnnotation(elected, *replacement).ok());
   EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
   EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
-  database_->setAnnotation(std::nullopt, *original);
+  EXPECT_TRUE(database_->setAnnotation(std::nullopt, *original).ok());
   EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, none}));
 
   // Straight through the store, and by loading another file.
-  database_->databaseQueue()->sync(
-      [&] { database_->annotations().setAnnotation(elected, std::string("com.example.other")); });
+  database_->databaseQueue()->sync([&] {
+    EXPECT_TRUE(
+        database_->annotations().setAnnotation(elected, std::string("com.example.other")).ok());
+  });
   EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, elected}));
   const std::string file = (directory_ / "Other").string();
   Dictionary data{{"com.example.shared", Value(elected)}};
@@ -440,6 +453,23 @@ TEST_F(DatabaseTest, EncodedAnnotationsFollowEveryChangeOfTheStore) {
                   .ok());
   database_->databaseQueue()->sync(
       [&] { ASSERT_TRUE(database_->annotations().loadDb(file).ok()); });
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
+
+  // Changes whose save fails are undone, and so is what the records noted of them meanwhile.
+  fs::remove(annotationPath());
+  fs::create_directories(fs::path(annotationPath()) / "in-the-way");
+  const Dictionary seven{{"election", Value(uint64_t{7})}};
+  database_->beginAnnotationChanges();
+  EXPECT_TRUE(database_->setAnnotation(seven, *other).ok());
+  EXPECT_TRUE(database_->setAnnotation(std::nullopt, *original).ok());
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, seven}));
+  Result<void> committed = database_->commitAnnotationChanges();
+  ASSERT_FALSE(committed.ok());
+  EXPECT_EQ(committed.error().domain, kPosixErrorDomain);
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
+  Result<void> single = database_->setAnnotation(seven, *other);
+  ASSERT_FALSE(single.ok());
+  EXPECT_EQ(single.error().domain, kPosixErrorDomain);
   EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
 }
 
@@ -460,8 +490,8 @@ TEST_F(DatabaseTest, EncodedAnnotationsOfOneCallAreOneMomentOfTheStore) {
   std::atomic<bool> writing{true};
   std::thread writer([&] {
     for (uint64_t n = 1; n <= kRounds; ++n) {
-      database_->setAnnotation(numbered(n), *first);
-      database_->setAnnotation(numbered(n), *second);
+      EXPECT_TRUE(database_->setAnnotation(numbered(n), *first).ok());
+      EXPECT_TRUE(database_->setAnnotation(numbered(n), *second).ok());
     }
     writing = false;
   });
@@ -476,7 +506,7 @@ TEST_F(DatabaseTest, EncodedAnnotationsOfOneCallAreOneMomentOfTheStore) {
     ++reads;
   }
   writer.join();
-  database_->commitAnnotationChanges();
+  EXPECT_TRUE(database_->commitAnnotationChanges().ok());
   EXPECT_EQ(torn, 0u) << "of " << reads << " reads";
   auto last = database_->encodedAnnotationsForPlugIns(records);
   EXPECT_EQ(numberOf(decodedAnnotation(last[0])), kRounds);

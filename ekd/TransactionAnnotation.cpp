@@ -1,10 +1,13 @@
 // The annotation requests: "annotate" and "bulk-annotate".
 
+#include <fmt/format.h>
+
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDPlugIn.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDWyreClient.h"
 #include "ekd/Transaction.h"
+#include "platform/dmap/Dmap.h"
 #include "platform/log/Log.h"
 
 namespace ek {
@@ -13,8 +16,39 @@ namespace {
 constexpr std::string_view kElection = "election";
 constexpr std::string_view kExtension = "extension";
 
-bool isNumber(const Value& value) {
-  return value.unsignedNumber() || value.negativeNumber() || value.doubleNumber();
+// An annotation's entries sit this deep in the annotation file: its root dictionary, "data",
+// the annotation, then the entry.
+constexpr size_t kAnnotationEntryDepth = 3;
+
+// Whether the annotation file can hold value as an entry of an annotation; the reason when not.
+std::optional<std::string> unstorable(const Value& value) {
+  Result<void> checked = dmap::checkWritable(value, kAnnotationEntryDepth);
+  if (checked.ok()) return std::nullopt;
+  return checked.error().message;
+}
+
+// The code a reply gives a change that could not be stored: a system error is answered as
+// itself (errno, the POSIX domain's code), a refusal of the store keeps its own code.
+int32_t replyCode(const EkError& error) {
+  if (error.isEkora() || error.domain == kPosixErrorDomain) return error.code;
+  return protocol::kErrorInvalidRequest;
+}
+
+void failStore(Transaction& transaction, const EkError& error) {
+  transaction.fail(replyCode(error), error.description());
+}
+
+// Whatever way the request ends, what it changed reaches the disk before the reply leaves; when
+// it cannot, the changes are undone and the reply says so instead.
+void commitBeforeReply(Transaction& transaction, EkDServer& database) {
+  transaction.beforeReply([&transaction, &database] {
+    Result<void> committed = database.commitAnnotationChanges();
+    if (committed.ok()) return;
+    const int32_t code = replyCode(committed.error());
+    transaction.reply()[std::string(protocol::kErrorCode)] =
+        Value(static_cast<uint64_t>(static_cast<int64_t>(code)));
+    transaction.reply()[std::string(protocol::kError)] = Value(committed.error().description());
+  });
 }
 
 }  // namespace
@@ -27,15 +61,27 @@ void Transaction::annotatePlugIns() {
   }
   Dictionary change;
   if (auto it = annotations->find(kElection); it != annotations->end()) {
-    if (!isNumber(it->second)) {
+    std::optional<int64_t> election = EkDPlugIn::electionNumber(it->second);
+    if (!election) {
       fail(protocol::kErrorInvalidRequest, "invalid request format (annotation election)");
       return;
     }
-    change.emplace(kElection, it->second);
+    if (std::optional<std::string> reason = unstorable(it->second)) {
+      fail(protocol::kErrorInvalidRequest,
+           fmt::format("invalid request format (annotation election): {}", *reason));
+      return;
+    }
+    // Stored as the number it stands for, so every reader sees the same election.
+    change.emplace(kElection, it->second.boolean() ? Value(*election) : it->second);
   }
   if (auto it = annotations->find(kExtension); it != annotations->end()) {
     if (!it->second.dictionary()) {
       fail(protocol::kErrorInvalidRequest, "invalid request format (annotation extension)");
+      return;
+    }
+    if (std::optional<std::string> reason = unstorable(it->second)) {
+      fail(protocol::kErrorInvalidRequest,
+           fmt::format("invalid request format (annotation extension): {}", *reason));
       return;
     }
     change.emplace(kExtension, it->second);
@@ -49,7 +95,7 @@ void Transaction::annotatePlugIns() {
   auto election = change.find(kElection);
   EkDServer& database = server();
   database.beginAnnotationChanges();
-  beforeReply([&database] { database.commitAnnotationChanges(); });
+  commitBeforeReply(*this, database);
   bool walked = processUuidList([&](const std::shared_ptr<EkDPlugIn>& plugIn) {
     std::string uuid = plugIn->uuid().string();
     std::string identifier = plugIn->identifier().value_or("(null)");
@@ -59,11 +105,18 @@ void Transaction::annotatePlugIns() {
       log::ops().info("client %d plug-in %{public}@(%{public}@) election := %@", client_->pid(),
                       identifier, uuid, election->second);
     }
-    database.setAnnotation(change, *plugIn);
+    if (Result<void> set = database.setAnnotation(change, *plugIn); !set.ok()) {
+      failStore(*this, set.error());
+      return false;
+    }
     return true;
   });
   if (!walked) return;
-  database.commitAnnotationChanges();
+  beforeReply(nullptr);
+  if (Result<void> committed = database.commitAnnotationChanges(); !committed.ok()) {
+    failStore(*this, committed.error());
+    return;
+  }
   database.notifyAnnotationChange();
   done();
 }
@@ -77,10 +130,15 @@ void Transaction::bulkAnnotatePlugIns() {
   log::ops().debug("bulk change requested for %u plug-ins", annotations->size());
   EkDServer& database = server();
   database.beginAnnotationChanges();
-  beforeReply([&database] { database.commitAnnotationChanges(); });
+  commitBeforeReply(*this, database);
   for (const auto& [key, value] : *annotations) {
     if (!value.dictionary()) {
       fail(protocol::kErrorBadAnnotation, "annotations values must be dictionaries");
+      return;
+    }
+    if (std::optional<std::string> reason = unstorable(value)) {
+      fail(protocol::kErrorBadAnnotation,
+           fmt::format("annotations values must be storable: {}", *reason));
       return;
     }
     auto uuid = Uuid::parse(key);
@@ -96,9 +154,18 @@ void Transaction::bulkAnnotatePlugIns() {
     log::ops().debug("client %d bulk plug-in %{public}@(%public}@) annotation change: %@",
                      client_->pid(), plugIn->identifier().value_or("(null)"),
                      plugIn->uuid().string(), value);
-    database.setAnnotation(Dictionary{{std::string(kExtension), value}}, *plugIn);
+    Result<void> set =
+        database.setAnnotation(Dictionary{{std::string(kExtension), value}}, *plugIn);
+    if (!set.ok()) {
+      failStore(*this, set.error());
+      return;
+    }
   }
-  database.commitAnnotationChanges();
+  beforeReply(nullptr);
+  if (Result<void> committed = database.commitAnnotationChanges(); !committed.ok()) {
+    failStore(*this, committed.error());
+    return;
+  }
   database.notifyAnnotationChange();
   done();
 }

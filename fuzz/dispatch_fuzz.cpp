@@ -558,12 +558,14 @@ void restoreAnnotations(Fixture& f) {
     store.deferSaves();
     std::vector<std::string> keys;
     for (const auto& [key, value] : store.annotations()) keys.push_back(key);
-    for (const std::string& key : keys) store.setAnnotation(std::nullopt, key);
+    bool restored = true;
+    for (const std::string& key : keys) restored &= store.setAnnotation(std::nullopt, key).ok();
     for (const auto& [key, value] : f.baselineAnnotations) {
       if (const ek::Dictionary* annotation = value.dictionary())
-        store.setAnnotation(*annotation, key);
+        restored &= store.setAnnotation(*annotation, key).ok();
     }
-    store.saveDeferred();
+    restored &= store.saveDeferred().ok();
+    if (!restored) fail("the stored annotations could not be put back");
   });
 }
 

@@ -1,6 +1,6 @@
 #!/usr/bin/env python3
-"""Writes the seed corpora of cbor_fuzz, json_fuzz, dispatch_fuzz and bundle_sources_fuzz (valid
-and invalid inputs)."""
+"""Writes the seed corpora of cbor_fuzz, json_fuzz, dispatch_fuzz, dmap_value_fuzz and
+bundle_sources_fuzz (valid and invalid inputs)."""
 import pathlib
 import struct
 import uuid
@@ -121,6 +121,11 @@ DISPATCH = {
     "bulk_annotate": req("bulk-annotate", annotations={str(KEYBOARD): {"enabled": True},
                                                        str(DATA): {"order": [1, 2]}}),
     "bulk_annotate_bad_uuid": req("bulk-annotate", annotations={"nope": {}}),
+    "annotate_nan_election": req("annotate", uuids=[SHARE], annotations={"election": float("nan")}),
+    "annotate_unstorable_extension": req("annotate", uuids=[SHARE],
+                                         annotations={"extension": {"s": "bell\x07\ufffe"}}),
+    "bulk_annotate_infinite": req("bulk-annotate",
+                                  annotations={str(SHARE): {"r": float("-inf")}}),
     "bulk_annotate_not_dictionary": req("bulk-annotate", annotations={str(SHARE): 5}),
     "bulk_annotate_unknown": req("bulk-annotate", annotations={str(UNKNOWN): {}}),
     "add_app": req("add", paths=[HOST, SYSTEM + "/Viewer.bundle"]),
@@ -192,6 +197,19 @@ DISPATCH = {
 _ABSENT = ["/nonexistent/Info.dmap", False]
 _PRESENT = ["/", False, 2049, 2, 4096, 1700000000, 5, 1700000000, 6]
 _SHARED = ["/etc/hostname", True, 2049, 1234, 10, 1700000000, 0, 1700000000, 0]
+# dmap_value_fuzz: one CBOR value per file, what a client may send inside an annotation.
+DMAP_VALUE = {
+    "nan": cbor(float("nan")),
+    "infinity": cbor(float("inf")),
+    "control": cbor({"s": "tab\tok, bell\x07 not"}),
+    "noncharacter": cbor(["\ufffe", "\uffff", "\ufffd"]),
+    "date_nan": bytes.fromhex("c1fb7ff8000000000000"),
+    "date_year_0000": bytes.fromhex("c1fbc22cf2e8f8000000"),
+    "date_year_9999": bytes.fromhex("c1fb424d7ffa20bf8000"),
+    "nested": bytes.fromhex("81" * 600),
+    "entry": cbor({"election": 1, "extension": {"k": [1.5, True, b"\x00\xff"]}}),
+}
+
 BUNDLE_SOURCES = {
     "absent": ["ctx", [_ABSENT]],
     "present": ["ctx", [_PRESENT, _ABSENT]],
@@ -214,6 +232,10 @@ def main():
     dispatch_dir.mkdir(parents=True, exist_ok=True)
     for name, message in DISPATCH.items():
         (dispatch_dir / name).write_bytes(cbor(message))
+    value_dir = HERE / "corpus" / "dmap_value"
+    value_dir.mkdir(parents=True, exist_ok=True)
+    for name, data in DMAP_VALUE.items():
+        (value_dir / name).write_bytes(data)
     sources_dir = HERE / "corpus" / "bundle_sources"
     sources_dir.mkdir(parents=True, exist_ok=True)
     for name, record in BUNDLE_SOURCES.items():

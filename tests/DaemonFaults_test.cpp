@@ -8,6 +8,7 @@
 #include <thread>
 
 #include "platform/cbor/Cbor.h"
+#include "platform/dmap/Dmap.h"
 #include "platform/wyre/Wyre.h"
 #include "tests/EkdProcess.h"
 #include "tests/RawClient.h"
@@ -145,30 +146,39 @@ TEST_F(DaemonFaults, ClientThatNeverReadsIsCutOffWithoutStallingOthers) {
 }
 
 TEST_F(DaemonFaults, AnswerLargerThanTheBoundOnUnsentRepliesIsStillSent) {
-  // A form carrying a 9 MiB annotation: one reply above the 8 MiB bound, from a client that
-  // reads it. Only what piles up behind an unread reply is bounded.
+  // Ten forms of 900 KiB each: one reply above the 8 MiB bound, from a client that reads it.
+  // Only what piles up behind an unread reply is bounded.
   namespace fs = std::filesystem;
   fs::path app = daemon_.root().path() / "Notes.app";
   fs::copy(fs::path(EXAMPLES_DIR) / "Applications" / "Notes.app", app, fs::copy_options::recursive);
+  constexpr int kPlugIns = 10;
+  const std::string padding(900u << 10, 'x');
+  for (int i = 0; i < kPlugIns; ++i) {
+    fs::path plugIn = app / "PlugIns" / ("Big" + std::to_string(i) + ".appex");
+    fs::copy(app / "PlugIns/Share.appex", plugIn, fs::copy_options::recursive);
+    Result<Value> info = dmap::readFile((plugIn / "Info.dmap").string());
+    ASSERT_TRUE(info.ok());
+    Dictionary& dictionary = *info->dictionary();
+    dictionary["QvBundleIdentifier"] = Value("com.corvane.example.notes.big" + std::to_string(i));
+    Dictionary& extension = *dictionary["ZuExtension"].dictionary();
+    (*extension["ZuExtensionAttributes"].dictionary())["Padding"] = Value(padding);
+    ASSERT_TRUE(dmap::writeFileAtomically((plugIn / "Info.dmap").string(), *info).ok());
+  }
   auto added = daemon_.ask(request("add", {{"paths", Value(Array{Value(app.string())})}}));
-  ASSERT_TRUE(added && replyErrorCode(*added) == 0);
-  auto found = daemon_.ask(
-      request("find", {{"paths", Value("file://" + (app / "PlugIns/Share.appex").string())}}));
-  ASSERT_TRUE(found && found->get("matches"));
-  Uuid uuid = *Uuid::parse(*found->get("matches")->getString("uuid"));
-  std::string blob(9u << 20, 'x');
-  auto annotated = daemon_.ask(request(
-      "annotate", {{"annotations", Value(Dictionary{{"extension", Dictionary{{"blob", blob}}}})},
-                   {"uuids", Value(Array{Value(uuid)})}}));
-  ASSERT_TRUE(annotated && replyErrorCode(*annotated) == 0);
+  ASSERT_TRUE(added && replyErrorCode(*added) == 0) << daemon_.log();
 
-  auto big = daemon_.ask(request("find", {{"uuids", Value(uuid)}}), std::chrono::seconds(120));
+  auto big =
+      daemon_.ask(request("match", {{"rules", Value(Dictionary{{"ZuExtensionPointIdentifier",
+                                                                Value("com.corvane.share")}})}}),
+                  std::chrono::seconds(120));
   ASSERT_TRUE(big.has_value()) << daemon_.log();
-  const Value* form = big->get("matches");
-  ASSERT_TRUE(form);
-  const Dictionary* annotations = form->getDictionary("annotations");
-  ASSERT_TRUE(annotations);
-  EXPECT_EQ(annotations->at("extension").getString("blob")->size(), blob.size());
+  const Array* matches = big->getArray("matches");
+  ASSERT_TRUE(matches) << big->description().substr(0, 300);
+  size_t padded = 0;
+  for (const Value& form : *matches) {
+    padded += form.description().find(padding) != std::string::npos ? 1 : 0;
+  }
+  EXPECT_EQ(padded, static_cast<size_t>(kPlugIns));
   expectServed();
 }
 

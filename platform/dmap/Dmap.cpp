@@ -1,5 +1,6 @@
 #include "platform/dmap/Dmap.h"
 
+#include <dirent.h>
 #include <expat.h>
 #include <fcntl.h>
 #include <locale.h>
@@ -7,6 +8,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cctype>
 #include <cerrno>
 #include <charconv>
 #include <cmath>
@@ -88,8 +90,9 @@ unsigned daysInMonth(int64_t year, unsigned month) {
   return month == 2 && isLeapYear(year) ? 29 : kDays[month - 1];
 }
 
-// The dates a document can hold: years 0000 to 9999.
-const int64_t kFirstSecond = daysFromCivil(0, 1, 1) * 86400;
+// The dates a document can hold: years 0001 to 9999. Year 0000 is not a year of the calendar
+// every reader of the text agrees on.
+const int64_t kFirstSecond = daysFromCivil(1, 1, 1) * 86400;
 const int64_t kLastSecond = daysFromCivil(10000, 1, 1) * 86400 - 1;
 
 // Keys and strings quoted in error messages are cut short: they come from untrusted files.
@@ -187,8 +190,8 @@ Result<Value> parseDate(std::string_view raw) {
   const int64_t year = field(0, 4);
   const unsigned month = field(5, 2), day = field(8, 2);
   const unsigned hour = field(11, 2), minute = field(14, 2), second = field(17, 2);
-  if (month < 1 || month > 12 || day < 1 || day > daysInMonth(year, month) || hour > 23 ||
-      minute > 59 || second > 59) {
+  if (year < 1 || month < 1 || month > 12 || day < 1 || day > daysInMonth(year, month) ||
+      hour > 23 || minute > 59 || second > 59) {
     return EkError::format(fmt::format("invalid date {}", quoted(text)));
   }
   const int64_t seconds =
@@ -533,38 +536,18 @@ class Parser {
 // ---------------------------------------------------------------------------------------------
 // Writer
 
-// Checks that text is UTF-8 made of characters XML 1.0 can carry, and escapes it.
-Result<void> appendEscaped(std::string& out, std::string_view text) {
+// What the writer can carry, shared by write() and checkWritable() so that they cannot disagree.
+
+// Whether text is UTF-8 made of characters XML 1.0 can carry.
+Result<void> checkText(std::string_view text) {
   const auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
   const size_t size = text.size();
   size_t i = 0;
   while (i < size) {
     const unsigned char c = bytes[i];
     if (c < 0x80) {
-      switch (c) {
-        case '&':
-          out += "&amp;";
-          break;
-        case '<':
-          out += "&lt;";
-          break;
-        case '>':
-          out += "&gt;";
-          break;
-        // A literal carriage return would be turned into a line feed by any XML reader.
-        case '\r':
-          out += "&#13;";
-          break;
-        case '\t':
-        case '\n':
-          out.push_back(static_cast<char>(c));
-          break;
-        default:
-          if (c < 0x20) {
-            return EkError::format(
-                fmt::format("cannot write control character U+{:04X} in dmap", c));
-          }
-          out.push_back(static_cast<char>(c));
+      if (c < 0x20 && c != '\t' && c != '\n' && c != '\r') {
+        return EkError::format(fmt::format("cannot write control character U+{:04X} in dmap", c));
       }
       ++i;
       continue;
@@ -595,10 +578,73 @@ Result<void> appendEscaped(std::string& out, std::string_view text) {
     if (codePoint == 0xFFFE || codePoint == 0xFFFF) {
       return EkError::format(fmt::format("cannot write character U+{:04X} in dmap", codePoint));
     }
-    out.append(text.substr(i, length));
     i += length;
   }
   return {};
+}
+
+EkError tooDeep() {
+  return EkError::format(
+      fmt::format("cannot write dmap: nesting deeper than {} levels", kMaxDepth));
+}
+
+// The value itself, not its members: its text, number or date, and for a container whether
+// one more level fits. depth is the value's own (the root value is at 0).
+Result<void> checkOne(const Value& value, size_t depth) {
+  switch (value.type()) {
+    case ValueType::String:
+      return checkText(*value.string());
+    case ValueType::Double:
+      if (!std::isfinite(*value.doubleNumber())) {
+        return EkError::format(fmt::format("cannot write real {} in dmap", *value.doubleNumber()));
+      }
+      return {};
+    case ValueType::Date: {
+      const double seconds = value.date()->seconds;
+      if (!std::isfinite(seconds)) return EkError::format("cannot write a non-finite date in dmap");
+      const double whole = std::floor(seconds);
+      if (whole < static_cast<double>(kFirstSecond) || whole > static_cast<double>(kLastSecond)) {
+        return EkError::format(
+            fmt::format("cannot write date {} in dmap: outside the years 0001-9999", seconds));
+      }
+      return {};
+    }
+    case ValueType::Array:
+    case ValueType::Dictionary:
+      if (depth >= kMaxDepth) return tooDeep();
+      return {};
+    default:
+      return {};
+  }
+}
+
+// Escapes text that checkText accepted.
+void appendEscaped(std::string& out, std::string_view text) {
+  size_t plain = 0;
+  for (size_t i = 0; i < text.size(); ++i) {
+    std::string_view entity;
+    switch (text[i]) {
+      case '&':
+        entity = "&amp;";
+        break;
+      case '<':
+        entity = "&lt;";
+        break;
+      case '>':
+        entity = "&gt;";
+        break;
+      // A literal carriage return would be turned into a line feed by any XML reader.
+      case '\r':
+        entity = "&#13;";
+        break;
+      default:
+        continue;
+    }
+    out.append(text.substr(plain, i - plain));
+    out += entity;
+    plain = i + 1;
+  }
+  out.append(text.substr(plain));
 }
 
 void appendBase64(std::string& out, const Data& data) {
@@ -612,13 +658,9 @@ void appendBase64(std::string& out, const Data& data) {
   }
 }
 
-Result<std::string> formatDate(double seconds) {
-  if (!std::isfinite(seconds)) return EkError::format("cannot write a non-finite date in dmap");
+// A date that checkOne accepted.
+std::string formatDate(double seconds) {
   const double whole = std::floor(seconds);
-  if (whole < static_cast<double>(kFirstSecond) || whole > static_cast<double>(kLastSecond)) {
-    return EkError::format(
-        fmt::format("cannot write date {} in dmap: outside the years 0000-9999", seconds));
-  }
   const auto total = static_cast<int64_t>(whole);
   int64_t days = total / 86400, rest = total % 86400;
   if (rest < 0) rest += 86400, --days;
@@ -660,8 +702,9 @@ class Writer {
  private:
   Result<void> writeKey(std::string_view key, size_t level) {
     indent(level);
+    EK_TRY(checkText(key));
     out_ += "<key>";
-    EK_TRY(appendEscaped(out_, key));
+    appendEscaped(out_, key);
     out_ += "</key>\n";
     return {};
   }
@@ -683,11 +726,12 @@ class Writer {
   Result<void> writeValue(const Value& value, size_t level, size_t depth) {
     // Stop early rather than build a document that could not be read back.
     if (out_.size() > kMaxFileSize) return tooLarge();
+    EK_TRY(checkOne(value, depth));
     indent(level);
     switch (value.type()) {
       case ValueType::String:
         out_ += "<string>";
-        EK_TRY(appendEscaped(out_, *value.string()));
+        appendEscaped(out_, *value.string());
         out_ += "</string>\n";
         break;
       case ValueType::Unsigned:
@@ -696,14 +740,9 @@ class Writer {
       case ValueType::Negative:
         out_ += fmt::format("<integer>{}</integer>\n", *value.negativeNumber());
         break;
-      case ValueType::Double: {
-        const double number = *value.doubleNumber();
-        if (!std::isfinite(number)) {
-          return EkError::format(fmt::format("cannot write real {} in dmap", number));
-        }
-        out_ += fmt::format("<real>{}</real>\n", number);
+      case ValueType::Double:
+        out_ += fmt::format("<real>{}</real>\n", *value.doubleNumber());
         break;
-      }
       case ValueType::Bool:
         out_ += *value.boolean() ? "<true/>\n" : "<false/>\n";
         break;
@@ -716,10 +755,9 @@ class Writer {
         out_ += fmt::format("<string>{}</string>\n", value.uuid()->string());
         break;
       case ValueType::Date:
-        out_ += fmt::format("<date>{}</date>\n", EK_TRY(formatDate(value.date()->seconds)));
+        out_ += fmt::format("<date>{}</date>\n", formatDate(value.date()->seconds));
         break;
       case ValueType::Array: {
-        if (depth == kMaxDepth) return tooDeep();
         const Array& array = *value.array();
         if (array.empty()) {
           out_ += "<array/>\n";
@@ -732,7 +770,6 @@ class Writer {
         break;
       }
       case ValueType::Dictionary: {
-        if (depth == kMaxDepth) return tooDeep();
         const Dictionary& dictionary = *value.dictionary();
         if (dictionary.empty()) {
           out_ += "<dict/>\n";
@@ -758,10 +795,6 @@ class Writer {
   static EkError tooLarge() {
     return EkError::format(
         fmt::format("cannot write dmap: the document exceeds the limit of {} bytes", kMaxFileSize));
-  }
-  static EkError tooDeep() {
-    return EkError::format(
-        fmt::format("cannot write dmap: nesting deeper than {} levels", kMaxDepth));
   }
 
   std::string out_;
@@ -807,6 +840,38 @@ Result<std::string> readRegularFile(const std::string& path) {
   return bytes;
 }
 
+struct Target {
+  std::string directory;
+  std::string name;
+};
+
+Result<Target> splitTarget(const std::string& path) {
+  const size_t slash = path.rfind('/');
+  Target target{slash == std::string::npos ? "."
+                : slash == 0               ? "/"
+                                           : path.substr(0, slash),
+                slash == std::string::npos ? path : path.substr(slash + 1)};
+  if (target.name.empty() || target.name == "." || target.name == "..") {
+    return EkError::posix(EINVAL, fmt::format("{}: not a file name", path));
+  }
+  return target;
+}
+
+// The temporary files of a target are this prefix followed by mkstemp's six characters.
+std::string temporaryPrefix(std::string_view name) {
+  return fmt::format(".{}.", name);
+}
+constexpr size_t kTemporarySuffixLength = 6;
+
+bool isTemporaryName(std::string_view candidate, std::string_view prefix) {
+  if (candidate.size() != prefix.size() + kTemporarySuffixLength) return false;
+  if (!candidate.starts_with(prefix)) return false;
+  for (char c : candidate.substr(prefix.size())) {
+    if (!std::isalnum(static_cast<unsigned char>(c))) return false;
+  }
+  return true;
+}
+
 bool writeAll(int fd, std::string_view bytes) {
   while (!bytes.empty()) {
     const ssize_t written = ::write(fd, bytes.data(), bytes.size());
@@ -836,6 +901,19 @@ Result<Value> readFile(const std::string& path) {
   return value;
 }
 
+Result<void> checkWritable(const Value& value, size_t depth) {
+  EK_TRY(checkOne(value, depth));
+  if (const Array* array = value.array()) {
+    for (const Value& item : *array) EK_TRY(checkWritable(item, depth + 1));
+  } else if (const Dictionary* dictionary = value.dictionary()) {
+    for (const auto& [key, item] : *dictionary) {
+      EK_TRY(checkText(key));
+      EK_TRY(checkWritable(item, depth + 1));
+    }
+  }
+  return {};
+}
+
 Result<std::string> write(const Value& value) {
   return Writer().run(value);
 }
@@ -858,17 +936,11 @@ Result<void> writeFileAtomically(const std::string& path, const Value& value, mo
 Result<void> writeBytesAtomically(const std::string& path, std::string_view bytes, mode_t mode,
                                   Durability durability) {
   const bool durable = durability == Durability::Durable;
-  const size_t slash = path.rfind('/');
-  const std::string directory = slash == std::string::npos ? "."
-                                : slash == 0               ? "/"
-                                                           : path.substr(0, slash);
-  const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-  if (name.empty() || name == "." || name == "..") {
-    return EkError::posix(EINVAL, fmt::format("{}: not a file name", path));
-  }
+  const Target target = EK_TRY(splitTarget(path));
+  const std::string& directory = target.directory;
 
   // Hidden, and named after the target so a leftover from a crash says where it came from.
-  std::string temporary = fmt::format("{}/.{}.XXXXXX", directory, name);
+  std::string temporary = fmt::format("{}/{}XXXXXX", directory, temporaryPrefix(target.name));
   const int rawFd = ::mkostemp(temporary.data(), O_CLOEXEC);
   if (rawFd < 0)
     return EkError::fromErrno(errno, fmt::format("create a temporary file for {}", path));
@@ -894,6 +966,38 @@ Result<void> writeBytesAtomically(const std::string& path, std::string_view byte
     return EkError::fromErrno(errno, fmt::format("fsync {}", directory));
   }
   return {};
+}
+
+Result<size_t> removeStaleTemporaries(const std::string& path) {
+  const Target target = EK_TRY(splitTarget(path));
+  const std::string prefix = temporaryPrefix(target.name);
+  UniqueFd directoryFd(::open(target.directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (directoryFd.get() < 0)
+    return EkError::fromErrno(errno, fmt::format("open {}", target.directory));
+  // The listing gets its own descriptor: closedir closes what it was given.
+  const int listingFd = ::fcntl(directoryFd.get(), F_DUPFD_CLOEXEC, 0);
+  DIR* listing = listingFd < 0 ? nullptr : ::fdopendir(listingFd);
+  if (listing == nullptr) {
+    const int error = errno;
+    if (listingFd >= 0) ::close(listingFd);
+    return EkError::fromErrno(error, fmt::format("list {}", target.directory));
+  }
+  std::vector<std::string> stale;
+  while (const dirent* entry = ::readdir(listing)) {
+    if (isTemporaryName(entry->d_name, prefix)) stale.emplace_back(entry->d_name);
+  }
+  ::closedir(listing);
+  size_t removed = 0;
+  for (const std::string& name : stale) {
+    struct stat status;
+    // Only what a writer leaves: a regular file, never what a link points at.
+    if (::fstatat(directoryFd.get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0 ||
+        !S_ISREG(status.st_mode)) {
+      continue;
+    }
+    if (::unlinkat(directoryFd.get(), name.c_str(), 0) == 0) ++removed;
+  }
+  return removed;
 }
 
 }  // namespace ek::dmap

@@ -42,11 +42,18 @@ Result<Value> parse(std::string_view bytes);
 // the file and line ("<path>: line 12: ...").
 Result<Value> readFile(const std::string& path);
 
+// Whether write() can carry value placed depth containers below the document's root (the root
+// value is at depth 0; an entry of writeEntry at level L is at depth L): success, or the Format
+// error write() would refuse it with. Strings or keys that are not valid UTF-8 or hold
+// characters XML 1.0 forbids (C0 controls other than tab, line feed and carriage return;
+// U+FFFE, U+FFFF), non-finite doubles or dates, dates outside the years 0001-9999 and nesting
+// deeper than kMaxDepth are refused. Sizes are not checked. The writer makes this same check of
+// every value it writes, so what this accepts is written.
+Result<void> checkWritable(const Value& value, size_t depth = 0);
+
 // Writes the value as a dmap document, indented with tabs. Values the format cannot carry are
-// refused with a Format error: strings or keys that are not valid UTF-8 or hold characters
-// XML 1.0 forbids (C0 controls other than tab, line feed and carriage return; U+FFFE, U+FFFF),
-// non-finite doubles or dates, dates outside the years 0000-9999, nesting deeper than
-// kMaxDepth and documents larger than kMaxFileSize.
+// refused with a Format error (see checkWritable), and so are documents larger than
+// kMaxFileSize.
 // Lossy on purpose: a UUID is written as its canonical string (and reads back as a string);
 // a date is written to the whole second, rounded down.
 Result<std::string> write(const Value& value);
@@ -79,5 +86,10 @@ Result<void> writeFileAtomically(const std::string& path, const Value& value, mo
 // The same for raw bytes.
 Result<void> writeBytesAtomically(const std::string& path, std::string_view bytes,
                                   mode_t mode = 0644, Durability durability = Durability::Durable);
+
+// Removes what writeBytesAtomically leaves of path when the process dies between creating its
+// temporary file and renaming it: the regular files named as its temporaries for path, in
+// path's directory only. Answers how many went.
+Result<size_t> removeStaleTemporaries(const std::string& path);
 
 }  // namespace ek::dmap

@@ -3,8 +3,10 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+
 #include <sys/stat.h>
 #include <unistd.h>
+#include <algorithm>
 
 #include <cerrno>
 #include <cmath>
@@ -121,7 +123,7 @@ TEST(Dmap, RoundTripsEveryTypeAndNesting) {
       Value(Date{-86400}),
       Value(Date{1700000000}),
       Value(Date{253402300799}),  // 9999-12-31T23:59:59Z
-      Value(Date{-62167219200}),  // 0000-01-01T00:00:00Z
+      Value(Date{-62135596800}),  // 0001-01-01T00:00:00Z
       Value(Array{}),
       Value(Dictionary{}),
       Value(Array{Value(1), Value("two"), Value(Array{Value(3.5), Value(Dictionary{})})}),
@@ -216,14 +218,27 @@ TEST(Dmap, WriteRefusesValuesTheFormatCannotCarry) {
       Value(std::numeric_limits<double>::infinity()),
       Value(Date{std::numeric_limits<double>::infinity()}),
       Value(Date{253402300800}),  // 10000-01-01
-      Value(Date{-62167219201}),  // before year 0000
+      Value(Date{-62135596801}),  // before year 0001
       deep,                       // kMaxDepth + 1 nested arrays
   };
   for (const Value& value : values) {
     Result<std::string> written = write(value);
     ASSERT_FALSE(written.ok()) << value.description();
     EXPECT_EQ(written.error().domain, kFormatErrorDomain);
+    // The check refuses what the writer refuses, with the same error, wherever it sits.
+    Result<void> checked = checkWritable(value);
+    ASSERT_FALSE(checked.ok()) << value.description();
+    EXPECT_EQ(checked.error(), written.error());
+    EXPECT_FALSE(checkWritable(Value(Dictionary{{"k", Value(Array{value})}})).ok());
   }
+  // Depth counts where the value will sit: the deepest that fits at the root is one too deep
+  // a level further down.
+  const Value fits = deep.array()->front();
+  EXPECT_TRUE(checkWritable(fits).ok());
+  EXPECT_TRUE(write(fits).ok());
+  EXPECT_FALSE(checkWritable(fits, 1).ok());
+  EXPECT_FALSE(checkWritable(Value(Dictionary{{"k", fits}})).ok());
+  EXPECT_TRUE(checkWritable(Value("tab\tline\nreturn\r & <escaped>"), kMaxDepth).ok());
 }
 
 TEST(Dmap, WriteRefusesDocumentsOverTheSizeLimit) {
@@ -366,6 +381,7 @@ TEST(Dmap, RefusesInvalidDatesAndReals) {
       "<date>2023-01-01 00:00:00Z</date>",
       "<date>2023-1-01T00:00:00Z</date>",
       "<date>12023-01-01T00:00:00Z</date>",
+      "<date>0000-12-31T23:59:59Z</date>",  // before the first year a writer can give
       "<date></date>",
       "<real>nan</real>",
       "<real>inf</real>",
@@ -631,6 +647,27 @@ TEST(DmapFile, UnwritableValueLeavesTheOldFile) {
   EXPECT_EQ(written.error().domain, kFormatErrorDomain);
   EXPECT_EQ(slurp(path), "old");
   EXPECT_EQ(dir.entries(), std::vector<std::string>{"prefs.dmap"});
+}
+
+TEST(DmapFile, StaleTemporariesOfTheTargetAloneAreRemoved) {
+  TempDir dir;
+  const std::string path = dir.file("Annotations");
+  for (const char* name : {"Annotations", ".Annotations.a1B2c3", ".Annotations.ZZZZZZ",
+                           "Annotations.bad-20260101T000000Z", ".Annotations.short",
+                           ".Annotations.toolong1", ".Other.a1B2c3"}) {
+    spit(dir.file(name), "x");
+  }
+  ASSERT_EQ(::mkdir(dir.file(".Annotations.dir123").c_str(), 0700), 0);
+  ASSERT_EQ(::symlink(path.c_str(), dir.file(".Annotations.link12").c_str()), 0);
+  Result<size_t> removed = removeStaleTemporaries(path);
+  ASSERT_TRUE(removed.ok()) << removed.error().message;
+  EXPECT_EQ(*removed, 2u);
+  std::vector<std::string> left = dir.entries();
+  std::sort(left.begin(), left.end());
+  EXPECT_EQ(left, (std::vector<std::string>{".Annotations.dir123", ".Annotations.link12",
+                                            ".Annotations.short", ".Annotations.toolong1",
+                                            ".Other.a1B2c3", "Annotations",
+                                            "Annotations.bad-20260101T000000Z"}));
 }
 
 }  // namespace

@@ -143,6 +143,9 @@ class Registry {
   virtual Uuid knowledgeUuid() = 0;
   // Drops in-process caches (the daemon's cache purge asks for it).
   virtual void clearCaches() = 0;
+  // Moves everything the registry's log holds into its main file and gives free space back,
+  // so that the file alone is the registry; the daemon asks for it when it stops.
+  virtual void checkpoint() {}
 
   // Observers are held weakly; one that is gone is dropped.
   virtual void addObserver(std::weak_ptr<RegistryObserver> observer) = 0;

@@ -1,12 +1,20 @@
 #include "platform/vantor/SqliteRegistry.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <fmt/format.h>
 #include <sqlite3.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <asio/steady_timer.hpp>
+
 #include <algorithm>
+#include <array>
+#include <atomic>
+#include <bit>
 #include <chrono>
+#include <cstring>
 #include <ctime>
 #include <filesystem>
 #include <map>
@@ -18,6 +26,7 @@
 
 #include "platform/cbor/Cbor.h"
 #include "platform/dmap/Dmap.h"
+#include "platform/io/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/paths/Directories.h"
 #include "platform/vantor/BundleSources.h"
@@ -414,14 +423,56 @@ Uuid columnUuid(sqlite3_stmt* statement, int column) {
 
 SqliteRegistry::SqliteRegistry(Options options) : options_(std::move(options)) {}
 
+// The idle checkpoint: a timer armed by the first change after a checkpoint, which waits until
+// the registry has gone unchanged for the idle delay.
+struct SqliteRegistry::IdleTimer {
+  using Clock = std::chrono::steady_clock;
+  explicit IdleTimer(asio::io_context& context) : timer(context) {}
+  std::mutex mutex;  // guards timer
+  asio::steady_timer timer;
+  std::atomic<Clock::rep> lastChange{0};
+  std::atomic<bool> armed{false};
+};
+
 SqliteRegistry::~SqliteRegistry() {
+  if (idle_) {
+    std::lock_guard lock(idle_->mutex);
+    idle_->timer.cancel();
+  }
   // Notices already posted run before the registry goes, so an observer that looks back into
   // the registry from a notice never finds it half destroyed.
   if (options_.queue && !options_.queue->isCurrent()) options_.queue->sync([] {});
   closeDatabase();
 }
 
+namespace {
+
+// SQLite's own reports: damage and failed I/O loudly, recovery notices as they come, the rest
+// (every failing statement passes through here too) only when asked for.
+void forwardSqliteLog(void*, int code, const char* message) {
+  switch (code & 0xff) {
+    case SQLITE_CORRUPT:
+    case SQLITE_NOTADB:
+    case SQLITE_IOERR:
+    case SQLITE_CANTOPEN:
+    case SQLITE_FULL:
+      log::vr().error("SQLite: %s (%s)", message, sqlite3_errstr(code));
+      break;
+    case SQLITE_NOTICE:
+      log::vr().defaultLevel("SQLite: %s", message);
+      break;
+    default:
+      log::vr().debug("SQLite: %s (%s)", message, sqlite3_errstr(code));
+  }
+}
+
+}  // namespace
+
 Result<std::shared_ptr<SqliteRegistry>> SqliteRegistry::open(Options options) {
+  // Only before SQLite's first use; later (another user of SQLite in the process) it is
+  // refused, and SQLite stays quiet as before.
+  static std::once_flag logging;
+  std::call_once(logging, [] { sqlite3_config(SQLITE_CONFIG_LOG, forwardSqliteLog, nullptr); });
   if (options.stateDir.empty()) options.stateDir = paths::stateDir();
   if (options.systemRoot.empty()) options.systemRoot = paths::systemRoot();
   if (options.databasePath.empty()) {
@@ -431,6 +482,7 @@ Result<std::shared_ptr<SqliteRegistry>> SqliteRegistry::open(Options options) {
   if (!options.queue) options.queue = SerialQueue::make("com.corvane.vantor");
   std::shared_ptr<SqliteRegistry> registry(new SqliteRegistry(std::move(options)));
   registry->observers_ = registry->options_.observers;
+  registry->idle_ = std::make_unique<IdleTimer>(QueuePool::shared().context());
   EK_TRY(registry->openDatabase());
   registry->checkLocale();
   if (registry->options_.scanOnOpen) registry->reconcile();
@@ -551,6 +603,19 @@ OpenResult openAndCheck(const std::string& path, sqlite3** out) {
             makeError(kDatabase,
                       fmt::format("schema version {} (expected {})", version, kSchemaVersion))};
   }
+  // Free pages go back to the file system (at each checkpoint); a file made before that is
+  // rebuilt once, since only a VACUUM changes the setting of a file that has tables.
+  std::string autoVacuum;
+  if ((rc = execute(db, "PRAGMA auto_vacuum", &autoVacuum)) != SQLITE_OK) {
+    return failure(db, rc, "reading the vacuum mode");
+  }
+  if (autoVacuum != "2") {
+    if ((rc = execute(db, "PRAGMA auto_vacuum=INCREMENTAL")) != SQLITE_OK ||
+        (rc = execute(db, "VACUUM")) != SQLITE_OK) {
+      log::vr().error("registry database %s: cannot turn on incremental vacuum: %s", path,
+                      sqlite3_errmsg(db));
+    }
+  }
   if ((rc = execute(db, fmt::format("PRAGMA cache_size=-{}", kCacheSizeKiB).c_str())) !=
           SQLITE_OK ||
       (rc = execute(db, "PRAGMA synchronous=FULL")) != SQLITE_OK ||
@@ -562,11 +627,124 @@ OpenResult openAndCheck(const std::string& path, sqlite3** out) {
   return {};
 }
 
+// The write-ahead log's layout (SQLite's file format): a 32-byte header, then frames of a
+// 24-byte header and one page each. Numbers are big-endian; the checksums run over 32-bit words
+// in the order the magic number's low bit names.
+constexpr size_t kWalHeaderSize = 32;
+constexpr size_t kWalFrameHeaderSize = 24;
+constexpr uint32_t kWalMagic = 0x377f0682;
+constexpr uint32_t kWalVersion = 3007000;
+
+uint32_t bigEndian32(const uint8_t* bytes) {
+  return uint32_t{bytes[0]} << 24 | uint32_t{bytes[1]} << 16 | uint32_t{bytes[2]} << 8 | bytes[3];
+}
+
+void walChecksum(bool bigEndianWords, const uint8_t* bytes, size_t size,
+                 std::array<uint32_t, 2>& sum) {
+  for (size_t i = 0; i + 8 <= size; i += 8) {
+    uint32_t first, second;
+    if (bigEndianWords) {
+      first = bigEndian32(bytes + i);
+      second = bigEndian32(bytes + i + 4);
+    } else {
+      std::memcpy(&first, bytes + i, 4);
+      std::memcpy(&second, bytes + i + 4, 4);
+      if constexpr (std::endian::native == std::endian::big) {
+        first = __builtin_bswap32(first);
+        second = __builtin_bswap32(second);
+      }
+    }
+    sum[0] += first + sum[1];
+    sum[1] += second + sum[0];
+  }
+}
+
+// Why SQLite would leave out changes committed to the write-ahead log at path, or nothing when
+// it would not: a log whose header is damaged is ignored whole, and one whose checksum chain
+// breaks is ignored from there on, which loses data when later frames belong to the same log
+// (frames of an earlier log, left behind by a restart, carry other salts and are harmless).
+std::optional<std::string> walDamage(const std::string& path) {
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
+  if (fd.get() < 0) return std::nullopt;
+  struct stat status {};
+  if (::fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return std::nullopt;
+  const auto size = static_cast<uint64_t>(status.st_size);
+  // Nothing was ever committed to a log without a frame.
+  if (size < kWalHeaderSize + kWalFrameHeaderSize) return std::nullopt;
+  uint8_t header[kWalHeaderSize];
+  if (::pread(fd.get(), header, sizeof header, 0) != static_cast<ssize_t>(sizeof header)) {
+    return fmt::format("cannot read its header: {}", std::strerror(errno));
+  }
+  const uint32_t magic = bigEndian32(header);
+  if ((magic & ~uint32_t{1}) != kWalMagic) return "its header has no write-ahead log magic number";
+  const bool bigEndianWords = (magic & 1) != 0;
+  if (bigEndian32(header + 4) != kWalVersion) return "its header names an unknown format version";
+  const uint32_t pageSize = bigEndian32(header + 8);
+  if (pageSize < 512 || pageSize > 65536 || (pageSize & (pageSize - 1)) != 0) {
+    return "its header names an impossible page size";
+  }
+  std::array<uint32_t, 2> sum{0, 0};
+  walChecksum(bigEndianWords, header, 24, sum);
+  if (sum[0] != bigEndian32(header + 24) || sum[1] != bigEndian32(header + 28)) {
+    return "its header checksum does not match";
+  }
+  const size_t frameSize = kWalFrameHeaderSize + pageSize;
+  std::vector<uint8_t> frame(frameSize);
+  bool broken = false;
+  uint64_t number = 0;
+  for (uint64_t offset = kWalHeaderSize; offset + frameSize <= size; offset += frameSize) {
+    ++number;
+    if (::pread(fd.get(), frame.data(), frameSize, static_cast<off_t>(offset)) !=
+        static_cast<ssize_t>(frameSize)) {
+      return fmt::format("cannot read frame {}: {}", number, std::strerror(errno));
+    }
+    const bool sameLog = std::memcmp(frame.data() + 8, header + 16, 8) == 0;
+    if (broken) {
+      if (sameLog)
+        return fmt::format("its checksums break before frame {} of the same log", number);
+      continue;
+    }
+    std::array<uint32_t, 2> next = sum;
+    walChecksum(bigEndianWords, frame.data(), 8, next);
+    walChecksum(bigEndianWords, frame.data() + kWalFrameHeaderSize, pageSize, next);
+    if (sameLog && bigEndian32(frame.data()) != 0 && next[0] == bigEndian32(frame.data() + 16) &&
+        next[1] == bigEndian32(frame.data() + 20)) {
+      sum = next;
+      continue;
+    }
+    broken = true;
+  }
+  return std::nullopt;
+}
+
 }  // namespace
 
 Result<void> SqliteRegistry::openDatabase() {
   const std::string& path = options_.databasePath;
   EK_TRY(paths::ensureDirectory(parentOf(path)));
+  // SQLite would open the database without a word and lose what the log held: say so, and keep
+  // both files for a person before the first write replaces the log.
+  const std::string wal = path + "-wal";
+  if (std::optional<std::string> damage = walDamage(wal)) {
+    std::string aside = fmt::format("{}.corrupt-{}", path, utcStamp());
+    for (int n = 1; access(aside.c_str(), F_OK) == 0; ++n) {
+      aside = fmt::format("{}.corrupt-{}-{}", path, utcStamp(), n);
+    }
+    std::error_code copyError;
+    std::filesystem::copy_file(path, aside, copyError);
+    if (!copyError) std::filesystem::copy_file(wal, aside + "-wal", copyError);
+    if (copyError) {
+      log::vr().error(
+          "registry write-ahead log %s is unusable (%s); changes it held are lost, "
+          "and it could not be kept aside: %s",
+          wal, *damage, copyError.message());
+    } else {
+      log::vr().error(
+          "registry write-ahead log %s is unusable (%s); changes it held are lost; "
+          "kept aside with its database as %s",
+          wal, *damage, aside);
+    }
+  }
   for (int attempt = 0; attempt < 2; ++attempt) {
     sqlite3* db = nullptr;
     OpenResult result = openAndCheck(path, &db);
@@ -856,7 +1034,56 @@ Result<void> SqliteRegistry::commitWithNewKnowledge() {
   }
   if (Use(s.commit).step() != SQLITE_DONE) return rollback("committing a change");
   knowledge_ = knowledge;
+  noteChange();
   return {};
+}
+
+void SqliteRegistry::noteChange() {
+  if (!idle_) return;
+  idle_->lastChange.store(IdleTimer::Clock::now().time_since_epoch().count());
+  if (!idle_->armed.exchange(true)) armIdleTimer(options_.idleDelay);
+}
+
+void SqliteRegistry::armIdleTimer(std::chrono::nanoseconds after) {
+  std::lock_guard lock(idle_->mutex);
+  idle_->timer.expires_after(after);
+  idle_->timer.async_wait([weak = weak_from_this()](const asio::error_code& error) {
+    if (error) return;
+    if (auto self = weak.lock()) self->idleTimerFired();
+  });
+}
+
+void SqliteRegistry::idleTimerFired() {
+  const auto seen = idle_->lastChange.load();
+  const auto quiet = IdleTimer::Clock::now().time_since_epoch() - IdleTimer::Clock::duration(seen);
+  if (quiet < options_.idleDelay) {
+    armIdleTimer(options_.idleDelay - quiet);
+    return;
+  }
+  idle_->armed.store(false);
+  checkpoint();
+  // A change between the reading of the clock and the clearing of armed saw the timer armed
+  // and left it alone: take it on here.
+  if (idle_->lastChange.load() != seen && !idle_->armed.exchange(true)) {
+    armIdleTimer(options_.idleDelay);
+  }
+}
+
+void SqliteRegistry::checkpoint() {
+  std::lock_guard db(dbMutex_);
+  if (db_ == nullptr) return;
+  const std::string& path = options_.databasePath;
+  // Freed pages first, so that the checkpoint carries their removal into the file.
+  if (execute(db_, "PRAGMA incremental_vacuum") != SQLITE_OK) {
+    log::vr().error("registry database %s: cannot give free pages back: %s", path,
+                    sqlite3_errmsg(db_));
+  }
+  int logged = 0, moved = 0;
+  if (sqlite3_wal_checkpoint_v2(db_, nullptr, SQLITE_CHECKPOINT_TRUNCATE, &logged, &moved) !=
+      SQLITE_OK) {
+    log::vr().error("registry database %s: cannot checkpoint its write-ahead log: %s", path,
+                    sqlite3_errmsg(db_));
+  }
 }
 
 Result<void> SqliteRegistry::applyPlan(Plan& plan) {

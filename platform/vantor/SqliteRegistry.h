@@ -2,6 +2,7 @@
 
 #include <sys/stat.h>
 
+#include <chrono>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -30,8 +31,15 @@ namespace ek::vantor {
 // Opening checks the file (quick_check and the schema version); one that is not a database,
 // fails the check or carries another schema version is renamed aside to
 // registry.db.corrupt-<UTC timestamp> (with its -wal and -shm) and a fresh registry is built.
-// Then the start-up scan runs (see reconcile).
-class SqliteRegistry : public Registry {
+// A write-ahead log that SQLite would silently ignore in part or whole (a damaged header, or a
+// broken checksum chain with later frames of the same log) is logged as an error and copied
+// aside with the database under the same name before the database opens. Then the start-up
+// scan runs (see reconcile).
+//
+// The log is moved into the main file (a TRUNCATE checkpoint) once the registry has gone
+// unchanged for Options::idleDelay and whenever checkpoint() is called, and free pages are
+// then given back (incremental auto-vacuum; an older file is rebuilt with it once at opening).
+class SqliteRegistry : public Registry, public std::enable_shared_from_this<SqliteRegistry> {
  public:
   struct Options {
     std::string databasePath;                  // default: <stateDir>/registry.db
@@ -45,6 +53,8 @@ class SqliteRegistry : public Registry {
     // How long a file must have been left alone before the scan trusts its stamp (see
     // BundleSources); tests shorten it.
     int64_t settleSeconds = BundleSources::kSettleSeconds;
+    // How long the registry must go unchanged before its log is checkpointed.
+    std::chrono::milliseconds idleDelay = std::chrono::seconds(10);
   };
 
   static Result<std::shared_ptr<SqliteRegistry>> open(Options options);
@@ -69,6 +79,7 @@ class SqliteRegistry : public Registry {
                               const std::vector<std::string>& keys) override;
   Uuid knowledgeUuid() override;
   void clearCaches() override;
+  void checkpoint() override;
   void addObserver(std::weak_ptr<RegistryObserver> observer) override;
   void removeObserver(const std::shared_ptr<RegistryObserver>& observer) override;
 
@@ -93,6 +104,10 @@ class SqliteRegistry : public Registry {
   Result<void> openDatabase();
   Result<void> prepareSchema();
   void closeDatabase();
+  // Arms the idle checkpoint after a change.
+  void noteChange();
+  void armIdleTimer(std::chrono::nanoseconds after);
+  void idleTimerFired();
 
   // Under changeMutex_.
   Result<void> applyPlan(Plan& plan);
@@ -133,6 +148,9 @@ class SqliteRegistry : public Registry {
   };
   static constexpr size_t kKeptUuidsLimit = 65536;
   UuidLists uuidLists_;
+
+  struct IdleTimer;
+  std::unique_ptr<IdleTimer> idle_;
 
   std::mutex observersMutex_;
   std::vector<std::weak_ptr<RegistryObserver>> observers_;

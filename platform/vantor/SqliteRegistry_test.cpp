@@ -126,6 +126,7 @@ class SqliteRegistryTest : public ::testing::Test {
     options.codeSigning = codeSigning_;
     options.queue = queue_;
     options.observers = {recorder_};
+    options.idleDelay = idleDelay_;
     return options;
   }
 
@@ -183,6 +184,7 @@ class SqliteRegistryTest : public ::testing::Test {
   std::shared_ptr<SerialQueue> queue_;
   std::shared_ptr<Recorder> recorder_;
   std::shared_ptr<SqliteRegistry> registry_;
+  std::chrono::milliseconds idleDelay_ = std::chrono::seconds(10);
 };
 
 TEST_F(SqliteRegistryTest, RegisteredPlugInIsFoundByUuidPathAndUrl) {
@@ -823,6 +825,40 @@ TEST_F(SqliteRegistryTest, DatabaseFailingItsCheckIsMovedAsideAndRebuilt) {
   open();
   EXPECT_EQ(asideDatabases(state_), 1u);
   EXPECT_TRUE(registry_->installedPlugIns().empty());
+}
+
+TEST_F(SqliteRegistryTest, LogIsMovedIntoTheFileWhenIdleAndFreedSpaceIsGivenBack) {
+  const std::string file = state_ + "/registry.db";
+  // A file of before incremental vacuum is rebuilt with it.
+  open();
+  registry_.reset();
+  {
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open(file.c_str(), &db), SQLITE_OK);
+    ASSERT_EQ(sqlite3_exec(db, "PRAGMA auto_vacuum=NONE; VACUUM;", nullptr, nullptr, nullptr),
+              SQLITE_OK);
+    sqlite3_close(db);
+  }
+  idleDelay_ = std::chrono::milliseconds(20);
+  SqliteRegistry& registry = open();
+  std::vector<std::pair<std::string, Dictionary>> plugIns;
+  for (int i = 0; i < 100; ++i) {
+    plugIns.push_back({"P" + std::to_string(i) + ".appex",
+                       plugInInfo("com.example.p" + std::to_string(i), "com.x.p",
+                                  {{"padding", Value(std::string(4000, 'p'))}})});
+  }
+  ASSERT_TRUE(registry.registerBundle(writeApp("X.app", "com.example.x", plugIns)).ok());
+  // Nothing else changes: the log is soon empty, and the file alone holds the registry.
+  for (int i = 0; i < 500 && fs::file_size(file + "-wal") > 0; ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  EXPECT_EQ(fs::file_size(file + "-wal"), 0u);
+  const auto full = fs::file_size(file);
+
+  ASSERT_TRUE(registry.unregisterBundle(apps_ + "/X.app").ok());
+  registry.checkpoint();
+  EXPECT_EQ(fs::file_size(file + "-wal"), 0u);
+  EXPECT_LT(fs::file_size(file) * 4, full);
 }
 
 TEST_F(SqliteRegistryTest, SecondOpenWhileHeldFailsWithoutTouchingTheFile) {
