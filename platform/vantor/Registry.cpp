@@ -136,23 +136,6 @@ std::string extensionPointIndexKey(std::string_view value) {
   return key;
 }
 
-Dictionary mergeSdk(const Dictionary& sdk, const Dictionary& info) {
-  Dictionary merged = info;
-  for (const auto& [key, sdkValue] : sdk) {
-    auto it = merged.find(key);
-    if (it == merged.end()) {
-      merged.emplace(key, sdkValue);
-      continue;
-    }
-    const Dictionary* sdkDictionary = sdkValue.dictionary();
-    Dictionary* own = it->second.dictionary();
-    if (sdkDictionary != nullptr && own != nullptr) {
-      it->second = Value(mergeSdk(*sdkDictionary, *own));
-    }
-  }
-  return merged;
-}
-
 std::string fileUrlForPath(std::string_view path) {
   static constexpr char kHex[] = "0123456789ABCDEF";
   std::string url = "file://";

@@ -10,6 +10,7 @@
 #include "platform/value/Result.h"
 #include "platform/value/Uuid.h"
 #include "platform/value/Value.h"
+#include "platform/vantor/SdkMerge.h"
 
 // Vantor, the application registry: which applications and plug-ins are installed, with the
 // facts the daemon builds its plug-in records from.
@@ -50,7 +51,7 @@ struct PlugInProxy {
   std::string url;   // file URL of path
   std::optional<std::string> containingAppPath;
   std::optional<std::string> containingAppName;  // localized
-  // Info.dmap with the SDK dictionary merged in (the plug-in's own values winning) and
+  // Info.dmap with the SDK dictionary merged in (mergeSdk) and
   // ZuExtensionPointIdentifier copied into ZuExtensionAttributes when it was missing there.
   Dictionary info;
   Dictionary sdk;  // the extension point's SDK dictionary; empty when it has none
@@ -166,10 +167,6 @@ std::vector<std::string> extensionPointIndexValues(const Dictionary& mergedInfo)
 // The index key of a value: digit runs lose their leading zeros, because rule values compare
 // runs of digits by number; the index may then answer a few more candidates, never fewer.
 std::string extensionPointIndexKey(std::string_view value);
-
-// SDK merge: a copy of info with sdk merged in at every depth, the plug-in's own values
-// winning; dictionaries on both sides are merged key by key.
-Dictionary mergeSdk(const Dictionary& sdk, const Dictionary& info);
 
 // file:// URL of an absolute path, percent-encoded as RFC 3986 writes a path.
 std::string fileUrlForPath(std::string_view path);
