@@ -1,6 +1,10 @@
 #include "Ekora/EkSandboxExtension.h"
 
+#include <fmt/format.h>
+#include <sys/stat.h>
+
 #include <cerrno>
+#include <cstdlib>
 
 #include "platform/log/Log.h"
 
@@ -13,6 +17,41 @@ Result<std::string> issueFileExtension(const EkFileURL& url) {
 Result<std::string> issueFileExtension(const EkFileURL& url, EkSandbox& sandbox) {
   Result<std::string> token = sandbox.issueFileExtension(url.path(), sandbox::kCanonicalizeFlag);
   if (token) log::sandbox().debug("issued file extension for %s -> %s", url.path(), *token);
+  return token;
+}
+
+Result<std::string> issueBundleExtension(std::string_view bundlePath,
+                                         const std::optional<EkBundleIdentity>& identity,
+                                         std::string_view relative, EkSandbox& sandbox) {
+  const std::string bundle(bundlePath);
+  if (!identity) {
+    return EkError::posix(ESTALE,
+                          fmt::format("{}: the bundle's directory was not recorded", bundle));
+  }
+  struct stat status {};
+  if (::stat(bundle.c_str(), &status) != 0) return EkError::fromErrno(errno, bundle);
+  if (!S_ISDIR(status.st_mode) || static_cast<uint64_t>(status.st_dev) != identity->device ||
+      static_cast<uint64_t>(status.st_ino) != identity->inode) {
+    return EkError::posix(ESTALE, fmt::format("{}: not the directory that was registered", bundle));
+  }
+  const std::string& root = identity->canonicalPath;
+  std::string subject = root;
+  if (!relative.empty() && relative != ".") {
+    const std::string target =
+        root == "/" ? fmt::format("/{}", relative) : fmt::format("{}/{}", root, relative);
+    char* resolved = ::realpath(target.c_str(), nullptr);
+    if (resolved == nullptr) return EkError::fromErrno(errno, target);
+    subject = resolved;
+    ::free(resolved);
+    const bool inside =
+        subject == root || root == "/" ||
+        (subject.size() > root.size() && subject.starts_with(root) && subject[root.size()] == '/');
+    if (!inside) {
+      return EkError::posix(EPERM, fmt::format("{}: leads out of the bundle", target));
+    }
+  }
+  Result<std::string> token = sandbox.issueCanonicalFileExtension(subject);
+  if (token) log::sandbox().debug("issued file extension for %s -> %s", subject, *token);
   return token;
 }
 
