@@ -28,10 +28,20 @@ Result<std::string> issueBundleExtension(std::string_view bundlePath,
     return EkError::posix(ESTALE,
                           fmt::format("{}: the bundle's directory was not recorded", bundle));
   }
-  struct stat status {};
-  if (::stat(bundle.c_str(), &status) != 0) return EkError::fromErrno(errno, bundle);
-  if (!S_ISDIR(status.st_mode) || static_cast<uint64_t>(status.st_dev) != identity->device ||
-      static_cast<uint64_t>(status.st_ino) != identity->inode) {
+  // The path as named and the canonical path the token will name, which must still be the
+  // directory itself rather than a link: a link there could be turned elsewhere once the
+  // token is out.
+  auto registered = [&](const struct stat& status) {
+    return S_ISDIR(status.st_mode) && static_cast<uint64_t>(status.st_dev) == identity->device &&
+           static_cast<uint64_t>(status.st_ino) == identity->inode;
+  };
+  struct stat named {};
+  struct stat canonical {};
+  if (::stat(bundle.c_str(), &named) != 0) return EkError::fromErrno(errno, bundle);
+  if (::lstat(identity->canonicalPath.c_str(), &canonical) != 0) {
+    return EkError::fromErrno(errno, identity->canonicalPath);
+  }
+  if (!registered(named) || !registered(canonical)) {
     return EkError::posix(ESTALE, fmt::format("{}: not the directory that was registered", bundle));
   }
   const std::string& root = identity->canonicalPath;
