@@ -59,8 +59,15 @@ constexpr int kCacheSizeKiB = 2 * 1024;
   "ALTER TABLE plugins ADD COLUMN device INTEGER; " \
   "ALTER TABLE plugins ADD COLUMN inode INTEGER; "  \
   "ALTER TABLE plugins ADD COLUMN real_path TEXT;"
-// Rows without one are read again by the next scan, which records it.
-#define IDENTITY_UPGRADE IDENTITY_SCHEMA " DELETE FROM plugin_sources;"
+// Rows without one are read again by the next scan, which records it. Rows whose info no
+// bundle could give now (its Info.dmap and its SDK's, 1 MiB each, encode smaller than they
+// read) were read before files were bounded: they are dropped, so a reply is not made of them.
+#define IDENTITY_UPGRADE                                                      \
+  IDENTITY_SCHEMA                                                             \
+  " DELETE FROM plugin_sources;"                                              \
+  " DELETE FROM plugin_points WHERE uuid IN (SELECT uuid FROM plugins WHERE " \
+  "length(info) > 2097152);"                                                  \
+  " DELETE FROM plugins WHERE length(info) > 2097152;"
 
 constexpr const char* kSchema = R"sql(
 CREATE TABLE meta(key TEXT PRIMARY KEY, value BLOB NOT NULL);
