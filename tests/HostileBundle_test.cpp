@@ -194,6 +194,34 @@ TEST_F(HostileBundle, ListsOverTenThousandEntriesAreRefused) {
   EXPECT_EQ(replyErrorCode(find(bundle)), 0);
 }
 
+// Bundles each within the file limit, but together more than a frame can carry: the match
+// that would send them all is answered with an error, and the daemon goes on serving.
+TEST_F(HostileBundle, ReplyLargerThanAFrameIsAnError) {
+  Array paths;
+  for (int i = 0; i < 34; ++i) {
+    const fs::path bundle = plugIn("Large" + std::to_string(i));
+    Dictionary info = plugInInfo("com.example.large" + std::to_string(i));
+    // Under ZuExtension, so each form carries it twice ("info" and "bundleInfo").
+    Dictionary extension = *info["ZuExtension"].dictionary();
+    extension["ZuExtensionPointIdentifier"] = Value("com.example.large");
+    extension["Padding"] = Value(std::string(1000 * 1000, 'x'));
+    info["ZuExtension"] = Value(std::move(extension));
+    writeInfo(bundle / "Info.dmap", info);
+    paths.emplace_back(bundle.string());
+  }
+  ASSERT_EQ(replyErrorCode(add(std::move(paths))), 0);
+  auto match = [](const char* point) {
+    return ask(request(
+        "match", {{"rules", Value(Dictionary{{"ZuExtensionPointIdentifier", Value(point)}})}}));
+  };
+  Value refused = match("com.example.large");
+  EXPECT_EQ(replyErrorCode(refused), 4) << refused.description().substr(0, 200);
+  EXPECT_NE(replyError(refused).find("exceeds the frame limit of 67108864 bytes"),
+            std::string::npos)
+      << replyError(refused);
+  EXPECT_EQ(replyErrorCode(match("com.example.hostile")), 0);
+}
+
 // A long "add" goes on in slices: a "find" sent by another client after it is answered
 // while the add is still at work.
 TEST_F(HostileBundle, LongAddDoesNotHoldOtherClients) {
