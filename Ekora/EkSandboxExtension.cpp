@@ -47,8 +47,10 @@ Result<std::string> issueBundleExtension(std::string_view bundlePath,
   const std::string& root = identity->canonicalPath;
   std::string subject = root;
   if (!relative.empty() && relative != ".") {
-    const std::string target =
-        root == "/" ? fmt::format("/{}", relative) : fmt::format("{}/{}", root, relative);
+    // An absolute entry names what it names, and is then refused unless that lies inside.
+    const std::string target = relative.front() == '/' ? std::string(relative)
+                               : root == "/"           ? fmt::format("/{}", relative)
+                                                       : fmt::format("{}/{}", root, relative);
     char* resolved = ::realpath(target.c_str(), nullptr);
     if (resolved == nullptr) return EkError::fromErrno(errno, target);
     subject = resolved;
