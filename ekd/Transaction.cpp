@@ -106,6 +106,7 @@ void Transaction::done() {
     std::string text = reply.description();
     EK_PROBE2(request_output, client_->pid(), text.c_str());
   }
+  if (!request_.wantsReply()) return;
   std::vector<uint8_t> frame(wyre::kHeaderSize);
   cbor::encode(reply, frame);
   sendFrame(std::move(frame));
