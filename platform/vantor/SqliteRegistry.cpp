@@ -176,9 +176,12 @@ std::vector<std::string> subdirectories(const std::string& dir, std::string_view
 }
 
 // A bundle's Info.dmap, read beneath its directory; with identity, the directory it was read
-// from. With sources, notes the files read (see BundleSources) before reading them.
+// from, and with directoryOut, that directory kept open so that the bundle's other files are
+// read from the same one. With sources, notes the files read (see BundleSources) before
+// reading them.
 Result<Dictionary> readInfo(const std::string& bundle, BundleSources* sources = nullptr,
-                            std::optional<BundleIdentity>* identity = nullptr) {
+                            std::optional<BundleIdentity>* identity = nullptr,
+                            UniqueFd* directoryOut = nullptr) {
   if (sources) {
     sources->note(bundle);
     sources->note(paths::join(bundle, "Info.dmap"));
@@ -203,12 +206,15 @@ Result<Dictionary> readInfo(const std::string& bundle, BundleSources* sources = 
     return makeError(kMalformedBundle,
                      fmt::format("{}: Info.dmap does not hold a dictionary", bundle));
   }
+  if (directoryOut) *directoryOut = std::move(directory);
   return std::move(*value->dictionary());
 }
 
 // Every <language>.lproj/InfoDmap.strings of the bundle: language -> table. A malformed table
 // is logged and left out; it does not make the bundle malformed.
-Dictionary readInfoStrings(const std::string& bundle, BundleSources* sources = nullptr) {
+// directoryFd, when given, is the bundle directory open.
+Dictionary readInfoStrings(const std::string& bundle, BundleSources* sources = nullptr,
+                           int directoryFd = -1) {
   Dictionary tables;
   bool truncated = false;
   for (const std::string& dir :
@@ -220,7 +226,8 @@ Dictionary readInfoStrings(const std::string& bundle, BundleSources* sources = n
       sources->note(paths::join(bundle, dir));
       sources->note(file);
     }
-    auto value = dmap::readFileBeneath(bundle, relative);
+    auto value = directoryFd >= 0 ? dmap::readFileBeneath(directoryFd, bundle, relative)
+                                  : dmap::readFileBeneath(bundle, relative);
     if (!value.ok()) {
       if (!value.error().isPosix(ENOENT)) {
         log::vr().error("ignoring strings table %s: %s", file, value.error().message);
@@ -792,7 +799,8 @@ struct BundleReader {
   Result<PlugInPlan> readPlugIn(const std::string& path) {
     BundleSources sources(sourcesContext(), options.settleSeconds);
     std::optional<BundleIdentity> identity;
-    Dictionary own = EK_TRY(readInfo(path, &sources, &identity));
+    UniqueFd directory;
+    Dictionary own = EK_TRY(readInfo(path, &sources, &identity, &directory));
     auto identifier = stringValue(own, kBundleIdentifierKey);
     if (!identifier) {
       return makeError(kMalformedBundle,
@@ -849,7 +857,13 @@ struct BundleReader {
     if (!dataOnly) {
       plan.container = paths::join(paths::join(options.stateDir, "containers"), plan.identifier);
     }
-    plan.strings = readInfoStrings(path, &sources);
+    plan.strings = readInfoStrings(path, &sources, directory.get());
+    // The entitlements were read by path: a bundle swapped for a link meanwhile could have
+    // given them from elsewhere.
+    if (bundleIdentityOf(path) != plan.identity) {
+      return makeError(kMalformedBundle,
+                       fmt::format("{}: the directory changed while it was read", path));
+    }
     plan.sources = sources.record();
     std::string parent = parentOf(path);
     if (baseName(parent) == "PlugIns" && endsWith(parentOf(parent), ".app")) {
