@@ -77,19 +77,15 @@ bool isValidExecutableName(std::string_view name) {
   return true;
 }
 
-// A dmap file whose root is a dictionary, refused above maxSize before it is read.
-Result<Dictionary> readDictionaryFile(const std::string& path, size_t maxSize) {
-  struct stat status;
-  if (::stat(path.c_str(), &status) != 0) return EkError::fromErrno(errno, path);
-  if (S_ISREG(status.st_mode) && static_cast<uint64_t>(status.st_size) > maxSize) {
-    return EkError::posix(EFBIG, fmt::format("{}: file of {} bytes exceeds the limit of {}", path,
-                                             status.st_size, maxSize));
-  }
-  Result<Value> value = dmap::readFile(path);
+// The dmap file at relative beneath the bundle directory, whose root is a dictionary. Nothing
+// a bundle holds may make the reader follow a link out of it or read a special file.
+Result<Dictionary> readDictionaryFile(const std::string& directory, std::string_view relative) {
+  Result<Value> value = dmap::readFileBeneath(directory, relative, bundle::kMaxInfoFileSize);
   if (!value) return std::move(value).error();
   Dictionary* dictionary = value->dictionary();
   if (dictionary == nullptr) {
-    return EkError::format(fmt::format("{}: the root value is not a dictionary", path));
+    return EkError::format(fmt::format("{}: the root value is not a dictionary",
+                                       appendComponent(directory, relative)));
   }
   return std::move(*dictionary);
 }
@@ -110,8 +106,7 @@ std::shared_ptr<const EkBundleObject> EkBundleObject::create(std::string_view pa
   if (mode == EkBundleMode::Bundle) {
     if (!S_ISDIR(status.st_mode)) return object;
     object->bundlePath_ = *normalized;
-    Result<Dictionary> info = readDictionaryFile(
-        appendComponent(*normalized, bundle::kInfoFileName), bundle::kMaxInfoFileSize);
+    Result<Dictionary> info = readDictionaryFile(*normalized, bundle::kInfoFileName);
     if (!info) {
       object->infoError_ = std::move(info).error();
       return object;
@@ -132,8 +127,7 @@ std::shared_ptr<const EkBundleObject> EkBundleObject::create(std::string_view pa
   if (!S_ISREG(status.st_mode)) return object;
   std::optional<std::string> ancestor = parentPath(*normalized);
   for (size_t depth = 0; ancestor && depth < bundle::kMaxExecutableSearchDepth; ++depth) {
-    Result<Dictionary> info = readDictionaryFile(appendComponent(*ancestor, bundle::kInfoFileName),
-                                                 bundle::kMaxInfoFileSize);
+    Result<Dictionary> info = readDictionaryFile(*ancestor, bundle::kInfoFileName);
     if (info) {
       auto found = info->find(bundle::kExecutableKey);
       const std::string* executable = found == info->end() ? nullptr : found->second.string();
@@ -274,11 +268,9 @@ Result<Dictionary> EkBundle::stringsTable(std::string_view table, std::string_vi
   }
   std::optional<std::string> bundlePath = path();
   if (!bundlePath) return EkError::posix(ENOENT, "the bundle did not resolve");
-  const std::string directory =
-      appendComponent(*bundlePath, fmt::format("{}{}", language, bundle::kLocalizationSuffix));
-  return readDictionaryFile(
-      appendComponent(directory, fmt::format("{}{}", table, bundle::kStringsSuffix)),
-      bundle::kMaxStringsFileSize);
+  return readDictionaryFile(*bundlePath,
+                            fmt::format("{}{}/{}{}", language, bundle::kLocalizationSuffix, table,
+                                        bundle::kStringsSuffix));
 }
 
 std::optional<std::string> EkBundle::localizedString(std::string_view key, std::string_view table,

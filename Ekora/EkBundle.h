@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "Ekora/EkFileURL.h"
+#include "platform/dmap/Dmap.h"
 #include "platform/value/EkError.h"
 #include "platform/value/Result.h"
 #include "platform/value/Value.h"
@@ -30,9 +31,9 @@ inline constexpr std::string_view kInfoStringsTable = "InfoDmap";
 // The table used when a caller names none.
 inline constexpr std::string_view kDefaultStringsTable = "Localizable";
 
-// Bundles come from anyone who can write a directory: everything read from one is bounded.
-inline constexpr size_t kMaxInfoFileSize = 1024 * 1024;
-inline constexpr size_t kMaxStringsFileSize = 4 * 1024 * 1024;
+// Bundles come from anyone who can write a directory: everything read from one is bounded,
+// its dmap files (info dictionary, strings tables) alike.
+inline constexpr size_t kMaxInfoFileSize = dmap::kMaxBundleFileSize;
 // How many ancestors of an executable are searched for the bundle that declares it.
 inline constexpr size_t kMaxExecutableSearchDepth = 16;
 // Longest QvBundleExecutable honoured, and longest language or table name.
@@ -120,9 +121,11 @@ class EkBundle {
   // Whether the bundle lies on the system volume ($EKORA_SYSTEM_ROOT).
   bool isOnSystemVolume() const;
 
-  // The strings table <bundle>/<language>.lproj/<table>.strings. Errors: ENOENT when the
-  // bundle did not resolve or the file is missing, EINVAL for a table or language that is not
-  // a plain file name, a Format error for a file that is not a dmap dictionary.
+  // The strings table <bundle>/<language>.lproj/<table>.strings, read beneath the bundle
+  // (dmap::readFileBeneath). Errors: ENOENT when the bundle did not resolve or the file is
+  // missing, EINVAL for a table or language that is not a plain file name, EXDEV for a link
+  // out of the bundle, EFBIG over kMaxInfoFileSize, a Format error for a file that is not a
+  // regular file holding a dmap dictionary.
   Result<Dictionary> stringsTable(std::string_view table, std::string_view language) const;
   // The first string under key in table for languages, tried in order.
   std::optional<std::string> localizedString(std::string_view key, std::string_view table,

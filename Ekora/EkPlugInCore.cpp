@@ -10,6 +10,7 @@
 #include "Ekora/EkCollections.h"
 #include "Ekora/EkPlugInKeys.h"
 #include "platform/log/Log.h"
+#include "platform/vantor/SdkMerge.h"
 
 namespace ek {
 
@@ -604,41 +605,15 @@ std::optional<Dictionary> EkPlugInCore::readSDKDictionary(std::string_view exten
 }
 
 Dictionary EkPlugInCore::mergeDictionary(const Dictionary& sdk, const Dictionary& target) {
-  Dictionary merged = target;
-  for (const auto& [key, sdkValue] : sdk) {
-    auto it = merged.find(key);
-    if (it == merged.end()) {
-      merged.emplace(key, sdkValue);
-    } else if (sdkOverridesKey(key)) {
-      it->second = sdkValue;
-    } else if (key == pk::kShared) {
-      it->second = Value(mergeSharedResources(&sdkValue, &it->second));
-    } else if (const Dictionary* sdkDictionary = sdkValue.dictionary()) {
-      if (const Dictionary* ownDictionary = it->second.dictionary()) {
-        it->second = Value(mergeDictionary(*sdkDictionary, *ownDictionary));
-      }
-    }
-  }
-  return merged;
+  return vantor::mergeSdk(sdk, target);
 }
 
 bool EkPlugInCore::sdkOverridesKey(std::string_view key) {
-  return key == pk::kCleanTimeout;
+  return vantor::sdkOverridesKey(key);
 }
 
 Array EkPlugInCore::mergeSharedResources(const Value* sdkList, const Value* plugInList) {
-  std::set<std::string, std::less<>> paths;
-  for (const Value* list : {sdkList, plugInList}) {
-    if (list == nullptr) continue;
-    if (const std::string* single = list->string()) {
-      paths.insert(*single);
-    } else if (const Array* many = list->array()) {
-      for (const Value& element : *many) {
-        if (const std::string* path = element.string()) paths.insert(*path);
-      }
-    }
-  }
-  return Array(paths.begin(), paths.end());
+  return vantor::mergeSharedLists(sdkList, plugInList);
 }
 
 void EkPlugInCore::canonicalize() {

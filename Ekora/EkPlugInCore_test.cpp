@@ -383,65 +383,6 @@ TEST_F(EkPlugInCoreTest, DiagnoseReportsMissingIdentifierFirst) {
 
 // ---- SDK merge -----------------------------------------------------------------------------
 
-TEST_F(EkPlugInCoreTest, MergeKeepsOwnValuesExceptCleanTimeoutAndJoinsShared) {
-  const Dictionary sdk{
-      {"ZuExtension",
-       Dictionary{{"CleanTimeout", 30},
-                  {"Shared", Array{"a"}},
-                  {"Dedicated", true},
-                  {"ZuExtensionProtocol", "SdkProtocol"},
-                  {"ZuExtensionAttributes", Dictionary{{"Sdk", "s"}, {"Both", "sdk"}}}}},
-      {"SdkOnly", Dictionary{{"nested", Array{1, 2}}}},
-      {"QvBundleDisplayName", "From SDK"},
-  };
-  const Dictionary own{
-      {"ZuExtension", Dictionary{{"CleanTimeout", 5},
-                                 {"Shared", Array{"b"}},
-                                 {"Dedicated", false},
-                                 {"ZuExtensionAttributes", Dictionary{{"Both", "own"}}}}},
-      {"QvBundleDisplayName", "Own"},
-  };
-  const Dictionary merged = EkPlugInCore::mergeDictionary(sdk, own);
-  const Dictionary expected{
-      {"ZuExtension",
-       Dictionary{{"CleanTimeout", 30},
-                  {"Shared", Array{"a", "b"}},
-                  {"Dedicated", false},
-                  {"ZuExtensionProtocol", "SdkProtocol"},
-                  {"ZuExtensionAttributes", Dictionary{{"Sdk", "s"}, {"Both", "own"}}}}},
-      {"SdkOnly", Dictionary{{"nested", Array{1, 2}}}},
-      {"QvBundleDisplayName", "Own"},
-  };
-  EXPECT_EQ(merged, expected);
-}
-
-TEST_F(EkPlugInCoreTest, MergeCopiesMissingSharedAsItIs) {
-  const Dictionary merged =
-      EkPlugInCore::mergeDictionary(Dictionary{{"Shared", "Resources"}}, Dictionary{});
-  EXPECT_EQ(merged, (Dictionary{{"Shared", "Resources"}}));
-}
-
-TEST_F(EkPlugInCoreTest, MergeKeepsOwnNonDictionaryUnderSdkDictionary) {
-  const Dictionary merged = EkPlugInCore::mergeDictionary(
-      Dictionary{{"ZuExtension", Dictionary{{"k", 1}}}}, Dictionary{{"ZuExtension", "own"}});
-  EXPECT_EQ(merged, (Dictionary{{"ZuExtension", "own"}}));
-}
-
-TEST_F(EkPlugInCoreTest, SharedResourcesUnionIsSortedWithoutDuplicates) {
-  const Value sdk("Resources");
-  const Value own(Array{"b", "Resources", 5, "a", "b"});
-  EXPECT_EQ(EkPlugInCore::mergeSharedResources(&sdk, &own), (Array{"Resources", "a", "b"}));
-  EXPECT_EQ(EkPlugInCore::mergeSharedResources(nullptr, &sdk), (Array{"Resources"}));
-  const Value number(3);
-  EXPECT_EQ(EkPlugInCore::mergeSharedResources(&number, nullptr), Array{});
-}
-
-TEST_F(EkPlugInCoreTest, OnlyCleanTimeoutIsOverriddenBySdk) {
-  EXPECT_TRUE(EkPlugInCore::sdkOverridesKey("CleanTimeout"));
-  EXPECT_FALSE(EkPlugInCore::sdkOverridesKey("cleantimeout"));
-  EXPECT_FALSE(EkPlugInCore::sdkOverridesKey("Shared"));
-}
-
 TEST_F(EkPlugInCoreTest, ResolveSdkMergesRegisteredSdkAndCanonicalizes) {
   Dictionary info = systemInfo();
   (*info["ZuExtension"].dictionary())["CleanTimeout"] = 5;

@@ -68,6 +68,13 @@ inline constexpr std::string_view kMsgAbsolutePathRequired = "absolute path requ
 inline constexpr std::string_view kMsgUnknownError = "unknown error returned by Ekora subsystem";
 inline constexpr std::string_view kMsgErrorWithoutCode = "ekd reported error without a code: %s";
 
+// Limits of one request and one reply.
+inline constexpr size_t kMaxListEntries = 10000;  // "paths", "uuids"
+inline constexpr std::string_view kMsgTooManyEntries =
+    "invalid request format (%s: %zu entries, at most %zu)";
+inline constexpr std::string_view kMsgReplyTooLarge =
+    "reply of %zu bytes exceeds the frame limit of %u bytes";
+
 // Entitlements.
 inline constexpr std::string_view kEntitlementManager = "com.corvane.private.ekora.manager";
 inline constexpr std::string_view kEntitlementAllowedPlugIns =

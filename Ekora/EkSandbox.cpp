@@ -235,6 +235,15 @@ Result<std::string> EkSandbox::issueFileExtension(std::string_view path, uint32_
   return issue(sandbox::kReadOnlyFileClass, flags, subject);
 }
 
+Result<std::string> EkSandbox::issueCanonicalFileExtension(std::string_view canonicalPath) {
+  if (canonicalPath.empty() || canonicalPath.front() != '/' ||
+      canonicalPath.find('\0') != std::string_view::npos || canonicalPath.size() >= PATH_MAX) {
+    return EkError::posix(EINVAL,
+                          fmt::format("cannot issue an extension for \"{}\"", canonicalPath));
+  }
+  return issue(sandbox::kReadOnlyFileClass, sandbox::kCanonicalizeFlag, canonicalPath);
+}
+
 Result<std::string> EkSandbox::issueServiceExtension(std::string_view extensionClass,
                                                      std::string_view serviceName, uint32_t flags) {
   if (!isValidClass(extensionClass) || !isValidSubject(serviceName)) {

@@ -57,6 +57,10 @@ class EkSandbox {
   // is resolved with realpath first. Errors carry the POSIX domain and errno (ENOENT for a
   // path that does not exist), or the key source's error.
   Result<std::string> issueFileExtension(std::string_view path, uint32_t flags);
+  // A read-only file extension (with kCanonicalizeFlag) for a path the caller already holds
+  // in canonical form, kept from an earlier resolution: nothing is walked again. EINVAL for a
+  // path that is not absolute.
+  Result<std::string> issueCanonicalFileExtension(std::string_view canonicalPath);
   // A service-lookup extension of extensionClass for serviceName. EINVAL for a class or name
   // that is empty, too long, or holds a NUL or ";" (the class) byte.
   Result<std::string> issueServiceExtension(std::string_view extensionClass,

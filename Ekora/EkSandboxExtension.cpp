@@ -1,6 +1,10 @@
 #include "Ekora/EkSandboxExtension.h"
 
+#include <fmt/format.h>
+#include <sys/stat.h>
+
 #include <cerrno>
+#include <cstdlib>
 
 #include "platform/log/Log.h"
 
@@ -13,6 +17,53 @@ Result<std::string> issueFileExtension(const EkFileURL& url) {
 Result<std::string> issueFileExtension(const EkFileURL& url, EkSandbox& sandbox) {
   Result<std::string> token = sandbox.issueFileExtension(url.path(), sandbox::kCanonicalizeFlag);
   if (token) log::sandbox().debug("issued file extension for %s -> %s", url.path(), *token);
+  return token;
+}
+
+Result<std::string> issueBundleExtension(std::string_view bundlePath,
+                                         const std::optional<EkBundleIdentity>& identity,
+                                         std::string_view relative, EkSandbox& sandbox) {
+  const std::string bundle(bundlePath);
+  if (!identity) {
+    return EkError::posix(ESTALE,
+                          fmt::format("{}: the bundle's directory was not recorded", bundle));
+  }
+  // The path as named and the canonical path the token will name, which must still be the
+  // directory itself rather than a link: a link there could be turned elsewhere once the
+  // token is out.
+  auto registered = [&](const struct stat& status) {
+    return S_ISDIR(status.st_mode) && static_cast<uint64_t>(status.st_dev) == identity->device &&
+           static_cast<uint64_t>(status.st_ino) == identity->inode;
+  };
+  struct stat named {};
+  struct stat canonical {};
+  if (::stat(bundle.c_str(), &named) != 0) return EkError::fromErrno(errno, bundle);
+  if (::lstat(identity->canonicalPath.c_str(), &canonical) != 0) {
+    return EkError::fromErrno(errno, identity->canonicalPath);
+  }
+  if (!registered(named) || !registered(canonical)) {
+    return EkError::posix(ESTALE, fmt::format("{}: not the directory that was registered", bundle));
+  }
+  const std::string& root = identity->canonicalPath;
+  std::string subject = root;
+  if (!relative.empty() && relative != ".") {
+    // An absolute entry names what it names, and is then refused unless that lies inside.
+    const std::string target = relative.front() == '/' ? std::string(relative)
+                               : root == "/"           ? fmt::format("/{}", relative)
+                                                       : fmt::format("{}/{}", root, relative);
+    char* resolved = ::realpath(target.c_str(), nullptr);
+    if (resolved == nullptr) return EkError::fromErrno(errno, target);
+    subject = resolved;
+    ::free(resolved);
+    const bool inside =
+        subject == root || root == "/" ||
+        (subject.size() > root.size() && subject.starts_with(root) && subject[root.size()] == '/');
+    if (!inside) {
+      return EkError::posix(EPERM, fmt::format("{}: leads out of the bundle", target));
+    }
+  }
+  Result<std::string> token = sandbox.issueCanonicalFileExtension(subject);
+  if (token) log::sandbox().debug("issued file extension for %s -> %s", subject, *token);
   return token;
 }
 

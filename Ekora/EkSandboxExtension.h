@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -19,6 +20,20 @@ namespace ek {
 // the path does not exist.
 Result<std::string> issueFileExtension(const EkFileURL& url);
 Result<std::string> issueFileExtension(const EkFileURL& url, EkSandbox& sandbox);
+// The directory a registered bundle was read from: its device, inode and canonical path.
+struct EkBundleIdentity {
+  uint64_t device = 0;
+  uint64_t inode = 0;
+  std::string canonicalPath;
+};
+// A read-only extension for the registered bundle at bundlePath (relative empty or ".") or
+// for relative inside it. Issued only while the directory at bundlePath is the one registered
+// (ESTALE otherwise, and when nothing was recorded), and only for a target whose canonical
+// location lies inside the bundle (EPERM otherwise: through "..", an absolute path or a link).
+// The bundle's own token names the recorded canonical path, which is not resolved again.
+Result<std::string> issueBundleExtension(std::string_view bundlePath,
+                                         const std::optional<EkBundleIdentity>& identity,
+                                         std::string_view relative, EkSandbox& sandbox);
 // An extension of class "com.corvane.ekora.plugin-service" to look up serviceName.
 Result<std::string> issueServiceExtension(std::string_view serviceName);
 Result<std::string> issueServiceExtension(std::string_view serviceName, EkSandbox& sandbox);

@@ -2,10 +2,12 @@
 
 #include <gtest/gtest.h>
 #include <stdlib.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <filesystem>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -47,6 +49,62 @@ class EkSandboxExtensionTest : public ::testing::Test {
       std::make_shared<EkSandbox>(EkSandboxMemoryKeySource::random());
   std::string directory_;
 };
+
+// A registered bundle and what may have happened to it since: each row issues for the path
+// and entry given and names the error, or the subject the token grants.
+TEST_F(EkSandboxExtensionTest, BundleExtensionsOnlyForTheRegisteredDirectoryAndInsideIt) {
+  namespace fs = std::filesystem;
+  const std::string bundle = directory_ + "/B.appex";
+  const std::string other = directory_ + "/Other";
+  fs::create_directories(bundle + "/Resources");
+  fs::create_directories(other);
+  fs::create_symlink("Resources", bundle + "/Inside");
+  fs::create_symlink(other, bundle + "/Outside");
+  fs::create_symlink(other, directory_ + "/Link");
+  auto identityOf = [](const std::string& path) {
+    struct stat status {};
+    EXPECT_EQ(::stat(path.c_str(), &status), 0);
+    return EkBundleIdentity{static_cast<uint64_t>(status.st_dev),
+                            static_cast<uint64_t>(status.st_ino), path};
+  };
+  const EkBundleIdentity registered = identityOf(bundle);
+  EkBundleIdentity throughLink = identityOf(other);
+  throughLink.canonicalPath = directory_ + "/Link";
+  struct Row {
+    std::string path;
+    std::optional<EkBundleIdentity> identity;
+    std::string relative;
+    int error;            // 0: issued
+    std::string subject;  // of the token issued
+  };
+  const std::vector<Row> rows{
+      {bundle, registered, "", 0, bundle},
+      {bundle, registered, "Resources", 0, bundle + "/Resources"},
+      {bundle, registered, "Inside", 0, bundle + "/Resources"},
+      {bundle, registered, "Outside", EPERM, ""},
+      {bundle, registered, "../Other", EPERM, ""},
+      {bundle, registered, other, EPERM, ""},
+      {bundle, registered, "Absent", ENOENT, ""},
+      {bundle, std::nullopt, "", ESTALE, ""},
+      {other, registered, "", ESTALE, ""},
+      {directory_ + "/Link", throughLink, "", ESTALE, ""},
+  };
+  for (const Row& row : rows) {
+    Result<std::string> token =
+        issueBundleExtension(row.path, row.identity, row.relative, *sandbox_);
+    const std::string name = row.path + " " + row.relative;
+    if (row.error != 0) {
+      ASSERT_FALSE(token.ok()) << name;
+      EXPECT_TRUE(token.error().isPosix(row.error)) << name << ": " << token.error().message;
+      continue;
+    }
+    ASSERT_TRUE(token.ok()) << name << ": " << token.error().message;
+    const int64_t handle = sandbox_->consume(*token);
+    ASSERT_GT(handle, 0) << name;
+    EXPECT_EQ(sandbox_->grant(handle)->subject, row.subject) << name;
+    EXPECT_EQ(sandbox_->grant(handle)->flags, sandbox::kCanonicalizeFlag) << name;
+  }
+}
 
 TEST_F(EkSandboxExtensionTest, IssuingAFileExtensionLogsPathAndToken) {
   std::filesystem::create_directories(directory_ + "/Viewer.app");

@@ -119,21 +119,6 @@ bool isBelow(std::string_view path, std::string_view root) {
   return true;
 }
 
-// The location a path resolves to, links followed; the errno of the failure otherwise.
-Result<std::string> canonicalPath(const std::string& path) {
-  std::error_code error;
-  std::filesystem::path resolved = std::filesystem::canonical(path, error);
-  if (error) return EkError::posix(error.value(), path);
-  return resolved.string();
-}
-
-bool isWithin(const std::string& path, const std::string& directory) {
-  if (path == directory) return true;
-  if (directory == "/") return true;
-  return path.size() > directory.size() && path.starts_with(directory) &&
-         path[directory.size()] == '/';
-}
-
 }  // namespace
 
 // ---- Construction ---------------------------------------------------------------------------
@@ -180,7 +165,7 @@ bool EkDPlugIn::initWithVRData(const vantor::PlugInProxy& proxy) {
   setDataContainerURL(urlOfPath(proxy.dataContainerPath));
   {
     // Current until the registry's knowledge changes, when the proxy says when it was read.
-    CurrentInfoRef current = makeCurrentInfo(std::move(info));
+    CurrentInfoRef current = makeCurrentInfo(std::move(info), &proxy);
     std::lock_guard lock(infoMutex_);
     current_ = std::move(current);
     vrKnowledgeUUID_ = proxy.knowledge;
@@ -229,9 +214,14 @@ const Value* EkDPlugIn::CurrentInfo::attribute(std::string_view key) const {
   return valueIn(attributes, key);
 }
 
-EkDPlugIn::CurrentInfoRef EkDPlugIn::makeCurrentInfo(DictionaryRef info) const {
+EkDPlugIn::CurrentInfoRef EkDPlugIn::makeCurrentInfo(DictionaryRef info,
+                                                     const vantor::PlugInProxy* proxy) const {
   auto current = std::make_shared<CurrentInfo>();
   current->appExtension = isAppExtension();
+  if (proxy != nullptr && proxy->bundleIdentity) {
+    const vantor::BundleIdentity& identity = *proxy->bundleIdentity;
+    current->bundle = EkBundleIdentity{identity.device, identity.inode, identity.canonicalPath};
+  }
   if (info) {
     current->plugIn = dictionaryIn(info.get(), pk::kInfoPlugInDictionary);
     current->attributes = dictionaryIn(current->plugIn, pk::kAttributes);
@@ -260,7 +250,7 @@ EkDPlugIn::CurrentInfoRef EkDPlugIn::currentInfo() const {
   } else {
     log::ops().error(kLogNoFreshProxy, uuid());
   }
-  CurrentInfoRef current = makeCurrentInfo(std::move(info));
+  CurrentInfoRef current = makeCurrentInfo(std::move(info), proxy.get());
   std::lock_guard lock(infoMutex_);
   current_ = std::move(current);
   vrKnowledgeUUID_ = knowledge;
@@ -382,7 +372,7 @@ void EkDPlugIn::augmentForm(Dictionary& form, const CurrentInfo& current) const 
   // An application extension's host reads the whole bundle, nothing beside it.
   const Value* shared = current.appExtension ? &kWholeBundle : current.shared;
   if (shared) {
-    if (std::optional<Dictionary> extensions = issueResourceExtensions(*shared)) {
+    if (std::optional<Dictionary> extensions = issueResourceExtensions(*shared, current)) {
       form.insert_or_assign(std::string(pk::form::kExtensions), std::move(*extensions));
     }
   }
@@ -405,6 +395,11 @@ void EkDPlugIn::augmentForm(Dictionary& form, const CurrentInfo& current) const 
 }
 
 std::optional<Dictionary> EkDPlugIn::issueResourceExtensions(const Value& paths) const {
+  return issueResourceExtensions(paths, *currentInfo());
+}
+
+std::optional<Dictionary> EkDPlugIn::issueResourceExtensions(const Value& paths,
+                                                             const CurrentInfo& current) const {
   Array single;
   const Array* elements = paths.array();
   if (elements == nullptr) {
@@ -417,44 +412,31 @@ std::optional<Dictionary> EkDPlugIn::issueResourceExtensions(const Value& paths)
   const std::optional<EkFileURL> bundle = url();
   if (!bundle) return result;
   const std::string& bundlePath = bundle->path();
-  // Every target must resolve inside the bundle: "Shared" is the plug-in's to write, and a
-  // "../.." or a link out of the bundle must not hand a host the rest of the disk.
-  Result<std::string> canonicalBundle = canonicalPath(bundlePath);
-
   for (const Value& element : *elements) {
     const std::string* relative = element.string();
     if (relative == nullptr) continue;
-    const std::string targetPath =
-        *relative == kBundleItself ? bundlePath : paths::join(bundlePath, *relative);
-    auto fail = [&](const EkError& error) {
-      log::ops().info(kLogResourceExtensionFailed, targetPath, bundlePath, systemErrorText(error));
-    };
-    if (!canonicalBundle) {
-      fail(canonicalBundle.error());
-      continue;
-    }
-    Result<std::string> canonicalTarget = canonicalPath(targetPath);
-    if (!canonicalTarget) {
-      fail(canonicalTarget.error());
-      continue;
-    }
-    if (!isWithin(*canonicalTarget, *canonicalBundle)) {
-      fail(EkError::posix(EPERM, targetPath));
-      continue;
-    }
-    Result<EkFileURL> target = EkFileURL::fromPath(*canonicalTarget);
-    if (!target) {
-      fail(EkError::posix(EINVAL, targetPath));
-      continue;
-    }
-    Result<std::string> token = issueFileExtension(*target, sandbox());
+    // Every target must resolve inside the bundle as registered: "Shared" is the plug-in's to
+    // write, and a "../..", an absolute path or a link out of the bundle, or a bundle
+    // directory swapped for a link, must not hand a host the rest of the disk.
+    const bool itself = *relative == kBundleItself;
+    Result<std::string> token = ek::issueBundleExtension(
+        bundlePath, current.bundle, itself ? std::string_view() : std::string_view(*relative),
+        sandbox());
     if (!token) {
-      fail(token.error());
+      const std::string targetPath = itself ? bundlePath : paths::join(bundlePath, *relative);
+      log::ops().info(kLogResourceExtensionFailed, targetPath, bundlePath,
+                      systemErrorText(token.error()));
       continue;
     }
     result.insert_or_assign(*relative, std::move(token).value());
   }
   return result;
+}
+
+Result<std::string> EkDPlugIn::issueBundleExtension() const {
+  const std::optional<EkFileURL> bundle = url();
+  if (!bundle) return EkError::posix(ENOENT, "no bundle URL");
+  return ek::issueBundleExtension(bundle->path(), currentInfo()->bundle, {}, sandbox());
 }
 
 // ---- Localized file-provider action names --------------------------------------------------

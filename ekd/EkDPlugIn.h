@@ -11,6 +11,7 @@
 
 #include "Ekora/EkPlugInCore.h"
 #include "Ekora/EkSandbox.h"
+#include "Ekora/EkSandboxExtension.h"
 #include "platform/value/EkError.h"
 #include "platform/value/Uuid.h"
 #include "platform/value/Value.h"
@@ -93,6 +94,8 @@ class EkDPlugIn : public EkPlugInCore {
     const Value* bundleIdentifier = nullptr;  // infoKey "QvBundleIdentifier"
     const Value* shared = nullptr;            // pluginKey "Shared"
     const Value* hostEntitlement = nullptr;   // pluginKey "ZuExtensionHostEntitlement"
+    // The bundle directory as registered; rights to the bundle need it to be still in place.
+    std::optional<EkBundleIdentity> bundle;
 
     const Value* plugInValue(std::string_view key) const;
     const Value* attribute(std::string_view key) const;
@@ -178,7 +181,13 @@ class EkDPlugIn : public EkPlugInCore {
   // are paths; "." is the bundle itself): path to token. A path that fails, or that resolves
   // outside the bundle, is logged and left out. Absent only when paths is neither a string
   // nor an array.
+  // Each is issued only while the bundle's directory is the registered one
+  // (issueBundleExtension).
   std::optional<Dictionary> issueResourceExtensions(const Value& paths) const;
+  std::optional<Dictionary> issueResourceExtensions(const Value& paths,
+                                                    const CurrentInfo& current) const;
+  // A read-only extension for the whole bundle, as issueBundleExtension issues it.
+  Result<std::string> issueBundleExtension() const;
 
   // The info dictionary as last fetched, and the knowledge UUID of that fetch (absent before
   // the first one). Neither refreshes.
@@ -209,7 +218,7 @@ class EkDPlugIn : public EkPlugInCore {
 
   bool initWithVRData(const vantor::PlugInProxy& proxy);
   EkSandbox& sandbox() const;
-  CurrentInfoRef makeCurrentInfo(DictionaryRef info) const;
+  CurrentInfoRef makeCurrentInfo(DictionaryRef info, const vantor::PlugInProxy* proxy) const;
   // infoKey without sharing ownership, for lookups against one CurrentInfo.
   const Value* infoValue(const CurrentInfo& current, std::string_view key) const;
 

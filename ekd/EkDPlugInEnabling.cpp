@@ -206,7 +206,9 @@ std::optional<EkError> EkDPlugIn::enableForClient(const EkDWyreClient& client,
   std::shared_ptr<EkBundle> bundle;
   if (std::optional<EkFileURL> location = url()) bundle = EkBundle::initWithURL(*location);
   std::optional<std::string> program;
-  if (bundle) program = bundle->stringProperty(EkBundleProperty::ExecutablePath);
+  // A bundle that declares no executable answers its own path: such a plug-in is still
+  // declared, and the service manager judges what it can launch.
+  if (bundle) program = bundle->executablePath();
   if (!program) {
     log::ops().error(kLogNoExecPath, plugInIdentifier, uuidText,
                      bundle ? bundle->path().value_or("(null)") : std::string("(null)"));
@@ -242,11 +244,14 @@ std::vector<std::string> EkDPlugIn::allowedPrivoServices() const {
     log::ops().info(kLogNoBundle, path().value_or("(null)"));
     return {};
   }
-  if (!context_.consent) {
+  std::optional<std::vector<std::string>> granted;
+  if (context_.consent)
+    granted = context_.consent->informationForApplication(*applicationIdentifier);
+  if (!granted) {
     log::ops().info(kLogNoConsentInformation, application->path());
     return {};
   }
-  return context_.consent->grantedServices(*applicationIdentifier);
+  return std::move(*granted);
 }
 
 std::optional<Dictionary> EkDPlugIn::checkBusy() const {

@@ -319,14 +319,23 @@ TEST_F(EnablingTest, UnreadableApplicationBundleGrantsNothingAndIsLogged) {
   EXPECT_TRUE(consent_->queries().empty());
 }
 
-TEST_F(EnablingTest, MissingConsentServiceGrantsNothingAndIsLogged) {
-  consent_ = nullptr;
-  auto record = plugIn({});
-  ASSERT_TRUE(record);
-  EXPECT_TRUE(record->allowedPrivoServices().empty());
-  EXPECT_TRUE(
-      sink_->has(log::Level::Info, "ops",
-                 "PrivoAccessCopyInformationForBundle failed for " + application().string()));
+TEST_F(EnablingTest, ConsentAnsweringNothingGrantsNothingAndIsLogged) {
+  for (const bool serviceExists : {false, true}) {
+    consent_ = serviceExists ? std::make_shared<privo::FakeConsent>() : nullptr;
+    if (consent_) {
+      consent_->grant(std::string(kHostIdentifier), "com.corvane.privo.keyboard-network");
+      consent_->setUnavailable(true);
+    }
+    PlugInSpec spec;
+    spec.identifier += serviceExists ? ".asked" : ".unasked";
+    auto record = plugIn(spec);
+    ASSERT_TRUE(record);
+    EXPECT_TRUE(record->allowedPrivoServices().empty());
+    EXPECT_EQ(sink_->countStarting(
+                  log::Level::Info, "ops",
+                  "PrivoAccessCopyInformationForBundle failed for " + application().string()),
+              serviceExists ? 2 : 1);
+  }
 }
 
 // ---- The overlay ---------------------------------------------------------------------------
@@ -488,19 +497,17 @@ TEST_F(EnablingTest, ServiceManagerRefusalIsCode4AndLogged) {
   EXPECT_EQ(serviceManager_->declarations().size(), 1u);  // asked once, not retried
 }
 
-TEST_F(EnablingTest, PlugInWithoutExecutableIsNotDeclared) {
+TEST_F(EnablingTest, PlugInWithoutExecutableIsDeclaredWithItsBundlePath) {
   PlugInSpec spec;
   spec.executable = false;
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
-  std::optional<EkError> error = record->enableForClient(*client_, nullptr);
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->code, 4);
-  EXPECT_EQ(error->message, "cannot obtain executable path for plug-in com.example.plugin(" +
-                                record->uuid().string() + ")");
+  EXPECT_EQ(record->enableForClient(*client_, nullptr), std::nullopt);
+  auto declarations = serviceManager_->declarations();
+  ASSERT_EQ(declarations.size(), 1u);
+  EXPECT_EQ(declarations.front().program, *record->path());
   EXPECT_EQ(sink_->countStarting(log::Level::Error, "ops", "failed to obtain execPath for plug-in"),
-            1);
-  EXPECT_TRUE(serviceManager_->declarations().empty());
+            0);
 }
 
 // ---- The real service manager --------------------------------------------------------------

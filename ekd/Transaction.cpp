@@ -2,6 +2,7 @@
 
 #include <cstdlib>
 #include <unordered_map>
+#include <unordered_set>
 #include <utility>
 
 #include "Ekora/EkFileURL.h"
@@ -105,7 +106,29 @@ void Transaction::done() {
     std::string text = reply.description();
     EK_PROBE2(request_output, client_->pid(), text.c_str());
   }
-  if (auto connection = client_->connection()) connection->reply(request_, reply);
+  if (!request_.wantsReply()) return;
+  std::vector<uint8_t> frame(wyre::kHeaderSize);
+  cbor::encode(reply, frame);
+  sendFrame(std::move(frame));
+}
+
+void Transaction::sendFrame(std::vector<uint8_t> frame) {
+  auto connection = client_->connection();
+  if (!connection) return;
+  const size_t body = frame.size() - wyre::kHeaderSize;
+  if (body > wyre::kMaxBodySize) {
+    // The client could not read it: it would take the frame for a broken stream.
+    const std::string message = log::format(protocol::kMsgReplyTooLarge, body, wyre::kMaxBodySize);
+    log::ops().error("refusing to send client %d a %{public}s", client_->pid(), message);
+    const Value error(Dictionary{
+        {std::string(protocol::kErrorCode),
+         Value(static_cast<uint64_t>(static_cast<int64_t>(protocol::kErrorInvalidRequest)))},
+        {std::string(protocol::kError), Value(message)}});
+    frame.assign(wyre::kHeaderSize, 0);
+    frame.shrink_to_fit();
+    cbor::encode(error, frame);
+  }
+  connection->replyEncoded(request_, std::move(frame));
 }
 
 void Transaction::doneWithEncoded(
@@ -125,9 +148,7 @@ void Transaction::doneWithEncoded(
     std::string text = reply ? reply->description() : reply.error().message;
     EK_PROBE2(request_output, client_->pid(), text.c_str());
   }
-  if (auto connection = client_->connection()) {
-    connection->replyEncoded(request_, std::move(frame));
-  }
+  sendFrame(std::move(frame));
 }
 
 void Transaction::fail(int32_t code, std::string_view message) {
@@ -142,50 +163,95 @@ void Transaction::fail(int32_t code, const EkError& error) {
   fail(error.isEkora() ? error.code : code, error.description());
 }
 
-bool Transaction::marshalPaths(const PathCallback& callback) {
+struct Transaction::PathWalk {
+  const Array* paths = nullptr;
+  size_t next = 0;
+  // The texts already passed on, as sent and as resolved: a path sent many times costs one
+  // resolution and one step.
+  std::unordered_set<std::string> seen;
+  PathCallback callback;
+};
+
+const Array* Transaction::pathList() {
   const Array* paths = arrayForKey(protocol::kPaths);
   if (!paths) {
     fail(protocol::kErrorInvalidRequest, protocol::kMsgInvalidFormat);
-    return false;
+    return nullptr;
   }
-  for (const Value& element : *paths) {
-    const std::string* path = element.string();
-    if (!path) {
-      fail(protocol::kErrorInvalidRequest, protocol::kMsgInvalidFormat);
-      return false;
+  if (paths->size() > protocol::kMaxListEntries) {
+    fail(protocol::kErrorInvalidRequest, log::format(protocol::kMsgTooManyEntries, protocol::kPaths,
+                                                     paths->size(), protocol::kMaxListEntries));
+    return nullptr;
+  }
+  return paths;
+}
+
+Transaction::PathStep Transaction::walkPath(PathWalk& walk, const Value& element) {
+  const std::string* path = element.string();
+  if (!path) {
+    fail(protocol::kErrorInvalidRequest, protocol::kMsgInvalidFormat);
+    return PathStep::Stop;
+  }
+  if (path->empty() || (*path)[0] != '/') {
+    fail(protocol::kErrorBadPath, log::format(protocol::kMsgAbsolutePathRequired, *path));
+    return PathStep::Stop;
+  }
+  if (!walk.seen.insert(*path).second) return PathStep::Continue;
+  if (path->find('\0') == std::string::npos) {
+    char* resolved = ::realpath(path->c_str(), nullptr);
+    if (resolved) {
+      std::string canonical(resolved);
+      std::free(resolved);
+      if (canonical != *path && !walk.seen.insert(canonical).second) return PathStep::Continue;
+      return walk.callback(canonical, true);
     }
-    if (path->empty() || (*path)[0] != '/') {
-      fail(protocol::kErrorBadPath, log::format(protocol::kMsgAbsolutePathRequired, *path));
-      return false;
-    }
-    PathStep step;
-    if (path->find('\0') == std::string::npos) {
-      char* resolved = ::realpath(path->c_str(), nullptr);
-      if (resolved) {
-        std::string canonical(resolved);
-        std::free(resolved);
-        step = callback(canonical, true);
-      } else {
-        step = callback(*path, false);
-      }
-    } else {
-      step = callback(*path, false);
-    }
-    if (step == PathStep::Stop) return false;
+  }
+  return walk.callback(*path, false);
+}
+
+bool Transaction::marshalPaths(const PathCallback& callback) {
+  PathWalk walk;
+  walk.paths = pathList();
+  if (!walk.paths) return false;
+  walk.callback = callback;
+  for (const Value& element : *walk.paths) {
+    if (walkPath(walk, element) == PathStep::Stop) return false;
   }
   return true;
 }
 
-bool Transaction::processPaths(const PathCallback& callback) {
-  if (!marshalPaths(callback)) return false;
+void Transaction::processPaths(PathCallback callback) {
+  auto walk = std::make_shared<PathWalk>();
+  walk->paths = pathList();
+  if (!walk->paths) return;
+  walk->callback = std::move(callback);
+  continuePaths(std::move(walk));
+}
+
+void Transaction::continuePaths(std::shared_ptr<PathWalk> walk) {
+  if (!client_->acceptWork()) return;
+  const auto deadline = std::chrono::steady_clock::now() + kPathSliceBudget;
+  const Array& paths = *walk->paths;
+  while (walk->next < paths.size()) {
+    if (walkPath(*walk, paths[walk->next++]) == PathStep::Stop) return;
+    if (walk->next < paths.size() && std::chrono::steady_clock::now() >= deadline) {
+      server().mainQueue()->async(
+          [self = shared_from_this(), walk] { self->continuePaths(std::move(walk)); });
+      return;
+    }
+  }
   done();
-  return true;
 }
 
 bool Transaction::processUuidList(const PlugInStep& step) {
   const Array* uuids = arrayForKey(protocol::kUuids);
   if (!uuids) {
     fail(protocol::kErrorInvalidRequest, "invalid request format (uuid)");
+    return false;
+  }
+  if (uuids->size() > protocol::kMaxListEntries) {
+    fail(protocol::kErrorInvalidRequest, log::format(protocol::kMsgTooManyEntries, protocol::kUuids,
+                                                     uuids->size(), protocol::kMaxListEntries));
     return false;
   }
   const Array* paths = nullptr;

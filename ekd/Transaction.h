@@ -1,6 +1,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -44,11 +45,16 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
 
   enum class PathStep { Continue, Stop };
   using PathCallback = std::function<PathStep(const std::string& path, bool resolved)>;
-  // Walks "paths"; true when every path was passed on and accepted. On false a failure
-  // reply has been sent, by the walk or by the callback.
+  // Walks "paths" (at most kMaxListEntries; a path repeated is passed on once); true when
+  // every path was passed on and accepted. On false a failure reply has been sent, by the walk
+  // or by the callback.
   bool marshalPaths(const PathCallback& callback);
-  // marshalPaths followed by done when it succeeded.
-  bool processPaths(const PathCallback& callback);
+  // The same walk for work that takes long per path (registration), followed by done when
+  // every path was accepted. It runs in slices of about kPathSliceBudget: after each, the rest
+  // goes to the back of the work queue, so other clients' requests are answered in between.
+  // Stops unanswered once the client is gone.
+  void processPaths(PathCallback callback);
+  static constexpr std::chrono::milliseconds kPathSliceBudget{10};
 
   using PlugInStep = std::function<bool(const std::shared_ptr<EkDPlugIn>& plugIn)>;
   // Walks "uuids" (with "paths" as fallbacks for unknown UUIDs) and runs step per plug-in
@@ -92,6 +98,15 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   bool replied_ = false;
   // Marks the transaction replied and runs the work set with beforeReply.
   void prepareReply();
+  // Sends frame (kHeaderSize bytes of room, then the reply), or an error in its place when
+  // it is larger than a frame may be.
+  void sendFrame(std::vector<uint8_t> frame);
+  // "paths" when it is an array of at most kMaxListEntries; otherwise fails and answers null.
+  const Array* pathList();
+  struct PathWalk;
+  // One path of a walk: Continue also for a path already seen.
+  PathStep walkPath(PathWalk& walk, const Value& element);
+  void continuePaths(std::shared_ptr<PathWalk> walk);
   std::function<void()> beforeReply_;
 };
 

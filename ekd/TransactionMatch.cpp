@@ -1,5 +1,6 @@
 // The "match" request: discovery.
 
+#include <algorithm>
 #include <unordered_map>
 
 #include "Ekora/EkBundle.h"
@@ -17,6 +18,7 @@
 #include "platform/log/Log.h"
 #include "platform/process/Process.h"
 #include "platform/trace/Probes.h"
+#include "platform/wyre/Wyre.h"
 
 namespace ek {
 namespace {
@@ -286,9 +288,12 @@ void Transaction::matchPlugIns() {
       bound +=
           EkDFormCache::sizeBound(*results[i]->form, {annotations[i].span(), results[i]->added});
     }
-    out.reserve(out.size() + bound);
+    // A reply larger than a frame is answered with an error instead: what lies beyond the
+    // limit is neither reserved nor written.
+    const size_t limit = wyre::kHeaderSize + wyre::kMaxBodySize;
+    out.reserve(std::min(out.size() + bound, limit + 1));
     cbor::encodeArrayHead(results.size(), out);
-    for (size_t i = 0; i < results.size(); ++i) {
+    for (size_t i = 0; i < results.size() && out.size() <= limit; ++i) {
       EkDFormCache::write(*results[i]->form, {annotations[i].span(), results[i]->added}, out);
     }
   });

@@ -72,11 +72,9 @@ void Transaction::readyPlugIns() {
 void Transaction::accessPlugIns() {
   Array tokens;
   bool walked = processUuidList([&](const std::shared_ptr<EkDPlugIn>& plugIn) {
-    auto url = plugIn->url();
-    const auto& sandbox = plugIn->context().sandbox;
-    Result<std::string> token =
-        url ? (sandbox ? issueFileExtension(*url, *sandbox) : issueFileExtension(*url))
-            : Result<std::string>(EkError::posix(ENOENT, "no bundle URL"));
+    // Only for the bundle directory that was registered: one swapped for a link since gets
+    // nothing.
+    Result<std::string> token = plugIn->issueBundleExtension();
     if (token) {
       tokens.emplace_back(std::move(token).value());
       return true;

@@ -291,8 +291,9 @@ TEST_F(AnnotateRequests, EmptyUuidListSucceedsAndPosts) {
   EXPECT_EQ(stored(kThumbsId), std::nullopt);
 }
 
-TEST_F(AnnotateRequests, HundredThousandCopiesOfOneUuidAreAnswered) {
-  Array uuids(100000, Value(thumbs_));
+// The longest list a request may carry.
+TEST_F(AnnotateRequests, TenThousandCopiesOfOneUuidAreAnswered) {
+  Array uuids(10000, Value(thumbs_));
   auto reply = daemon_.ask(annotate({{"election", Value(1)}}, Value(std::move(uuids))),
                            std::chrono::seconds(30));
   ASSERT_TRUE(reply.has_value()) << "no reply within 30 s";
@@ -301,10 +302,10 @@ TEST_F(AnnotateRequests, HundredThousandCopiesOfOneUuidAreAnswered) {
   EXPECT_EQ(foundAnnotations(thumbs_), kElected);
 }
 
-TEST_F(AnnotateRequests, HundredThousandUnknownUuidsAreAnswered) {
+TEST_F(AnnotateRequests, TenThousandUnknownUuidsAreAnswered) {
   Array uuids;
-  uuids.reserve(100000);
-  for (int i = 0; i < 100000; ++i) uuids.emplace_back(Uuid::random());
+  uuids.reserve(10000);
+  for (int i = 0; i < 10000; ++i) uuids.emplace_back(Uuid::random());
   auto reply = daemon_.ask(annotate({{"election", Value(1)}}, Value(std::move(uuids))),
                            std::chrono::seconds(30));
   ASSERT_TRUE(reply.has_value()) << "no reply within 30 s";

@@ -3,9 +3,11 @@
 #include <dirent.h>
 #include <expat.h>
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <locale.h>
 #include <openssl/evp.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cctype>
@@ -998,6 +1000,124 @@ Result<size_t> removeStaleTemporaries(const std::string& path) {
     if (::unlinkat(directoryFd.get(), name.c_str(), 0) == 0) ++removed;
   }
   return removed;
+}
+
+// ---------------------------------------------------------------------------------------------
+// Files beneath a directory
+
+namespace {
+
+std::string beneathName(const std::string& directory, std::string_view relative) {
+  if (directory.empty() || directory.back() == '/') return fmt::format("{}{}", directory, relative);
+  return fmt::format("{}/{}", directory, relative);
+}
+
+// Without openat2 (older kernels, or a seccomp filter that hides it): one component at a time,
+// never following a link at all, which is stricter than needed and still what bundles use.
+int openBeneathByWalk(int directoryFd, std::string_view relative, int flags) {
+  UniqueFd current;
+  int at = directoryFd;
+  size_t position = 0;
+  for (;;) {
+    const size_t slash = relative.find('/', position);
+    const bool last = slash == std::string_view::npos;
+    const std::string component(
+        relative.substr(position, last ? std::string_view::npos : slash - position));
+    position = last ? relative.size() : slash + 1;
+    if (component.empty() || component == ".") {
+      if (last) {
+        errno = EISDIR;
+        return -1;
+      }
+      continue;
+    }
+    if (component == "..") {
+      errno = EXDEV;
+      return -1;
+    }
+    const int next =
+        ::openat(at, component.c_str(),
+                 last ? flags | O_NOFOLLOW : O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    if (next < 0) {
+      if (errno == ELOOP) errno = EXDEV;
+      return -1;
+    }
+    if (last) return next;
+    current.reset(next);
+    at = current.get();
+  }
+}
+
+int openBeneath(int directoryFd, std::string_view relative, int flags) {
+  const std::string name(relative);
+  open_how how{};
+  how.flags = static_cast<uint64_t>(flags);
+  how.resolve = RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS;
+  const long fd = ::syscall(SYS_openat2, directoryFd, name.c_str(), &how, sizeof how);
+  if (fd >= 0) return static_cast<int>(fd);
+  if (errno != ENOSYS) return -1;
+  return openBeneathByWalk(directoryFd, relative, flags);
+}
+
+}  // namespace
+
+Result<Value> readFileBeneath(int directoryFd, const std::string& directoryPath,
+                              std::string_view relative, size_t maxSize) {
+  const std::string shown = beneathName(directoryPath, relative);
+  if (relative.empty() || relative.front() == '/' ||
+      relative.find('\0') != std::string_view::npos) {
+    return EkError::posix(EXDEV, fmt::format("{}: not a path beneath {}", shown, directoryPath));
+  }
+  // O_NONBLOCK keeps a FIFO planted at the path from blocking the open.
+  UniqueFd fd(openBeneath(directoryFd, relative, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+  if (!fd.valid()) {
+    if (errno == EXDEV || errno == ELOOP) {
+      return EkError::posix(EXDEV, fmt::format("{}: a symbolic link or \"..\" leads out of {}",
+                                               shown, directoryPath));
+    }
+    return EkError::fromErrno(errno, shown);
+  }
+  struct stat status;
+  if (::fstat(fd.get(), &status) != 0) return EkError::fromErrno(errno, shown);
+  if (!S_ISREG(status.st_mode))
+    return EkError::format(fmt::format("{}: not a regular file", shown));
+  if (static_cast<uint64_t>(status.st_size) > maxSize) {
+    return EkError::posix(EFBIG, fmt::format("{}: file of {} bytes exceeds the limit of {}", shown,
+                                             status.st_size, maxSize));
+  }
+  // One byte more than allowed tells a file that grew while it was read.
+  std::string bytes(static_cast<size_t>(status.st_size) + 1, '\0');
+  size_t filled = 0;
+  while (filled < bytes.size()) {
+    const ssize_t got = ::read(fd.get(), bytes.data() + filled, bytes.size() - filled);
+    if (got < 0) {
+      if (errno == EINTR) continue;
+      return EkError::fromErrno(errno, shown);
+    }
+    if (got == 0) break;
+    filled += static_cast<size_t>(got);
+    if (filled == bytes.size() && filled <= maxSize)
+      bytes.resize(std::min(filled * 2, maxSize + 1));
+  }
+  if (filled > maxSize) {
+    return EkError::posix(EFBIG,
+                          fmt::format("{}: file exceeds the limit of {} bytes", shown, maxSize));
+  }
+  bytes.resize(filled);
+  Result<Value> value = parse(bytes);
+  if (!value) {
+    EkError error = std::move(value).error();
+    error.message = fmt::format("{}: {}", shown, error.message);
+    return error;
+  }
+  return value;
+}
+
+Result<Value> readFileBeneath(const std::string& directory, std::string_view relative,
+                              size_t maxSize) {
+  UniqueFd fd(::open(directory.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!fd.valid()) return EkError::fromErrno(errno, directory);
+  return readFileBeneath(fd.get(), directory, relative, maxSize);
 }
 
 }  // namespace ek::dmap

@@ -51,6 +51,23 @@ Result<Value> readFile(const std::string& path);
 // every value it writes, so what this accepts is written.
 Result<void> checkWritable(const Value& value, size_t depth = 0);
 
+// Bundles come from anyone who can write a directory: a dmap file read from one (its info
+// dictionary, a strings table, an extension point's dictionary) is held to this size.
+inline constexpr size_t kMaxBundleFileSize = 1024 * 1024;
+
+// Reads and parses the file at relative beneath the directory open as directoryFd, without
+// following a symbolic link, a "/" or ".." out of that directory, nor a /proc magic link.
+// Errors name the file as directoryPath/relative and what is wrong with it: EXDEV for a path
+// that leads out of the directory, a Format error for a file that is not a regular file,
+// EFBIG for one larger than maxSize (none of these is read), ENOENT for a missing one, a
+// Format error naming the line for bad content.
+Result<Value> readFileBeneath(int directoryFd, const std::string& directoryPath,
+                              std::string_view relative, size_t maxSize = kMaxBundleFileSize);
+// The same, opening directory first (links in the directory's own path are followed: the
+// caller named it).
+Result<Value> readFileBeneath(const std::string& directory, std::string_view relative,
+                              size_t maxSize = kMaxBundleFileSize);
+
 // Writes the value as a dmap document, indented with tabs. Values the format cannot carry are
 // refused with a Format error (see checkWritable), and so are documents larger than
 // kMaxFileSize.

@@ -562,6 +562,58 @@ TEST(DmapFile, RefusesDirectoriesAndFifosWithoutBlocking) {
   }
 }
 
+// A bundle directory holding what a hostile bundle may: links out and in, "..", a FIFO, a
+// directory and a file just over the bundle limit; each read beneath it either succeeds or is
+// refused with the file named and the reason.
+TEST(DmapFile, ReadsBeneathADirectoryOnly) {
+  TempDir outside;
+  const std::string secret = outside.file("secret.dmap");
+  spit(secret, document("<string>secret</string>"));
+  TempDir dir;
+  const std::string bundle = dir.file("B.appex");
+  ASSERT_EQ(::mkdir(bundle.c_str(), 0700), 0);
+  ASSERT_EQ(::mkdir((bundle + "/en.lproj").c_str(), 0700), 0);
+  spit(bundle + "/Info.dmap", document("<string>own</string>"));
+  ASSERT_EQ(::symlink(secret.c_str(), (bundle + "/Out.dmap").c_str()), 0);
+  ASSERT_EQ(::symlink("Info.dmap", (bundle + "/In.dmap").c_str()), 0);
+  ASSERT_EQ(::symlink("/proc/self/root/etc/hostname", (bundle + "/Magic.dmap").c_str()), 0);
+  ASSERT_EQ(::mkfifo((bundle + "/Fifo.dmap").c_str(), 0600), 0);
+  spit(bundle + "/Big.dmap",
+       document("<string>" + std::string(kMaxBundleFileSize, 'a') + "</string>"));
+
+  struct Case {
+    std::string relative;
+    std::string domain;  // empty: read
+    int code;
+    std::string reason;
+  };
+  const std::vector<Case> cases{
+      {"Info.dmap", "", 0, ""},
+      {"In.dmap", "", 0, ""},
+      {"Out.dmap", std::string(kPosixErrorDomain), EXDEV, "leads out of"},
+      {"Magic.dmap", std::string(kPosixErrorDomain), EXDEV, "leads out of"},
+      {"../B.appex/Info.dmap", std::string(kPosixErrorDomain), EXDEV, "leads out of"},
+      {secret, std::string(kPosixErrorDomain), EXDEV, "not a path beneath"},
+      {"Fifo.dmap", std::string(kFormatErrorDomain), 1, "not a regular file"},
+      {"en.lproj", std::string(kFormatErrorDomain), 1, "not a regular file"},
+      {"Big.dmap", std::string(kPosixErrorDomain), EFBIG, "exceeds the limit of 1048576"},
+      {"Absent.dmap", std::string(kPosixErrorDomain), ENOENT, "Absent.dmap"},
+  };
+  for (const Case& test : cases) {
+    Result<Value> read = readFileBeneath(bundle, test.relative);
+    if (test.domain.empty()) {
+      ASSERT_TRUE(read.ok()) << test.relative << ": " << read.error().message;
+      EXPECT_EQ(*read, Value("own"));
+      continue;
+    }
+    ASSERT_FALSE(read.ok()) << test.relative;
+    EXPECT_EQ(read.error().domain, test.domain) << test.relative << ": " << read.error().message;
+    EXPECT_EQ(read.error().code, test.code) << test.relative << ": " << read.error().message;
+    EXPECT_NE(read.error().message.find(test.reason), std::string::npos) << read.error().message;
+    EXPECT_EQ(read.error().message.find("secret</string>"), std::string::npos);
+  }
+}
+
 TEST(DmapFile, RefusesFilesOverTheSizeLimitAsEFBIG) {
   TempDir dir;
   const std::string path = dir.file("big.dmap");

@@ -64,10 +64,21 @@ std::vector<std::string> FileConsent::grantedServices(
   return it->second;
 }
 
+std::optional<std::vector<std::string>> FileConsent::informationForApplication(
+    std::string_view applicationBundleIdentifier) {
+  std::lock_guard lock(mutex_);
+  synchronize();
+  if (unusable_) return std::nullopt;
+  auto it = granted_.find(applicationBundleIdentifier);
+  if (it == granted_.end()) return std::vector<std::string>{};
+  return it->second;
+}
+
 void FileConsent::synchronize() {
   const std::string file = path();
   auto fail = [&](std::optional<FileStamp> stamp, std::string reason) {
     granted_.clear();
+    unusable_ = true;
     stamp_ = stamp;
     read_ = stamp.has_value();
     std::pair<std::optional<FileStamp>, std::string> failure{stamp, reason};
@@ -82,6 +93,7 @@ void FileConsent::synchronize() {
     const int code = errno;
     if (code == ENOENT || code == ENOTDIR) {
       granted_.clear();
+      unusable_ = false;
       stamp_.reset();
       read_ = true;
       logged_.reset();
@@ -139,6 +151,7 @@ void FileConsent::synchronize() {
     if (!names.empty()) granted.emplace(application, std::move(names));
   }
   granted_ = std::move(granted);
+  unusable_ = false;
   stamp_ = stamp;
   read_ = true;
   logged_.reset();
@@ -151,6 +164,19 @@ std::vector<std::string> FakeConsent::grantedServices(
   auto it = granted_.find(applicationBundleIdentifier);
   if (it == granted_.end()) return {};
   return it->second;
+}
+
+std::optional<std::vector<std::string>> FakeConsent::informationForApplication(
+    std::string_view applicationBundleIdentifier) {
+  std::vector<std::string> granted = grantedServices(applicationBundleIdentifier);
+  std::lock_guard lock(mutex_);
+  if (unavailable_) return std::nullopt;
+  return granted;
+}
+
+void FakeConsent::setUnavailable(bool unavailable) {
+  std::lock_guard lock(mutex_);
+  unavailable_ = unavailable;
 }
 
 void FakeConsent::grant(std::string applicationBundleIdentifier, std::string service) {

@@ -31,6 +31,12 @@ class Consent {
   // application is unknown or nothing is granted. Thread-safe.
   virtual std::vector<std::string> grantedServices(
       std::string_view applicationBundleIdentifier) = 0;
+  // grantedServices, or nothing when the consent information cannot be had at all (the
+  // consent file is unusable): the caller then says so rather than taking it as a refusal.
+  virtual std::optional<std::vector<std::string>> informationForApplication(
+      std::string_view applicationBundleIdentifier) {
+    return grantedServices(applicationBundleIdentifier);
+  }
 };
 
 // $EKORA_STATE_DIR/consent.dmap: application bundle identifier -> dictionary of service
@@ -45,6 +51,9 @@ class FileConsent final : public Consent {
   explicit FileConsent(std::string stateDirectory = {});
 
   std::vector<std::string> grantedServices(std::string_view applicationBundleIdentifier) override;
+  // Nothing while the file is unusable; a missing file answers an empty list.
+  std::optional<std::vector<std::string>> informationForApplication(
+      std::string_view applicationBundleIdentifier) override;
 
   std::string path() const;
 
@@ -59,6 +68,8 @@ class FileConsent final : public Consent {
   // Of the file read last; nothing when it was missing or never looked at.
   std::optional<FileStamp> stamp_;
   bool read_ = false;
+  // Whether the file read last was unusable (so nothing is known of any application).
+  bool unusable_ = false;
   // The version of the file whose failure was logged last, so each is logged once.
   std::optional<std::pair<std::optional<FileStamp>, std::string>> logged_;
 };
@@ -68,7 +79,12 @@ class FakeConsent final : public Consent {
  public:
   std::vector<std::string> grantedServices(std::string_view applicationBundleIdentifier) override;
 
+  std::optional<std::vector<std::string>> informationForApplication(
+      std::string_view applicationBundleIdentifier) override;
+
   void grant(std::string applicationBundleIdentifier, std::string service);
+  // While unavailable, informationForApplication answers nothing.
+  void setUnavailable(bool unavailable);
   void revokeAll(std::string_view applicationBundleIdentifier);
   // Every application asked about, in order.
   std::vector<std::string> queries() const;
@@ -77,6 +93,7 @@ class FakeConsent final : public Consent {
   mutable std::mutex mutex_;
   std::map<std::string, std::vector<std::string>, std::less<>> granted_;
   std::vector<std::string> queries_;
+  bool unavailable_ = false;
 };
 
 }  // namespace ek::privo

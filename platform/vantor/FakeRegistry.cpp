@@ -9,6 +9,8 @@ FakeRegistry::FakeRegistry(std::shared_ptr<SerialQueue> queue)
 
 void FakeRegistry::install(PlugInProxy proxy) {
   if (proxy.url.empty()) proxy.url = fileUrlForPath(proxy.path);
+  // As registration does: the directory at the path now is the one registered.
+  if (!proxy.bundleIdentity) proxy.bundleIdentity = bundleIdentityOf(proxy.path);
   auto shared = std::make_shared<const PlugInProxy>(std::move(proxy));
   {
     std::lock_guard lock(mutex_);

@@ -1,10 +1,15 @@
 #include "platform/vantor/Registry.h"
 
+#include <fcntl.h>
 #include <fmt/format.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+
+#include "platform/io/UniqueFd.h"
 
 namespace ek::vantor {
 namespace {
@@ -136,21 +141,26 @@ std::string extensionPointIndexKey(std::string_view value) {
   return key;
 }
 
-Dictionary mergeSdk(const Dictionary& sdk, const Dictionary& info) {
-  Dictionary merged = info;
-  for (const auto& [key, sdkValue] : sdk) {
-    auto it = merged.find(key);
-    if (it == merged.end()) {
-      merged.emplace(key, sdkValue);
-      continue;
-    }
-    const Dictionary* sdkDictionary = sdkValue.dictionary();
-    Dictionary* own = it->second.dictionary();
-    if (sdkDictionary != nullptr && own != nullptr) {
-      it->second = Value(mergeSdk(*sdkDictionary, *own));
-    }
+std::optional<BundleIdentity> bundleIdentityOf(int directoryFd, const std::string& path) {
+  struct stat opened {};
+  if (::fstat(directoryFd, &opened) != 0 || !S_ISDIR(opened.st_mode)) return std::nullopt;
+  char* resolved = ::realpath(path.c_str(), nullptr);
+  if (resolved == nullptr) return std::nullopt;
+  BundleIdentity identity{static_cast<uint64_t>(opened.st_dev),
+                          static_cast<uint64_t>(opened.st_ino), resolved};
+  ::free(resolved);
+  struct stat named {};
+  if (::stat(identity.canonicalPath.c_str(), &named) != 0 || named.st_dev != opened.st_dev ||
+      named.st_ino != opened.st_ino) {
+    return std::nullopt;
   }
-  return merged;
+  return identity;
+}
+
+std::optional<BundleIdentity> bundleIdentityOf(const std::string& path) {
+  UniqueFd directory(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!directory.valid()) return std::nullopt;
+  return bundleIdentityOf(directory.get(), path);
 }
 
 std::string fileUrlForPath(std::string_view path) {

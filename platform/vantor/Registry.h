@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -10,6 +11,7 @@
 #include "platform/value/Result.h"
 #include "platform/value/Uuid.h"
 #include "platform/value/Value.h"
+#include "platform/vantor/SdkMerge.h"
 
 // Vantor, the application registry: which applications and plug-ins are installed, with the
 // facts the daemon builds its plug-in records from.
@@ -39,6 +41,16 @@ inline constexpr std::string_view kExtensionProtocolKey = "ZuExtensionProtocol";
 // The protocol of a data-only plug-in: it has no code, so it runs nowhere and gets no container.
 inline constexpr std::string_view kDataProtocol = "#Data";
 
+// The bundle directory a plug-in was registered from: what was read at registration is what
+// lay in this directory, so rights to the bundle are handed out only while the directory at
+// the plug-in's path is still this one.
+struct BundleIdentity {
+  uint64_t device = 0;
+  uint64_t inode = 0;
+  std::string canonicalPath;  // links resolved, at registration
+  bool operator==(const BundleIdentity&) const = default;
+};
+
 // One installed plug-in as the registry knows it. A plain value: it never changes after it is
 // handed out and stays valid after the plug-in is unregistered.
 struct PlugInProxy {
@@ -50,7 +62,7 @@ struct PlugInProxy {
   std::string url;   // file URL of path
   std::optional<std::string> containingAppPath;
   std::optional<std::string> containingAppName;  // localized
-  // Info.dmap with the SDK dictionary merged in (the plug-in's own values winning) and
+  // Info.dmap with the SDK dictionary merged in (mergeSdk) and
   // ZuExtensionPointIdentifier copied into ZuExtensionAttributes when it was missing there.
   Dictionary info;
   Dictionary sdk;  // the extension point's SDK dictionary; empty when it has none
@@ -61,6 +73,9 @@ struct PlugInProxy {
   std::optional<std::string> localizedShortName;
   std::optional<std::string> extensionPoint;  // ZuExtension's ZuExtensionPointIdentifier
   bool onSystemVolume = false;                // path lies under $EKORA_SYSTEM_ROOT
+  // Absent when the registry did not record it (a record from before it did): such a bundle
+  // gets no rights until it is registered again.
+  std::optional<BundleIdentity> bundleIdentity;
   // The registry's knowledge UUID when this proxy was read, so that a holder knows it is
   // current until the knowledge changes; absent when the registry does not say.
   std::optional<Uuid> knowledge;
@@ -170,9 +185,12 @@ std::vector<std::string> extensionPointIndexValues(const Dictionary& mergedInfo)
 // runs of digits by number; the index may then answer a few more candidates, never fewer.
 std::string extensionPointIndexKey(std::string_view value);
 
-// SDK merge: a copy of info with sdk merged in at every depth, the plug-in's own values
-// winning; dictionaries on both sides are merged key by key.
-Dictionary mergeSdk(const Dictionary& sdk, const Dictionary& info);
+// The identity of the directory open as directoryFd, which was opened by path: its device and
+// inode, and path with links resolved. Absent when that is not a directory or the resolved
+// path no longer names it (it was replaced meanwhile).
+std::optional<BundleIdentity> bundleIdentityOf(int directoryFd, const std::string& path);
+// The same for the directory at path now.
+std::optional<BundleIdentity> bundleIdentityOf(const std::string& path);
 
 // file:// URL of an absolute path, percent-encoded as RFC 3986 writes a path.
 std::string fileUrlForPath(std::string_view path);

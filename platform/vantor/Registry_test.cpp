@@ -69,15 +69,40 @@ TEST(IndexKey, DropsLeadingZerosOfDigitRuns) {
   EXPECT_EQ(extensionPointIndexKey("plain"), "plain");
 }
 
-TEST(MergeSdk, PlugInValuesWinAndDictionariesMergeKeyByKey) {
-  Dictionary sdk{{"A", Value("sdk")},
-                 {"OnlySdk", Value(1)},
-                 {"ZuExtension", Value(Dictionary{{"X", Value("sdk")}, {"Y", Value("sdk")}})}};
-  Dictionary info{{"A", Value("own")}, {"ZuExtension", Value(Dictionary{{"X", Value("own")}})}};
-  Dictionary merged = mergeSdk(sdk, info);
-  EXPECT_EQ(merged.at("A"), Value("own"));
-  EXPECT_EQ(merged.at("OnlySdk"), Value(1));
-  EXPECT_EQ(merged.at("ZuExtension"), Value(Dictionary{{"X", Value("own")}, {"Y", Value("sdk")}}));
+// Each row merges one SDK "ZuExtension" into one of the plug-in's and names what comes out.
+TEST(MergeSdk, FollowsTheRuleOfEachKey) {
+  using D = Dictionary;
+  using A = Array;
+  struct Row {
+    const char* name;
+    D sdk;
+    D own;
+    D expected;
+  };
+  const Row rows[] = {
+      {"CleanTimeout: the SDK's replaces the plug-in's", D{{"CleanTimeout", 30}},
+       D{{"CleanTimeout", 5}}, D{{"CleanTimeout", 30}}},
+      {"Shared: lists united, sorted, once each", D{{"Shared", A{"a", "c"}}},
+       D{{"Shared", A{"c", "b"}}}, D{{"Shared", A{"a", "b", "c"}}}},
+      {"Shared: a string is a one-element list", D{{"Shared", "a"}}, D{{"Shared", A{"b", 7}}},
+       D{{"Shared", A{"a", "b"}}}},
+      {"any other key: the plug-in's own value", D{{"Dedicated", true}}, D{{"Dedicated", false}},
+       D{{"Dedicated", false}}},
+      {"an SDK-only key is copied whole", D{{"SdkOnly", D{{"n", A{1, 2}}}}, {"Shared", "a"}}, D{},
+       D{{"SdkOnly", D{{"n", A{1, 2}}}}, {"Shared", "a"}}},
+      {"dictionaries merge key by key, the rules at every depth",
+       D{{"ZuExtensionAttributes", D{{"Sdk", "s"}, {"Both", "sdk"}, {"CleanTimeout", 1}}}},
+       D{{"ZuExtensionAttributes", D{{"Both", "own"}, {"CleanTimeout", 2}}}},
+       D{{"ZuExtensionAttributes", D{{"Both", "own"}, {"CleanTimeout", 1}, {"Sdk", "s"}}}}},
+      {"the plug-in's non-dictionary stays under an SDK dictionary",
+       D{{"ZuExtensionAttributes", D{{"k", 1}}}}, D{{"ZuExtensionAttributes", "own"}},
+       D{{"ZuExtensionAttributes", "own"}}},
+  };
+  for (const Row& row : rows) {
+    const D merged = mergeSdk(D{{"ZuExtension", row.sdk}, {"QvBundleName", "sdk"}},
+                              D{{"ZuExtension", row.own}, {"QvBundleName", "own"}});
+    EXPECT_EQ(merged, (D{{"ZuExtension", row.expected}, {"QvBundleName", "own"}})) << row.name;
+  }
 }
 
 TEST(FileUrl, RoundTripsPathsWithSpecialCharacters) {

@@ -38,7 +38,7 @@ namespace fs = std::filesystem;
 
 // Bumped whenever the tables change; a file with another version is set aside and rebuilt
 // (the registry is derived data: the installer and the start-up scan can always refill it).
-constexpr int kSchemaVersion = 3;
+constexpr int kSchemaVersion = 4;
 // Bounds on what one bundle may make the registry read.
 constexpr size_t kMaxPlugInsPerApplication = 4096;
 constexpr size_t kMaxLanguagesPerBundle = 512;
@@ -60,6 +60,22 @@ constexpr int kCacheSizeKiB = 2 * 1024;
 // Lets a query name its candidates in path order from an index alone, without reading the
 // plug-ins' rows, which the daemon's records already hold.
 #define UUID_PATH_SCHEMA "CREATE INDEX plugins_uuid_path ON plugins(uuid, path);"
+
+// The bundle directory each plug-in was read from (BundleIdentity); NULL in rows written
+// before it was kept.
+#define IDENTITY_SCHEMA                             \
+  "ALTER TABLE plugins ADD COLUMN device INTEGER; " \
+  "ALTER TABLE plugins ADD COLUMN inode INTEGER; "  \
+  "ALTER TABLE plugins ADD COLUMN real_path TEXT;"
+// Rows without one are read again by the next scan, which records it. Rows whose info no
+// bundle could give now (its Info.dmap and its SDK's, 1 MiB each, encode smaller than they
+// read) were read before files were bounded: they are dropped, so a reply is not made of them.
+#define IDENTITY_UPGRADE                                                      \
+  IDENTITY_SCHEMA                                                             \
+  " DELETE FROM plugin_sources;"                                              \
+  " DELETE FROM plugin_points WHERE uuid IN (SELECT uuid FROM plugins WHERE " \
+  "length(info) > 2097152);"                                                  \
+  " DELETE FROM plugins WHERE length(info) > 2097152;"
 
 constexpr const char* kSchema = R"sql(
 CREATE TABLE meta(key TEXT PRIMARY KEY, value BLOB NOT NULL);
@@ -90,11 +106,12 @@ CREATE TABLE plugin_points(point TEXT NOT NULL, uuid BLOB NOT NULL, PRIMARY KEY(
   WITHOUT ROWID;
 CREATE INDEX plugin_points_uuid ON plugin_points(uuid);
 CREATE TABLE extension_points(identifier TEXT PRIMARY KEY, sdk BLOB NOT NULL);
-)sql" SOURCES_SCHEMA " " UUID_PATH_SCHEMA;
+)sql" SOURCES_SCHEMA " " UUID_PATH_SCHEMA " " IDENTITY_SCHEMA;
 
 constexpr const char* kPlugInColumns =
     "p.uuid, p.path, p.identifier, p.original_identifier, p.version, p.app_path, p.point, "
-    "p.info, p.sdk, p.entitlements, p.registered, p.container, p.strings";
+    "p.info, p.sdk, p.entitlements, p.registered, p.container, p.strings, p.device, p.inode, "
+    "p.real_path";
 
 double now() {
   return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
@@ -166,16 +183,29 @@ std::vector<std::string> subdirectories(const std::string& dir, std::string_view
   return names;
 }
 
-// With sources, notes the files read (see BundleSources) before reading them.
-Result<Dictionary> readInfo(const std::string& bundle, BundleSources* sources = nullptr) {
+// A bundle's Info.dmap, read beneath its directory; with identity, the directory it was read
+// from, and with directoryOut, that directory kept open so that the bundle's other files are
+// read from the same one. With sources, notes the files read (see BundleSources) before
+// reading them.
+Result<Dictionary> readInfo(const std::string& bundle, BundleSources* sources = nullptr,
+                            std::optional<BundleIdentity>* identity = nullptr,
+                            UniqueFd* directoryOut = nullptr) {
   if (sources) {
     sources->note(bundle);
     sources->note(paths::join(bundle, "Info.dmap"));
   }
-  if (!isDirectory(bundle)) {
+  UniqueFd directory(::open(bundle.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!directory.valid()) {
     return makeError(kMalformedBundle, fmt::format("{} is not a bundle directory", bundle));
   }
-  auto value = dmap::readFile(paths::join(bundle, "Info.dmap"));
+  if (identity) {
+    *identity = bundleIdentityOf(directory.get(), bundle);
+    if (!*identity) {
+      return makeError(kMalformedBundle,
+                       fmt::format("{}: the directory changed while it was read", bundle));
+    }
+  }
+  auto value = dmap::readFileBeneath(directory.get(), bundle, "Info.dmap");
   if (!value.ok()) {
     return makeError(kMalformedBundle,
                      fmt::format("{}: unreadable Info.dmap: {}", bundle, value.error().message));
@@ -184,23 +214,28 @@ Result<Dictionary> readInfo(const std::string& bundle, BundleSources* sources = 
     return makeError(kMalformedBundle,
                      fmt::format("{}: Info.dmap does not hold a dictionary", bundle));
   }
+  if (directoryOut) *directoryOut = std::move(directory);
   return std::move(*value->dictionary());
 }
 
 // Every <language>.lproj/InfoDmap.strings of the bundle: language -> table. A malformed table
 // is logged and left out; it does not make the bundle malformed.
-Dictionary readInfoStrings(const std::string& bundle, BundleSources* sources = nullptr) {
+// directoryFd, when given, is the bundle directory open.
+Dictionary readInfoStrings(const std::string& bundle, BundleSources* sources = nullptr,
+                           int directoryFd = -1) {
   Dictionary tables;
   bool truncated = false;
   for (const std::string& dir :
        subdirectories(bundle, ".lproj", kMaxLanguagesPerBundle, truncated)) {
-    std::string file = paths::join(paths::join(bundle, dir), "InfoDmap.strings");
+    const std::string relative = paths::join(dir, "InfoDmap.strings");
+    std::string file = paths::join(bundle, relative);
     if (sources) {
       // The directory too: a table created in it later changes the directory's stamp.
       sources->note(paths::join(bundle, dir));
       sources->note(file);
     }
-    auto value = dmap::readFile(file);
+    auto value = directoryFd >= 0 ? dmap::readFileBeneath(directoryFd, bundle, relative)
+                                  : dmap::readFileBeneath(bundle, relative);
     if (!value.ok()) {
       if (!value.error().isPosix(ENOENT)) {
         log::vr().error("ignoring strings table %s: %s", file, value.error().message);
@@ -280,6 +315,7 @@ struct PlugInPlan {
   std::optional<std::string> container;
   Dictionary strings;
   std::optional<std::vector<uint8_t>> sources;  // see BundleSources
+  std::optional<BundleIdentity> identity;
 };
 
 struct SqliteRegistry::Plan {
@@ -386,6 +422,19 @@ class Use {
     return blob(index, bytes.data(), bytes.size());
   }
   Use& uuid(int index, const Uuid& uuid) { return blob(index, uuid.bytes.data(), 16); }
+  Use& integer(int index, uint64_t value) {
+    sqlite3_bind_int64(statement_, index, static_cast<sqlite3_int64>(value));
+    return *this;
+  }
+  Use& identity(int index, const std::optional<BundleIdentity>& value) {
+    if (!value) {
+      for (int i = 0; i < 3; ++i) sqlite3_bind_null(statement_, index + i);
+      return *this;
+    }
+    return integer(index, value->device)
+        .integer(index + 1, value->inode)
+        .text(index + 2, value->canonicalPath);
+  }
   Use& real(int index, double value) {
     sqlite3_bind_double(statement_, index, value);
     return *this;
@@ -406,6 +455,15 @@ std::optional<std::string> columnText(sqlite3_stmt* statement, int column) {
 Dictionary columnDictionary(sqlite3_stmt* statement, int column) {
   const void* bytes = sqlite3_column_blob(statement, column);
   return decodeDictionary(bytes, sqlite3_column_bytes(statement, column));
+}
+
+std::optional<BundleIdentity> columnIdentity(sqlite3_stmt* statement, int column) {
+  for (int i = 0; i < 3; ++i) {
+    if (sqlite3_column_type(statement, column + i) == SQLITE_NULL) return std::nullopt;
+  }
+  return BundleIdentity{static_cast<uint64_t>(sqlite3_column_int64(statement, column)),
+                        static_cast<uint64_t>(sqlite3_column_int64(statement, column + 1)),
+                        columnText(statement, column + 2).value_or("")};
 }
 
 Uuid columnUuid(sqlite3_stmt* statement, int column) {
@@ -586,13 +644,17 @@ OpenResult openAndCheck(const std::string& path, sqlite3** out) {
       execute(db, "ROLLBACK");
       return result;
     }
-  } else if (version == "1" || version == "2") {
+  } else if (version == "1" || version == "2" || version == "3") {
     // Version 1 lacked the record of each plug-in's sources (without one, the next scan reads
-    // the bundle and records it), versions 1 and 2 the index of paths by UUID.
+    // the bundle and records it), versions 1 and 2 the index of paths by UUID, versions 1 to 3
+    // the bundle directories (their plug-ins get no rights until registered again; the next
+    // scan does that for the system's).
     const char* upgrade = version == "1" ? "BEGIN; " SOURCES_SCHEMA " " UUID_PATH_SCHEMA
-                                           " PRAGMA user_version=3; COMMIT;"
-                                         : "BEGIN; " UUID_PATH_SCHEMA
-                                           " PRAGMA user_version=3; COMMIT;";
+                                           " " IDENTITY_UPGRADE " PRAGMA user_version=4; COMMIT;"
+                          : version == "2" ? "BEGIN; " UUID_PATH_SCHEMA " " IDENTITY_UPGRADE
+                                             " PRAGMA user_version=4; COMMIT;"
+                                           : "BEGIN; " IDENTITY_UPGRADE
+                                             " PRAGMA user_version=4; COMMIT;";
     if ((rc = sqlite3_exec(db, upgrade, nullptr, nullptr, nullptr)) != SQLITE_OK) {
       OpenResult result = failure(db, rc, "upgrading the registry schema");
       execute(db, "ROLLBACK");
@@ -807,8 +869,8 @@ Result<void> SqliteRegistry::prepareSchema() {
       {&s.allApps, "SELECT path FROM applications ORDER BY path"},
       {&s.insertPlugIn,
        "INSERT INTO plugins(uuid, path, identifier, original_identifier, version, app_path, "
-       "point, info, sdk, entitlements, registered, container, strings) "
-       "VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, ?11, ?12, ?13)"},
+       "point, info, sdk, entitlements, registered, container, strings, device, inode, "
+       "real_path) VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, ?11, ?12, ?13, ?14, ?15, ?16)"},
       {&s.setSources,
        "INSERT OR REPLACE INTO plugin_sources(path, container, sources) VALUES(?1, ?2, ?3)"},
       {&s.forgetSources, "DELETE FROM plugin_sources WHERE path = ?1"},
@@ -885,10 +947,10 @@ struct BundleReader {
       log::vr().error("extension point \"%s\" cannot name an SDK file", point);
       return std::nullopt;
     }
-    std::string file =
-        paths::join(paths::join(options.systemRoot, "Library/ExtensionPoints"), point + ".dmap");
+    const std::string directory = paths::join(options.systemRoot, "Library/ExtensionPoints");
+    std::string file = paths::join(directory, point + ".dmap");
     if (sources) sources->noteShared(file);
-    auto value = dmap::readFile(file);
+    auto value = dmap::readFileBeneath(directory, point + ".dmap");
     if (!value.ok()) {
       if (value.error().isPosix(ENOENT)) {
         log::vr().info("plug-in sdk \"%s\" not registered", point);
@@ -906,12 +968,16 @@ struct BundleReader {
 
   // What reading a bundle depends on besides its files.
   std::string sourcesContext() const {
-    return fmt::format("{}\n{}\n{}", options.stateDir, options.systemRoot, ::geteuid());
+    // The last field names the way bundles are read: records made by an older one say
+    // nothing of what this one would read.
+    return fmt::format("{}\n{}\n{}\nbeneath-1", options.stateDir, options.systemRoot, ::geteuid());
   }
 
   Result<PlugInPlan> readPlugIn(const std::string& path) {
     BundleSources sources(sourcesContext(), options.settleSeconds);
-    Dictionary own = EK_TRY(readInfo(path, &sources));
+    std::optional<BundleIdentity> identity;
+    UniqueFd directory;
+    Dictionary own = EK_TRY(readInfo(path, &sources, &identity, &directory));
     auto identifier = stringValue(own, kBundleIdentifierKey);
     if (!identifier) {
       return makeError(kMalformedBundle,
@@ -925,6 +991,7 @@ struct BundleReader {
     }
     PlugInPlan plan;
     plan.path = path;
+    plan.identity = std::move(identity);
     plan.identifier = *identifier;
     plan.version = stringValue(own, kBundleVersionKey);
     if (const Value* point = extension->second.get(kExtensionPointKey)) {
@@ -967,7 +1034,13 @@ struct BundleReader {
     if (!dataOnly) {
       plan.container = paths::join(paths::join(options.stateDir, "containers"), plan.identifier);
     }
-    plan.strings = readInfoStrings(path, &sources);
+    plan.strings = readInfoStrings(path, &sources, directory.get());
+    // The entitlements were read by path: a bundle swapped for a link meanwhile could have
+    // given them from elsewhere.
+    if (bundleIdentityOf(path) != plan.identity) {
+      return makeError(kMalformedBundle,
+                       fmt::format("{}: the directory changed while it was read", path));
+    }
     plan.sources = sources.record();
     std::string parent = parentOf(path);
     if (baseName(parent) == "PlugIns" && endsWith(parentOf(parent), ".app")) {
@@ -985,37 +1058,45 @@ Result<void> SqliteRegistry::registerBundle(const std::string& rawPath) {
     return makeError(kMalformedBundle, fmt::format("\"{}\" is not an absolute path", rawPath));
   }
   std::lock_guard change(changeMutex_);
-  BundleReader reader{options_};
-  Plan plan;
-  if (endsWith(*path, ".app")) {
-    plan.apps.push_back(EK_TRY(reader.readApplication(*path)));
-    bool truncated = false;
-    std::string plugIns = paths::join(*path, "PlugIns");
-    auto names = subdirectories(plugIns, ".appex", kMaxPlugInsPerApplication, truncated);
-    if (truncated) {
-      return makeError(kMalformedBundle,
-                       fmt::format("{}: more than {} plug-ins", *path, kMaxPlugInsPerApplication));
-    }
-    for (const std::string& name : names) {
-      PlugInPlan plugIn = EK_TRY(reader.readPlugIn(paths::join(plugIns, name)));
+  // The reason a bundle is refused is the registry's own: the daemon answers its client
+  // without it.
+  Result<void> registered = [&]() -> Result<void> {
+    BundleReader reader{options_};
+    Plan plan;
+    if (endsWith(*path, ".app")) {
+      plan.apps.push_back(EK_TRY(reader.readApplication(*path)));
+      bool truncated = false;
+      std::string plugIns = paths::join(*path, "PlugIns");
+      auto names = subdirectories(plugIns, ".appex", kMaxPlugInsPerApplication, truncated);
+      if (truncated) {
+        return makeError(kMalformedBundle, fmt::format("{}: more than {} plug-ins", *path,
+                                                       kMaxPlugInsPerApplication));
+      }
+      for (const std::string& name : names) {
+        PlugInPlan plugIn = EK_TRY(reader.readPlugIn(paths::join(plugIns, name)));
+        plan.plugIns.push_back(std::move(plugIn));
+      }
+      plan.replacesPlugInsOf = *path;
+    } else {
+      PlugInPlan plugIn = EK_TRY(reader.readPlugIn(*path));
+      if (plugIn.appPath) {
+        bool known = false;
+        {
+          std::lock_guard db(dbMutex_);
+          Use exists(statements_->appExists);
+          exists.text(1, *plugIn.appPath);
+          known = exists.step() == SQLITE_ROW;
+        }
+        if (!known) plan.apps.push_back(EK_TRY(reader.readApplication(*plugIn.appPath)));
+      }
       plan.plugIns.push_back(std::move(plugIn));
     }
-    plan.replacesPlugInsOf = *path;
-  } else {
-    PlugInPlan plugIn = EK_TRY(reader.readPlugIn(*path));
-    if (plugIn.appPath) {
-      bool known = false;
-      {
-        std::lock_guard db(dbMutex_);
-        Use exists(statements_->appExists);
-        exists.text(1, *plugIn.appPath);
-        known = exists.step() == SQLITE_ROW;
-      }
-      if (!known) plan.apps.push_back(EK_TRY(reader.readApplication(*plugIn.appPath)));
-    }
-    plan.plugIns.push_back(std::move(plugIn));
+    return applyPlan(plan);
+  }();
+  if (!registered.ok()) {
+    log::vr().defaultLevel("not registering %s: %s", *path, registered.error().message);
   }
-  return applyPlan(plan);
+  return registered;
 }
 
 EkError SqliteRegistry::rollback(std::string_view what) {
@@ -1176,7 +1257,8 @@ Result<void> SqliteRegistry::applyPlan(Plan& plan) {
           .blob(10, encodeDictionary(plugIn.entitlements))
           .real(11, registered)
           .optionalText(12, plugIn.container)
-          .blob(13, encodeDictionary(plugIn.strings));
+          .blob(13, encodeDictionary(plugIn.strings))
+          .identity(14, plugIn.identity);
       if (insert.step() != SQLITE_DONE) return fail("registering a plug-in");
       if (plugIn.sources) {
         Use record(s.setSources);
@@ -1407,7 +1489,8 @@ void SqliteRegistry::reconcile() {
             columnText(row, 11) == plugIn->container && columnDictionary(row, 7) == plugIn->info &&
             columnDictionary(row, 8) == plugIn->sdk &&
             columnDictionary(row, 9) == plugIn->entitlements &&
-            columnDictionary(row, 12) == plugIn->strings;
+            columnDictionary(row, 12) == plugIn->strings &&
+            columnIdentity(row, 13) == plugIn->identity;
       }
     }
     if (unchanged) {
@@ -1466,6 +1549,7 @@ PlugInProxyPtr SqliteRegistry::readPlugInLocked(void* raw) {
   proxy->entitlements = columnDictionary(statement, 9);
   proxy->registrationDate = Date{sqlite3_column_double(statement, 10)};
   proxy->dataContainerPath = columnText(statement, 11);
+  proxy->bundleIdentity = columnIdentity(statement, 13);
   proxy->knowledge = knowledge_;
   Dictionary strings = columnDictionary(statement, 12);
   std::vector<std::string> languages = languageCandidates(languageLocked());
@@ -1669,8 +1753,8 @@ Dictionary SqliteRegistry::localizedStrings(const Uuid& plugIn, std::string_view
     language = languageLocked();
   }
   for (const std::string& candidate : languageCandidates(language)) {
-    std::string file = fmt::format("{}/{}.lproj/{}.strings", proxy->path, candidate, table);
-    auto value = dmap::readFile(file);
+    auto value =
+        dmap::readFileBeneath(proxy->path, fmt::format("{}.lproj/{}.strings", candidate, table));
     if (!value.ok() || value->dictionary() == nullptr) continue;
     for (const std::string& key : keys) {
       if (result.contains(key)) continue;

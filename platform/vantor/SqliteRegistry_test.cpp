@@ -745,16 +745,22 @@ TEST_F(StartUpScanTest, BundlesAreReadAgainWhenTheirRecordCannotBeTrusted) {
 }
 
 TEST_F(StartUpScanTest, RegistriesOfEarlierSchemasAreUpgradedInPlace) {
+  // Versions before 4 kept no record of the bundle directories: their bundles are read again.
   struct Earlier {
     const char* downgrade;
-    int bundlesRead;  // version 1 kept no record of what the bundles were read from
+    int bundlesRead;
   };
+#define DROP_IDENTITY                                                               \
+  "ALTER TABLE plugins DROP COLUMN device; ALTER TABLE plugins DROP COLUMN inode; " \
+  "ALTER TABLE plugins DROP COLUMN real_path; "
   const Earlier earlier[] = {
-      {"DROP INDEX plugins_uuid_path; DROP TRIGGER plugins_forget_sources; "
-       "DROP TABLE plugin_sources; PRAGMA user_version=1;",
+      {DROP_IDENTITY "DROP INDEX plugins_uuid_path; DROP TRIGGER plugins_forget_sources; "
+                     "DROP TABLE plugin_sources; PRAGMA user_version=1;",
        1},
-      {"DROP INDEX plugins_uuid_path; PRAGMA user_version=2;", 0},
+      {DROP_IDENTITY "DROP INDEX plugins_uuid_path; PRAGMA user_version=2;", 1},
+      {DROP_IDENTITY "PRAGMA user_version=3;", 1},
   };
+#undef DROP_IDENTITY
   Uuid uuid = open().plugInByUrl(spell_)->uuid;
   const Dictionary byPoint{{"ZuExtensionPointIdentifier", Value("com.x.spell")}};
   for (const Earlier& schema : earlier) {
@@ -766,6 +772,7 @@ TEST_F(StartUpScanTest, RegistriesOfEarlierSchemasAreUpgradedInPlace) {
     EXPECT_EQ(reopenCountingReads(), schema.bundlesRead) << schema.downgrade;
     EXPECT_EQ(asideDatabases(state_), 0u);
     EXPECT_EQ(registry_->plugInByUrl(spell_)->uuid, uuid);
+    EXPECT_EQ(registry_->plugInByUrl(spell_)->bundleIdentity, bundleIdentityOf(spell_));
     EXPECT_EQ(registry_->queryUuids(byPoint), std::vector<Uuid>{uuid});
     EXPECT_EQ(reopenCountingReads(), 0);
   }
