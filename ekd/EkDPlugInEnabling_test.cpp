@@ -199,7 +199,7 @@ class EnablingTest : public ::testing::Test {
     auto record = plugIn(spec);
     if (!record) return "(no record)";
     const size_t before = serviceManager_->declarations().size();
-    EXPECT_EQ(record->enableForClient(*client_, nullptr), std::nullopt);
+    EXPECT_EQ(record->enableForClient(*client_->process(), nullptr), std::nullopt);
     auto declarations = serviceManager_->declarations();
     if (declarations.size() != before + 1) return "(not declared)";
     return profileOf(declarations.back().overlay);
@@ -338,13 +338,13 @@ TEST_F(EnablingTest, OverlayDeclaresTheExecutableForTheHost) {
                                       {"_OmitSandboxParameters", Value(false)}});
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
-  EXPECT_EQ(record->enableForClient(*client_, nullptr), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), nullptr), std::nullopt);
 
   auto declarations = serviceManager_->declarations();
   ASSERT_EQ(declarations.size(), 1u);
   const auto& declaration = declarations.front();
   EXPECT_EQ(declaration.hostPid, getpid());
-  EXPECT_EQ(declaration.hostPath, client_->path());
+  EXPECT_EQ(declaration.hostPath, client_->process()->path());
   EXPECT_FALSE(declaration.hostPath.empty());
   EXPECT_EQ(declaration.bundleIdentifier, spec.identifier);
   EXPECT_EQ(declaration.program, *record->path() + "/Thing");
@@ -374,7 +374,7 @@ TEST_F(EnablingTest, HostEnvironmentCannotReplaceTheContainerVariables) {
   const Dictionary host{{"HOME", Value("/home/host")},
                         {"TMPDIR", Value("/tmp/host")},
                         {"LANG", Value("de_DE.UTF-8")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   const std::string home = container("com.example.plugin").string();
   EXPECT_EQ(environmentOf(onlyOverlay()), (Dictionary{{"HOME", Value(home)},
                                                       {"QVFIXED_USER_HOME", Value(home)},
@@ -391,7 +391,7 @@ TEST_F(EnablingTest, PlugInVariablesWinOverContainerAndHost) {
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
   const Dictionary host{{"LANG", Value("de_DE.UTF-8")}, {"COUNT", Value("host")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   const Dictionary environment = environmentOf(onlyOverlay());
   EXPECT_EQ(environment.at("HOME"), Value("/plugin/home"));
   EXPECT_EQ(environment.at("QVFIXED_USER_HOME"), Value(container(spec.identifier).string()));
@@ -406,7 +406,7 @@ TEST_F(EnablingTest, PlugInEnvironmentThatIsNotADictionaryIsIgnored) {
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
   const Dictionary host{{"LANG", Value("C")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   const Dictionary environment = environmentOf(onlyOverlay());
   EXPECT_EQ(environment.at("HOME"), Value(container(spec.identifier).string()));
   EXPECT_EQ(environment.at("LANG"), Value("C"));
@@ -425,7 +425,7 @@ TEST_F(EnablingTest, HostValuesThatAreNotCarriableStringsAreDropped) {
                         {"NUL", Value(std::string("a\0z", 3))},
                         {"BADUTF8", Value(std::string("\xff\xfe"))},
                         {"KEPT", Value("<&>\"' \t\nline")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   Dictionary environment = environmentOf(onlyOverlay());
   environment.erase("HOME");
   environment.erase("QVFIXED_USER_HOME");
@@ -438,7 +438,7 @@ TEST_F(EnablingTest, DaemonTestSdkIsPassedOn) {
   auto record = plugIn({});
   ASSERT_TRUE(record);
   const Dictionary host{{"EKTEST_SDK", Value("/host/sdk")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   EXPECT_EQ(environmentOf(onlyOverlay()).at("EKTEST_SDK"), Value("/sdk/path"));
 }
 
@@ -449,7 +449,7 @@ TEST_F(EnablingTest, PlugInWithoutDataContainerGetsNoHome) {
   ASSERT_TRUE(record);
   ASSERT_FALSE(record->dataContainerURL());
   const Dictionary host{{"HOME", Value("/home/host")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   EXPECT_EQ(environmentOf(onlyOverlay()), (Dictionary{{"HOME", Value("/home/host")}}));
   EXPECT_TRUE(sink_->has(log::Level::Debug, "ops",
                          "no data container for plug-in com.example.plugin(3.1) " +
@@ -461,7 +461,7 @@ TEST_F(EnablingTest, MissingWyreServiceStartsFromAnEmptyService) {
   spec.wyreService = Value("not a dictionary");
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
-  EXPECT_EQ(record->enableForClient(*client_, nullptr), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), nullptr), std::nullopt);
   const Dictionary overlay = onlyOverlay();
   const Dictionary& service = serviceOf(overlay);
   EXPECT_EQ(service.size(), 3u);
@@ -475,7 +475,7 @@ TEST_F(EnablingTest, ServiceManagerRefusalIsCode4AndLogged) {
   serviceManager_->addResult = EACCES;
   auto record = plugIn({});
   ASSERT_TRUE(record);
-  std::optional<EkError> error = record->enableForClient(*client_, nullptr);
+  std::optional<EkError> error = record->enableForClient(*client_->process(), nullptr);
   ASSERT_TRUE(error);
   EXPECT_EQ(error->domain, "Ekora");
   EXPECT_EQ(error->code, 4);
@@ -483,7 +483,8 @@ TEST_F(EnablingTest, ServiceManagerRefusalIsCode4AndLogged) {
             "unable to enable plug-in com.example.plugin(" + record->uuid().string() + ")");
   EXPECT_TRUE(sink_->has(log::Level::Error, "ops",
                          "stard error 13 trying to allow " + std::to_string(getpid()) + " " +
-                             client_->path() + " to use plug-in com.example.plugin(3.1) uuid=" +
+                             client_->process()->path() +
+                             " to use plug-in com.example.plugin(3.1) uuid=" +
                              record->uuid().string() + " at " + *record->path()));
   EXPECT_EQ(serviceManager_->declarations().size(), 1u);  // asked once, not retried
 }
@@ -493,7 +494,7 @@ TEST_F(EnablingTest, PlugInWithoutExecutableIsNotDeclared) {
   spec.executable = false;
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
-  std::optional<EkError> error = record->enableForClient(*client_, nullptr);
+  std::optional<EkError> error = record->enableForClient(*client_->process(), nullptr);
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code, 4);
   EXPECT_EQ(error->message, "cannot obtain executable path for plug-in com.example.plugin(" +
@@ -521,7 +522,7 @@ TEST_F(EnablingTest, DeclarationFileStaysReadableWithOddEnvironmentValues) {
                         {"CONTROL", Value(std::string("\x1b[0m"))},
                         {"BADUTF8", Value(std::string("\xc3"))},
                         {"NUMBER", Value(-4)}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   std::optional<Dictionary> declaration = files->declaration(getpid(), spec.identifier);
   ASSERT_TRUE(declaration);
   auto overlay = declaration->find("overlay");
