@@ -790,12 +790,16 @@ void Listener::prepare() {
   // Accepted sockets inherit this, and bytes written before the accept carry credentials too.
   int on = 1;
   ::setsockopt(acceptor_.native_handle(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on);
+}
+
+size_t Listener::connectionLimit() const {
+  // Read at every accept: an administrator may change the limit of a running daemon.
   struct rlimit files {};
-  if (::getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur != RLIM_INFINITY) {
-    size_t usable =
-        files.rlim_cur > kReservedDescriptors ? files.rlim_cur - kReservedDescriptors : 0;
-    limit_ = std::clamp<size_t>(usable / kDescriptorsPerConnection, 1, kMaxConnections);
+  if (::getrlimit(RLIMIT_NOFILE, &files) != 0 || files.rlim_cur == RLIM_INFINITY) {
+    return kMaxConnections;
   }
+  size_t usable = files.rlim_cur > kReservedDescriptors ? files.rlim_cur - kReservedDescriptors : 0;
+  return std::clamp<size_t>(usable / kDescriptorsPerConnection, 1, kMaxConnections);
 }
 
 void Listener::acceptMore() {
@@ -854,7 +858,7 @@ void Listener::accepted(stream_protocol::socket socket) {
     }
     return;
   }
-  if (count_->load() >= limit_) {
+  if (count_->load() >= connectionLimit()) {
     static log::Throttle full;
     log::process().throttled(full, log::Level::Error,
                              "refused connection from pid=%d: %zu connections already", token->pid,

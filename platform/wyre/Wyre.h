@@ -270,7 +270,7 @@ class Listener : public std::enable_shared_from_this<Listener> {
   bool activated() const { return activated_; }
   // kMaxConnections, or fewer when the descriptor limit leaves room for fewer (each
   // connection takes a socket and a pidfd, and the process keeps some for its own files).
-  size_t connectionLimit() const { return limit_; }
+  size_t connectionLimit() const;
   size_t connectionCount() const { return count_->load(); }
 
  private:
@@ -287,7 +287,6 @@ class Listener : public std::enable_shared_from_this<Listener> {
   std::string path_;
   bool activated_ = false;
   std::atomic<bool> cancelled_{false};
-  size_t limit_ = kMaxConnections;
   std::shared_ptr<std::atomic<size_t>> count_ = std::make_shared<std::atomic<size_t>>(0);
   std::chrono::milliseconds backoff_{0};  // on strand_
 };
