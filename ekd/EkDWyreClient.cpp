@@ -95,7 +95,20 @@ std::shared_ptr<EkDWyreClient> EkDWyreClient::initWithConnection(
   return client;
 }
 
-std::shared_ptr<const EkDClientProcess> EkDWyreClient::writerOf(const Credentials& writer) {
+std::shared_ptr<const EkDClientProcess> EkDWyreClient::writerOf(const wyre::Message& message) {
+  const Credentials& writer = message.sender;
+  // Messages of one read were written by one process before the read: a stat after the read
+  // already answers for all of them.
+  if (lastWriter_ && message.read != 0 && message.read == lastRead_ &&
+      lastWriter_->pid() == writer.pid) {
+    return lastWriter_;
+  }
+  lastWriter_ = resolveWriter(writer);
+  lastRead_ = message.read;
+  return lastWriter_;
+}
+
+std::shared_ptr<const EkDClientProcess> EkDWyreClient::resolveWriter(const Credentials& writer) {
   if (writer.pid <= 0) {
     // The kernel could not name the writer: judged as nobody in particular.
     return EkDClientProcess::read(AuditToken::forWriter(writer), std::nullopt,
@@ -152,7 +165,7 @@ void EkDWyreClient::handleEvent(const wyre::Event& event) {
     std::string text = message.body.description();
     EK_PROBE2(request_input, pid_, text.c_str());
   }
-  submit(Transaction::initWithRequest(message, shared_from_this(), writerOf(message.sender)));
+  submit(Transaction::initWithRequest(message, shared_from_this(), writerOf(message)));
 }
 
 void EkDWyreClient::submit(std::shared_ptr<Transaction> transaction) {

@@ -76,8 +76,9 @@ class EkDWyreClient : public std::enable_shared_from_this<EkDWyreClient> {
   const std::shared_ptr<const EkDClientProcess>& process() const { return process_; }
   // The record of the process that wrote a message on this connection: kept per process and
   // executable, read anew when the process has executed another program. Costs one stat of
-  // /proc/<pid>/exe per message. Called on the connection's event queue.
-  std::shared_ptr<const EkDClientProcess> writerOf(const Credentials& writer);
+  // /proc/<pid>/exe per read of the socket (the messages of one read share it). Called on the
+  // connection's event queue.
+  std::shared_ptr<const EkDClientProcess> writerOf(const wyre::Message& message);
 
   // Reactions to the connection's termination-imminent and connection-invalid events.
   void dying();
@@ -97,6 +98,7 @@ class EkDWyreClient : public std::enable_shared_from_this<EkDWyreClient> {
  private:
   EkDWyreClient() = default;
   void handleEvent(const wyre::Event& event);
+  std::shared_ptr<const EkDClientProcess> resolveWriter(const Credentials& writer);
   void submit(std::shared_ptr<Transaction> transaction);
   void runNext();
 
@@ -109,6 +111,9 @@ class EkDWyreClient : public std::enable_shared_from_this<EkDWyreClient> {
 
   // Writers seen on the connection, the connecting process first; on the connection's queue.
   std::vector<std::shared_ptr<const EkDClientProcess>> writers_;
+  // The writer of the last message and the read it came in.
+  std::shared_ptr<const EkDClientProcess> lastWriter_;
+  uint64_t lastRead_ = 0;
 
   // Requests waiting for the work queue. The client has at most one turn queued there, so
   // that a client with many requests waiting delays another client's by one request, not by

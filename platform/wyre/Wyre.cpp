@@ -358,6 +358,7 @@ void Connection::receive() {
         return;
       }
     }
+    ++reads_;
     if (!consume(buffer, static_cast<size_t>(n), writer)) return;
   }
   readMore();
@@ -500,7 +501,11 @@ bool Connection::deliverFrame(const FrameHeader& header, const uint8_t* bodyByte
   gHeldInput.fetch_add(bytes, std::memory_order_relaxed);
   Event event;
   event.type = EventType::Message;
-  event.message = Message{std::move(body).value(), header.id, header.flags, writer,
+  event.message = Message{std::move(body).value(),
+                          header.id,
+                          header.flags,
+                          writer,
+                          reads_,
                           std::make_shared<WaitingTicket>(weak_from_this(), bytes)};
   deliver(std::move(event));
   return true;

@@ -100,6 +100,9 @@ struct Message {
   // The process that wrote the frame, as the kernel stamped its bytes; on a connection the
   // process made itself, the peer's credentials.
   Credentials sender;
+  // Which read of the connection completed the frame (counting from 1): messages of one read
+  // were all written by one process, and the read came after all of them were written.
+  uint64_t read = 0;
   std::shared_ptr<WaitingTicket> ticket;
   bool wantsReply() const { return flags & kFlagWantsReply; }
 };
@@ -214,6 +217,7 @@ class Connection : public std::enable_shared_from_this<Connection> {
   size_t heldStart_ = 0;
   Credentials heldWriter_;
   uint64_t heldGeneration_ = 0;  // counts the times held_ became empty
+  uint64_t reads_ = 0;
   std::unique_ptr<asio::steady_timer> deadline_;
   std::unique_ptr<asio::steady_timer> retry_;
   bool reading_ = false;
