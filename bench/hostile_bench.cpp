@@ -36,7 +36,7 @@ struct Options {
   std::string examples = EXAMPLES_DIR;
   unsigned idle = 600;
   unsigned flood = 10000;
-  unsigned samples = 2000;
+  unsigned samples = 20000;
 };
 
 long residentKiB(pid_t pid) {
