@@ -35,7 +35,7 @@ std::shared_ptr<const EkDClientProcess> EkDClientProcess::read(
   // What was read describes the process only if it still runs the same program now: it may
   // have executed another, or exited and left its pid to another process, meanwhile.
   if (!path || !record->token_.alive() || executableIdForPid(pid) != executable) {
-    record->sandboxed_ = true;
+    record->unknown_ = true;
     return record;
   }
   record->executable_ = executable;
@@ -63,10 +63,9 @@ bool EkDClientProcess::hasEntitlement(std::string_view key) const {
 }
 
 bool EkDClientProcess::isSandboxed() const {
-  if (sandboxed_.load()) return true;
-  // Asked anew until it holds: a process may confine itself after it connected.
-  if (!sandbox_ || sandbox_->isSandboxed(token_)) sandboxed_ = true;
-  return sandboxed_.load();
+  // Asked anew each time of the pinned process (rarely: only privileged requests ask), since a
+  // process may confine itself after it first wrote; an unknown process always is.
+  return unknown_ || !sandbox_ || sandbox_->isSandboxed(token_);
 }
 
 // ---- EkDWyreClient ---------------------------------------------------------------------------

@@ -24,8 +24,8 @@ class Transaction;
 // What the daemon knows of one process that writes requests: the program it runs, the bundle
 // around that program, its entitlements and whether it runs in a sandbox. A request is judged
 // by the record of the process that wrote it, which need not be the one that connected (a
-// child that kept the socket, say). Immutable but for the sandbox state, which only ever
-// turns on (a process cannot drop its seccomp filters).
+// child that kept the socket, say). Immutable; the sandbox state is asked of the process
+// itself, pinned by its pidfd.
 class EkDClientProcess {
  public:
   // Reads the record of the process behind token, which runs the file executable. A process
@@ -58,7 +58,7 @@ class EkDClientProcess {
   std::shared_ptr<CodeSigningTask> task_;
   std::optional<FileId> executable_;
   std::shared_ptr<SandboxCheck> sandbox_;
-  mutable std::atomic<bool> sandboxed_{false};
+  bool unknown_ = false;
 };
 
 // The daemon's record of one connected client. It lives as long as its connection (which
