@@ -12,6 +12,7 @@
 #include "Ekora/EkPlugInKeys.h"
 #include "Ekora/EkProtocol.h"
 #include "Ekora/EkSandboxExtension.h"
+#include "platform/codesign/CodeSigning.h"
 #include "platform/log/Log.h"
 #include "platform/paths/Directories.h"
 
@@ -318,9 +319,7 @@ ValueRef EkDPlugIn::valueForEntitlement(std::string_view key) const {
 
 bool EkDPlugIn::hasEntitlement(std::string_view key) const {
   ValueRef value = valueForEntitlement(key);
-  if (!value) return false;
-  const bool* flag = value->boolean();
-  return flag == nullptr || *flag;
+  return entitlementHeld(value.get());
 }
 
 std::string EkDPlugIn::annotationKey() const {

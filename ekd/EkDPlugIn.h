@@ -20,7 +20,7 @@
 namespace ek {
 
 class EkDPlugIn;
-class EkDWyreClient;
+class EkDClientProcess;
 namespace types {
 class TypeSystem;
 }
@@ -147,8 +147,8 @@ class EkDPlugIn : public EkPlugInCore {
   bool matchDictionary(const Value& value, const Dictionary& pattern) const;
 
   // Host permission: nothing when the host may use this plug-in, else the reason.
-  std::optional<std::string> allowForClient(const EkDWyreClient& client) const;
-  std::optional<std::string> allowForClient(const EkDWyreClient& client,
+  std::optional<std::string> allowForClient(const EkDClientProcess& client) const;
+  std::optional<std::string> allowForClient(const EkDClientProcess& client,
                                             const CurrentInfo& current) const;
 
   // Declares the plug-in's executable to the service manager as an external service of the
@@ -156,7 +156,7 @@ class EkDPlugIn : public EkPlugInCore {
   // QVFIXED_USER_HOME and TMPDIR, then the plug-in's own "EnvironmentVariables") and its
   // sandbox profile. Nothing on success, else code 4. Host entries that are not strings, or
   // that no process environment could carry, are dropped.
-  std::optional<EkError> enableForClient(const EkDWyreClient& client,
+  std::optional<EkError> enableForClient(const EkDClientProcess& client,
                                          const Dictionary* environment) const;
   // The consent services the user granted to the containing application, sorted; empty for
   // a plug-in outside any application.

@@ -128,7 +128,7 @@ std::string_view stringOr(const ValueRef& value, std::string_view fallback = {})
 
 }  // namespace
 
-std::optional<EkError> EkDPlugIn::enableForClient(const EkDWyreClient& client,
+std::optional<EkError> EkDPlugIn::enableForClient(const EkDClientProcess& client,
                                                   const Dictionary* environment) const {
   const std::string plugInIdentifier = identifier().value_or("(null)");
   const ValueRef plugInVersion = version();

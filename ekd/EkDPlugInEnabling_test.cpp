@@ -199,7 +199,7 @@ class EnablingTest : public ::testing::Test {
     auto record = plugIn(spec);
     if (!record) return "(no record)";
     const size_t before = serviceManager_->declarations().size();
-    EXPECT_EQ(record->enableForClient(*client_, nullptr), std::nullopt);
+    EXPECT_EQ(record->enableForClient(*client_->process(), nullptr), std::nullopt);
     auto declarations = serviceManager_->declarations();
     if (declarations.size() != before + 1) return "(not declared)";
     return profileOf(declarations.back().overlay);
@@ -347,13 +347,13 @@ TEST_F(EnablingTest, OverlayDeclaresTheExecutableForTheHost) {
                                       {"_OmitSandboxParameters", Value(false)}});
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
-  EXPECT_EQ(record->enableForClient(*client_, nullptr), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), nullptr), std::nullopt);
 
   auto declarations = serviceManager_->declarations();
   ASSERT_EQ(declarations.size(), 1u);
   const auto& declaration = declarations.front();
   EXPECT_EQ(declaration.hostPid, getpid());
-  EXPECT_EQ(declaration.hostPath, client_->path());
+  EXPECT_EQ(declaration.hostPath, client_->process()->path());
   EXPECT_FALSE(declaration.hostPath.empty());
   EXPECT_EQ(declaration.bundleIdentifier, spec.identifier);
   EXPECT_EQ(declaration.program, *record->path() + "/Thing");
@@ -383,7 +383,7 @@ TEST_F(EnablingTest, HostEnvironmentCannotReplaceTheContainerVariables) {
   const Dictionary host{{"HOME", Value("/home/host")},
                         {"TMPDIR", Value("/tmp/host")},
                         {"LANG", Value("de_DE.UTF-8")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   const std::string home = container("com.example.plugin").string();
   EXPECT_EQ(environmentOf(onlyOverlay()), (Dictionary{{"HOME", Value(home)},
                                                       {"QVFIXED_USER_HOME", Value(home)},
@@ -400,7 +400,7 @@ TEST_F(EnablingTest, PlugInVariablesWinOverContainerAndHost) {
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
   const Dictionary host{{"LANG", Value("de_DE.UTF-8")}, {"COUNT", Value("host")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   const Dictionary environment = environmentOf(onlyOverlay());
   EXPECT_EQ(environment.at("HOME"), Value("/plugin/home"));
   EXPECT_EQ(environment.at("QVFIXED_USER_HOME"), Value(container(spec.identifier).string()));
@@ -415,7 +415,7 @@ TEST_F(EnablingTest, PlugInEnvironmentThatIsNotADictionaryIsIgnored) {
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
   const Dictionary host{{"LANG", Value("C")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   const Dictionary environment = environmentOf(onlyOverlay());
   EXPECT_EQ(environment.at("HOME"), Value(container(spec.identifier).string()));
   EXPECT_EQ(environment.at("LANG"), Value("C"));
@@ -434,7 +434,7 @@ TEST_F(EnablingTest, HostValuesThatAreNotCarriableStringsAreDropped) {
                         {"NUL", Value(std::string("a\0z", 3))},
                         {"BADUTF8", Value(std::string("\xff\xfe"))},
                         {"KEPT", Value("<&>\"' \t\nline")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   Dictionary environment = environmentOf(onlyOverlay());
   environment.erase("HOME");
   environment.erase("QVFIXED_USER_HOME");
@@ -447,7 +447,7 @@ TEST_F(EnablingTest, DaemonTestSdkIsPassedOn) {
   auto record = plugIn({});
   ASSERT_TRUE(record);
   const Dictionary host{{"EKTEST_SDK", Value("/host/sdk")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   EXPECT_EQ(environmentOf(onlyOverlay()).at("EKTEST_SDK"), Value("/sdk/path"));
 }
 
@@ -458,7 +458,7 @@ TEST_F(EnablingTest, PlugInWithoutDataContainerGetsNoHome) {
   ASSERT_TRUE(record);
   ASSERT_FALSE(record->dataContainerURL());
   const Dictionary host{{"HOME", Value("/home/host")}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   EXPECT_EQ(environmentOf(onlyOverlay()), (Dictionary{{"HOME", Value("/home/host")}}));
   EXPECT_TRUE(sink_->has(log::Level::Debug, "ops",
                          "no data container for plug-in com.example.plugin(3.1) " +
@@ -470,7 +470,7 @@ TEST_F(EnablingTest, MissingWyreServiceStartsFromAnEmptyService) {
   spec.wyreService = Value("not a dictionary");
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
-  EXPECT_EQ(record->enableForClient(*client_, nullptr), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), nullptr), std::nullopt);
   const Dictionary overlay = onlyOverlay();
   const Dictionary& service = serviceOf(overlay);
   EXPECT_EQ(service.size(), 3u);
@@ -484,7 +484,7 @@ TEST_F(EnablingTest, ServiceManagerRefusalIsCode4AndLogged) {
   serviceManager_->addResult = EACCES;
   auto record = plugIn({});
   ASSERT_TRUE(record);
-  std::optional<EkError> error = record->enableForClient(*client_, nullptr);
+  std::optional<EkError> error = record->enableForClient(*client_->process(), nullptr);
   ASSERT_TRUE(error);
   EXPECT_EQ(error->domain, "Ekora");
   EXPECT_EQ(error->code, 4);
@@ -492,7 +492,8 @@ TEST_F(EnablingTest, ServiceManagerRefusalIsCode4AndLogged) {
             "unable to enable plug-in com.example.plugin(" + record->uuid().string() + ")");
   EXPECT_TRUE(sink_->has(log::Level::Error, "ops",
                          "stard error 13 trying to allow " + std::to_string(getpid()) + " " +
-                             client_->path() + " to use plug-in com.example.plugin(3.1) uuid=" +
+                             client_->process()->path() +
+                             " to use plug-in com.example.plugin(3.1) uuid=" +
                              record->uuid().string() + " at " + *record->path()));
   EXPECT_EQ(serviceManager_->declarations().size(), 1u);  // asked once, not retried
 }
@@ -502,7 +503,7 @@ TEST_F(EnablingTest, PlugInWithoutExecutableIsDeclaredWithItsBundlePath) {
   spec.executable = false;
   auto record = plugIn(spec);
   ASSERT_TRUE(record);
-  EXPECT_EQ(record->enableForClient(*client_, nullptr), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), nullptr), std::nullopt);
   auto declarations = serviceManager_->declarations();
   ASSERT_EQ(declarations.size(), 1u);
   EXPECT_EQ(declarations.front().program, *record->path());
@@ -528,7 +529,7 @@ TEST_F(EnablingTest, DeclarationFileStaysReadableWithOddEnvironmentValues) {
                         {"CONTROL", Value(std::string("\x1b[0m"))},
                         {"BADUTF8", Value(std::string("\xc3"))},
                         {"NUMBER", Value(-4)}};
-  EXPECT_EQ(record->enableForClient(*client_, &host), std::nullopt);
+  EXPECT_EQ(record->enableForClient(*client_->process(), &host), std::nullopt);
   std::optional<Dictionary> declaration = files->declaration(getpid(), spec.identifier);
   ASSERT_TRUE(declaration);
   auto overlay = declaration->find("overlay");

@@ -304,11 +304,11 @@ bool EkDPlugIn::matchDictionary(const Value& value, const Dictionary& pattern) c
 
 // ---- Host permission -------------------------------------------------------------------------
 
-std::optional<std::string> EkDPlugIn::allowForClient(const EkDWyreClient& client) const {
+std::optional<std::string> EkDPlugIn::allowForClient(const EkDClientProcess& client) const {
   return allowForClient(client, *currentInfo());
 }
 
-std::optional<std::string> EkDPlugIn::allowForClient(const EkDWyreClient& client,
+std::optional<std::string> EkDPlugIn::allowForClient(const EkDClientProcess& client,
                                                      const CurrentInfo& current) const {
   if (std::optional<Value> restriction =
           client.entitlementValueForKey(protocol::kEntitlementAllowedPlugIns)) {

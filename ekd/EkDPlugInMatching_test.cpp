@@ -652,7 +652,7 @@ TEST_F(PermissionTest, AllowForClientReasons) {
     ASSERT_NE(plugIn, nullptr) << c.name;
     auto client = host(c.hostEntitlements);
     ASSERT_NE(client, nullptr) << c.name;
-    EXPECT_EQ(plugIn->allowForClient(*client), c.refusal) << c.name;
+    EXPECT_EQ(plugIn->allowForClient(*client->process()), c.refusal) << c.name;
   }
 }
 

@@ -123,7 +123,10 @@ void EkDServer::handleListenerEvent(const wyre::ListenerEvent& event) {
       event.error->code == wyre::kConnectionInvalid) {
     log::ops().defaultLevel("potentially unexpected error from wyre: %{public}@", *event.error);
   } else if (event.error) {
-    log::ops().error("unexpected error from wyre: %{public}@", *event.error);
+    // Accept failures repeat while they last (out of descriptors): one line a second.
+    static log::Throttle throttle;
+    log::ops().throttled(throttle, log::Level::Error, "unexpected error from wyre: %{public}@",
+                         *event.error);
   } else {
     log::ops().error("unexpected message: %{public}@", "(empty listener event)");
   }

@@ -96,15 +96,17 @@ class EkDWyreClientTest : public ::testing::Test {
   int peer_ = -1;
 };
 
+// One rule for hosts and plug-ins: present and not boolean false (a number 0 holds it).
 TEST_F(EkDWyreClientTest, EntitlementIsHeldUnlessAbsentOrFalse) {
-  EXPECT_FALSE(client_->hasEntitlement("false"));
-  EXPECT_FALSE(client_->hasEntitlement("zero"));
-  EXPECT_FALSE(client_->hasEntitlement("missing"));
-  EXPECT_TRUE(client_->hasEntitlement("true"));
-  EXPECT_TRUE(client_->hasEntitlement("two"));
-  EXPECT_TRUE(client_->hasEntitlement("string"));
-  EXPECT_TRUE(client_->hasEntitlement("array"));
-  EXPECT_EQ(client_->entitlementValueForKey("string"), Value("x"));
+  const auto& process = *client_->process();
+  EXPECT_FALSE(process.hasEntitlement("false"));
+  EXPECT_TRUE(process.hasEntitlement("zero"));
+  EXPECT_FALSE(process.hasEntitlement("missing"));
+  EXPECT_TRUE(process.hasEntitlement("true"));
+  EXPECT_TRUE(process.hasEntitlement("two"));
+  EXPECT_TRUE(process.hasEntitlement("string"));
+  EXPECT_TRUE(process.hasEntitlement("array"));
+  EXPECT_EQ(process.entitlementValueForKey("string"), Value("x"));
 }
 
 TEST_F(EkDWyreClientTest, EntitlementErrorsReadAsAbsent) {
@@ -115,15 +117,15 @@ TEST_F(EkDWyreClientTest, EntitlementErrorsReadAsAbsent) {
   socket.assign(asio::local::stream_protocol(), fds[0]);
   auto failing = EkDWyreClient::initWithConnection(
       wyre::Connection::adopt(std::move(socket), *AuditToken::forSocket(fds[0])), server_);
-  EXPECT_FALSE(failing->entitlementValueForKey("true"));
-  EXPECT_FALSE(failing->hasEntitlement("true"));
+  EXPECT_FALSE(failing->process()->entitlementValueForKey("true"));
+  EXPECT_FALSE(failing->process()->hasEntitlement("true"));
   close(fds[1]);
 }
 
 TEST_F(EkDWyreClientTest, KnowsItsPeerAndSandbox) {
   EXPECT_EQ(client_->pid(), getpid());
-  EXPECT_TRUE(client_->isSandboxed());
-  EXPECT_EQ(client_->path(), std::filesystem::read_symlink("/proc/self/exe").string());
+  EXPECT_TRUE(client_->process()->isSandboxed());
+  EXPECT_EQ(client_->process()->path(), std::filesystem::read_symlink("/proc/self/exe").string());
   EXPECT_NE(client_->description().find("pid=" + std::to_string(getpid())), std::string::npos);
 }
 

@@ -36,9 +36,12 @@ const std::unordered_map<std::string_view, Handler>& requestTable() {
 
 }  // namespace
 
-std::shared_ptr<Transaction> Transaction::initWithRequest(wyre::Message request,
-                                                          std::shared_ptr<EkDWyreClient> client) {
-  return std::shared_ptr<Transaction>(new Transaction(std::move(request), std::move(client)));
+std::shared_ptr<Transaction> Transaction::initWithRequest(
+    wyre::Message request, std::shared_ptr<EkDWyreClient> client,
+    std::shared_ptr<const EkDClientProcess> sender) {
+  if (!sender) sender = client->process();
+  return std::shared_ptr<Transaction>(
+      new Transaction(std::move(request), std::move(client), std::move(sender)));
 }
 
 EkDServer& Transaction::server() const {

@@ -17,14 +17,17 @@ namespace ek {
 
 class EkDPlugIn;
 class EkDServer;
+class EkDClientProcess;
 class EkDWyreClient;
 
 // One request from arrival to reply. Made on the connection's queue, then used only on the
 // work queue (or, for a hold with forced termination, on its termination waiter).
 class Transaction : public std::enable_shared_from_this<Transaction> {
  public:
-  static std::shared_ptr<Transaction> initWithRequest(wyre::Message request,
-                                                      std::shared_ptr<EkDWyreClient> client);
+  // sender is the process that wrote the request; nullptr means the one that connected.
+  static std::shared_ptr<Transaction> initWithRequest(
+      wyre::Message request, std::shared_ptr<EkDWyreClient> client,
+      std::shared_ptr<const EkDClientProcess> sender = nullptr);
 
   // Checks version and type and runs the request's handler, which replies exactly once.
   void dispatch();
@@ -67,6 +70,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   const Dictionary* dictionaryForKey(std::string_view key) const;
 
   const std::shared_ptr<EkDWyreClient>& client() const { return client_; }
+  // The process that wrote this request: every question about the caller's program,
+  // entitlements or sandbox is asked of it, never of the connection.
+  const EkDClientProcess& sender() const { return *sender_; }
   const Value& request() const { return request_.body; }
   Dictionary& reply() { return reply_; }
   uint64_t version() const { return version_.load(); }
@@ -88,10 +94,12 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   std::shared_ptr<EkDPlugIn> findPlugInByPathURL(const std::string& url);
 
  private:
-  Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client)
-      : client_(std::move(client)), request_(std::move(request)) {}
+  Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client,
+              std::shared_ptr<const EkDClientProcess> sender)
+      : client_(std::move(client)), sender_(std::move(sender)), request_(std::move(request)) {}
 
   std::shared_ptr<EkDWyreClient> client_;
+  std::shared_ptr<const EkDClientProcess> sender_;
   wyre::Message request_;
   Dictionary reply_;
   std::atomic<uint64_t> version_{0};

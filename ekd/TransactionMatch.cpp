@@ -56,11 +56,10 @@ bool candidateWins(const EkDPlugIn& plugIn, const EkDPlugIn& earlier) {
 
 // A plug-in inside the requesting host's own application wins over other copies of its
 // identifier.
-void preferBundleRelative(Candidates& candidates, const EkDWyreClient& client) {
-  if (!client.connection()) return;
-  auto executable = executablePathForPid(client.pid());
-  if (!executable) {
-    log::ops().error("Failed to determine path for pid %d, %{errno}d", client.pid(), errno);
+void preferBundleRelative(Candidates& candidates, const EkDClientProcess& client) {
+  const std::string* executable = &client.path();
+  if (executable->empty()) {
+    log::ops().error("Failed to determine path for pid %d, %{errno}d", client.pid(), ESRCH);
     return;
   }
   std::unordered_map<std::string, std::shared_ptr<EkDPlugIn>> preferred;
@@ -113,7 +112,7 @@ void Transaction::matchPlugIns() {
   const uint64_t* flagsValue = request_.body.getUnsigned(protocol::kFlags);
   const uint64_t flags = flagsValue ? *flagsValue : 0;
   const bool all = flags & protocol::kDiscoverAll;
-  if (all && (!client_->hasEntitlement(protocol::kEntitlementManager) || client_->isSandboxed())) {
+  if (all && (!sender().hasEntitlement(protocol::kEntitlementManager) || sender().isSandboxed())) {
     fail(protocol::kErrorNotPermitted, "unauthorized discovery flag (EkDiscoverAll)");
     return;
   }
@@ -130,7 +129,7 @@ void Transaction::matchPlugIns() {
                       CandidateList{candidates});
     }
   }
-  preferBundleRelative(candidates, *client_);
+  preferBundleRelative(candidates, sender());
 
   // The exclusions are walked as a list of rules; anything else in it excludes nothing.
   std::vector<const Dictionary*> exclusions;
@@ -142,7 +141,7 @@ void Transaction::matchPlugIns() {
     }
   }
   std::optional<std::string> pluginsPath;
-  if (const auto& bundle = client_->bundle()) pluginsPath = bundle->plugInsPath();
+  if (const auto& bundle = sender().bundle()) pluginsPath = bundle->plugInsPath();
 
   // Matches are shared with the override table: a replacing plug-in removed from the results
   // by a newer copy still marks the plug-ins it replaces. A removed match leaves an empty slot,
@@ -178,7 +177,7 @@ void Transaction::matchPlugIns() {
     }
     if (excluded) continue;
     if (!all) {
-      if (auto reason = plugIn->allowForClient(*client_, *current)) {
+      if (auto reason = plugIn->allowForClient(sender(), *current)) {
         log::ops().info("client %d cannot use plugin %{public}@: %{public}@", client_->pid(),
                         plugIn->uuid(), *reason);
         continue;

@@ -17,7 +17,7 @@ void Transaction::readyPlugIns() {
   std::optional<Dictionary> environment;
   if (const Dictionary* given = dictionaryForKey(protocol::kEnvironment)) environment = *given;
   if (environment) {
-    if (!client_->hasEntitlement(protocol::kEntitlementProvideEnvironment)) {
+    if (!sender().hasEntitlement(protocol::kEntitlementProvideEnvironment)) {
       fail(protocol::kErrorNotPermitted,
            log::format("Transmission of environment variables requires the %@ host entitlement",
                        protocol::kEntitlementProvideEnvironment));
@@ -42,7 +42,7 @@ void Transaction::readyPlugIns() {
       return false;
     }
     if (plugIn->isData()) return true;
-    if (auto reason = plugIn->allowForClient(*client_)) {
+    if (auto reason = plugIn->allowForClient(sender())) {
       log::ops().defaultLevel("denied access to %d for plugin %@(%{public}@): %{public}@",
                               client_->pid(), identifier, uuid, *reason);
       fail(protocol::kErrorNotPermitted,
@@ -56,11 +56,11 @@ void Transaction::readyPlugIns() {
 
   std::optional<EkError> firstError;
   for (const auto& plugIn : accepted) {
-    auto error = plugIn->enableForClient(*client_, environment ? &*environment : nullptr);
+    auto error = plugIn->enableForClient(sender(), environment ? &*environment : nullptr);
     if (error && !firstError) firstError = std::move(error);
   }
   if (!accepted.empty()) {
-    if (auto connection = client_->connection()) server().watchHostExit(connection->auditToken());
+    server().watchHostExit(sender().token());
   }
   if (firstError) {
     fail(protocol::kErrorInvalidRequest, *firstError);

@@ -39,7 +39,7 @@ void Transaction::addPlugIns() {
 void Transaction::removePlugIns() {
   processPaths([this](const std::string& path, bool resolved) {
     EK_PROBE2(plugin_remove, path.c_str(), resolved);
-    if (!client_->hasEntitlement(protocol::kEntitlementManager)) {
+    if (!sender().hasEntitlement(protocol::kEntitlementManager)) {
       log::process().defaultLevel(
           "refused request from pid=%d to remove plug-in at %@ - client lacks required "
           "entitlement",

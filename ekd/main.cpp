@@ -1,9 +1,11 @@
 // ekd: the plug-in daemon.
 #include <malloc.h>
+#include <sys/resource.h>
 #include <unistd.h>
 #include <asio/io_context.hpp>
 #include <asio/signal_set.hpp>
 
+#include <cerrno>
 #include <chrono>
 #include <csignal>
 #include <cstdio>
@@ -48,6 +50,15 @@ void flushLogOnCrash() {
     action.sa_flags = SA_SIGINFO | SA_NODEFER;
     sigemptyset(&action.sa_mask);
     sigaction(kFatalSignals[i], &action, &gPreviousActions[i]);
+  }
+}
+
+void raiseDescriptorLimit() {
+  struct rlimit files {};
+  if (getrlimit(RLIMIT_NOFILE, &files) != 0 || files.rlim_cur == files.rlim_max) return;
+  files.rlim_cur = files.rlim_max;
+  if (setrlimit(RLIMIT_NOFILE, &files) != 0) {
+    ek::log::ops().error("cannot raise the descriptor limit: %{errno}d", errno);
   }
 }
 
@@ -99,6 +110,10 @@ int main(int argc, char* argv[]) {
     }
   }
   if (optind < argc) usage();
+
+  // Every connection takes descriptors: use all the administrator allows, as the listener
+  // sizes its connection limit by it.
+  raiseDescriptorLimit();
 
   // Writes to a client that has gone must fail with EPIPE, not end the daemon.
   std::signal(SIGPIPE, SIG_IGN);

@@ -14,6 +14,15 @@
 
 namespace ek {
 
+// Whether an entitlement with this value is held: it is present and not boolean false. Any
+// other value holds it, a number 0 or an empty string included. The one rule for hosts and
+// plug-ins alike.
+inline bool entitlementHeld(const Value* value) {
+  if (value == nullptr) return false;
+  const bool* flag = value->boolean();
+  return flag == nullptr || *flag;
+}
+
 // The code-signing record of one process: its entitlements, read when the record is made.
 class CodeSigningTask {
  public:

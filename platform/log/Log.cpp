@@ -720,8 +720,24 @@ Category::~Category() {
   Registry::shared().remove(this);
 }
 
-void Category::write(Level level, std::string_view format, std::span<const Arg> args) const {
+bool Throttle::admit(uint64_t* suppressed, Clock::time_point now) {
+  int64_t at = now.time_since_epoch().count();
+  int64_t allowed = nextAllowed_.load(std::memory_order_relaxed);
+  while (at >= allowed) {
+    if (nextAllowed_.compare_exchange_weak(allowed, at + interval_.count(),
+                                           std::memory_order_relaxed)) {
+      *suppressed = suppressed_.exchange(0, std::memory_order_relaxed);
+      return true;
+    }
+  }
+  suppressed_.fetch_add(1, std::memory_order_relaxed);
+  return false;
+}
+
+void Category::write(Level level, std::string_view format, std::span<const Arg> args,
+                     uint64_t suppressed) const {
   std::string message = formatMessage(format, args);
+  if (suppressed > 0) message += fmt::format(" ({} similar messages suppressed)", suppressed);
   Record record{level, subsystem_, name_, message};
   if (auto sink = Registry::shared().sink()) sink->write(record);
 }

@@ -3,6 +3,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
+#include <limits>
 #include <memory>
 #include <span>
 #include <string>
@@ -118,6 +119,24 @@ void flushFromSignal();
 // ("debug", "info", "ops:debug,vr:info"). The environment is read on first use.
 void configure(std::string_view levels);
 
+// Keeps repeated lines of one kind to one a second: the first line of each second is written,
+// the others are counted, and the next line written says how many were left out. One
+// throttle per kind of line (a static beside the call). Thread-safe.
+class Throttle {
+ public:
+  using Clock = std::chrono::steady_clock;
+  explicit Throttle(Clock::duration interval = std::chrono::seconds(1)) : interval_(interval) {}
+
+  // Whether a line may be written at now; when it may, *suppressed is the number of lines held
+  // back since the last one written.
+  bool admit(uint64_t* suppressed, Clock::time_point now = Clock::now());
+
+ private:
+  const Clock::duration interval_;
+  std::atomic<int64_t> nextAllowed_{std::numeric_limits<int64_t>::min()};
+  std::atomic<uint64_t> suppressed_{0};
+};
+
 // A log category of a subsystem. Thread-safe.
 class Category {
  public:
@@ -138,6 +157,21 @@ class Category {
     } else {
       const Arg list[] = {Arg(args)...};
       write(level, format, std::span<const Arg>(list, sizeof...(Args)));
+    }
+  }
+  // log, at most one line a second through throttle; a line written after others were held
+  // back ends with " (N similar messages suppressed)".
+  template <typename... Args>
+  void throttled(Throttle& throttle, Level level, std::string_view format,
+                 const Args&... args) const {
+    if (!enabled(level)) return;
+    uint64_t suppressed = 0;
+    if (!throttle.admit(&suppressed)) return;
+    if constexpr (sizeof...(Args) == 0) {
+      write(level, format, {}, suppressed);
+    } else {
+      const Arg list[] = {Arg(args)...};
+      write(level, format, std::span<const Arg>(list, sizeof...(Args)), suppressed);
     }
   }
   template <typename... Args>
@@ -161,7 +195,8 @@ class Category {
   const std::string& name() const { return name_; }
 
  private:
-  void write(Level level, std::string_view format, std::span<const Arg> args) const;
+  void write(Level level, std::string_view format, std::span<const Arg> args,
+             uint64_t suppressed = 0) const;
 
   friend class Registry;
 

@@ -240,6 +240,30 @@ TEST_F(LogTest, SinkReceivesLevelSubsystemCategoryAndMessage) {
   EXPECT_EQ(records[4].message, "refused request from pid=12");
 }
 
+// One line a second of a kind; the next line written counts those held back.
+TEST(Throttle, AdmitsOneLineASecondAndCountsTheRest) {
+  using std::chrono::milliseconds;
+  struct Step {
+    int atMs;
+    bool admitted;
+    uint64_t suppressed;  // when admitted
+  };
+  const std::vector<Step> steps{
+      {0, true, 0},     {10, false, 0},  {999, false, 0},  {1000, true, 2},
+      {1500, false, 0}, {5000, true, 1}, {5001, false, 0}, {6001, true, 1},
+  };
+  Throttle throttle;
+  const Throttle::Clock::time_point start{std::chrono::hours(1)};
+  for (const Step& step : steps) {
+    uint64_t suppressed = 99;
+    EXPECT_EQ(throttle.admit(&suppressed, start + milliseconds(step.atMs)), step.admitted)
+        << step.atMs;
+    if (step.admitted) {
+      EXPECT_EQ(suppressed, step.suppressed) << step.atMs;
+    }
+  }
+}
+
 TEST_F(LogTest, CategoriesAreMadeOnce) {
   EXPECT_EQ(&ops(), &ops());
   EXPECT_EQ(&process(), &process());

@@ -5,9 +5,11 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <string>
 #include <string_view>
 
@@ -57,6 +59,15 @@ AuditToken AuditToken::self() {
   return token;
 }
 
+AuditToken AuditToken::forWriter(const Credentials& writer) {
+  AuditToken token;
+  token.pid = writer.pid;
+  token.uid = writer.uid;
+  token.gid = writer.gid;
+  if (writer.pid > 0) token.pidfd = openPidfd(writer.pid);
+  return token;
+}
+
 bool AuditToken::alive() const {
   if (pidfd && pidfd->valid()) {
     struct pollfd p {
@@ -90,6 +101,15 @@ std::optional<std::string> executablePathForPid(pid_t pid) {
     path.resize(path.size() - kDeleted.size());
   }
   return path;
+}
+
+std::optional<FileId> executableIdForPid(pid_t pid) {
+  if (pid <= 0) return std::nullopt;
+  char link[32];
+  std::snprintf(link, sizeof link, "/proc/%d/exe", static_cast<int>(pid));
+  struct stat st {};
+  if (::stat(link, &st) != 0) return std::nullopt;
+  return FileId{st.st_dev, st.st_ino};
 }
 
 }  // namespace ek

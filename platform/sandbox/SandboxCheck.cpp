@@ -35,14 +35,14 @@ std::optional<std::string> readStatus(pid_t pid) {
 }
 
 // The number of seccomp filters of a process; absent when its status cannot be read (it has
-// exited) or says nothing about filters (a kernel without seccomp).
+// exited, or /proc hides it). A status without the field is a kernel without seccomp: none.
 std::optional<unsigned long> seccompFilters(pid_t pid) {
   if (pid <= 0) return std::nullopt;
   auto status = readStatus(pid);
   if (!status) return std::nullopt;
   constexpr std::string_view kField = "\nSeccomp_filters:";
   size_t at = status->find(kField);
-  if (at == std::string::npos) return std::nullopt;
+  if (at == std::string::npos) return 0;
   std::string_view rest = std::string_view(*status).substr(at + kField.size());
   while (!rest.empty() && (rest.front() == ' ' || rest.front() == '\t')) rest.remove_prefix(1);
   unsigned long count = 0;
@@ -57,12 +57,11 @@ class SystemSandboxCheck : public SandboxCheck {
   // namespace without a visible init, a hardened /proc) counts as none.
   SystemSandboxCheck() : baseline_(seccompFilters(1).value_or(0)) {}
 
+  // Fails closed: a process we cannot read, or that is gone (its pid may name another process
+  // by now), counts as sandboxed, so it never gets what only unsandboxed clients get.
   bool isSandboxed(const AuditToken& token) override {
     auto filters = seccompFilters(token.pid);
-    if (!filters) return false;
-    // The answer is about the token's process only if it still runs now that we have read it:
-    // otherwise the pid may already name another process.
-    if (!token.alive()) return false;
+    if (!filters || !token.alive()) return true;
     return *filters > baseline_;
   }
 

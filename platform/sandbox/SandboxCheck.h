@@ -9,7 +9,8 @@
 namespace ek {
 
 // Whether a process runs in a sandbox: its Seccomp_filters count in /proc/<pid>/status
-// exceeds that of process 1, so it has confined itself beyond what the system imposes.
+// exceeds that of process 1, so it has confined itself beyond what the system imposes. A
+// process whose status cannot be read, or that has exited, counts as sandboxed.
 class SandboxCheck {
  public:
   virtual ~SandboxCheck() = default;

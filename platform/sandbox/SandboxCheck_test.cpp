@@ -99,13 +99,14 @@ TEST(SandboxCheck, OurOwnProcessIsNot) {
   EXPECT_FALSE(SandboxCheck::system()->isSandboxed(AuditToken::self()));
 }
 
-TEST(SandboxCheck, ExitedProcessIsNot) {
-  pid_t child = startSleep(true);
+// Fails closed: what cannot be read about a process, or a process that is gone, is sandboxed.
+TEST(SandboxCheck, ExitedOrUnknownProcessIs) {
+  pid_t child = startSleep(false);
   ASSERT_GT(child, 0);
   stop(child);
-  EXPECT_FALSE(SandboxCheck::system()->isSandboxed(tokenFor(child)));
-  EXPECT_FALSE(SandboxCheck::system()->isSandboxed(tokenFor(0)));
-  EXPECT_FALSE(SandboxCheck::system()->isSandboxed(tokenFor(-5)));
+  EXPECT_TRUE(SandboxCheck::system()->isSandboxed(tokenFor(child)));
+  EXPECT_TRUE(SandboxCheck::system()->isSandboxed(tokenFor(0)));
+  EXPECT_TRUE(SandboxCheck::system()->isSandboxed(tokenFor(-5)));
 }
 
 TEST(SandboxExec, FilterIsInheritedByWhatTheProgramRuns) {

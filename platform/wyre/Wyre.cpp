@@ -1,6 +1,7 @@
 #include "platform/wyre/Wyre.h"
 
 #include <fmt/format.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -17,6 +18,7 @@
 #include <cstring>
 #include <future>
 #include <mutex>
+#include <set>
 #include <stdexcept>
 #include <thread>
 
@@ -35,6 +37,10 @@ constexpr size_t kReadChunk = 64 * 1024;
 constexpr size_t kMinReadSpace = 16 * 1024;
 // Frames gathered into one write call.
 constexpr size_t kMaxGather = 64;
+// Descriptors the process keeps for itself (database, bundles, log) below its limit, and what
+// one connection takes: its socket, its peer's pidfd, and room for another writer's.
+constexpr rlim_t kReservedDescriptors = 64;
+constexpr size_t kDescriptorsPerConnection = 3;
 
 void putU32(uint8_t* p, uint32_t v) {
   p[0] = v >> 24;
@@ -150,14 +156,59 @@ bool isValidServiceName(std::string_view name) {
 // ---------------------------------------------------------------------------------------------
 // Connection
 
+namespace {
+
+std::atomic<size_t> gHeldInput{0};
+std::atomic<size_t> gQueuedOutput{0};
+
+void subtract(std::atomic<size_t>& counter, size_t n) {
+  if (n > 0) counter.fetch_sub(n, std::memory_order_relaxed);
+}
+
+// The reading thread's buffer: every read lands here first, so that an idle connection holds
+// no buffer of its own.
+uint8_t* scratch() {
+  thread_local std::unique_ptr<uint8_t[]> buffer(new uint8_t[kReadChunk]);
+  return buffer.get();
+}
+
+// Lines about a misbehaving peer come as fast as it can misbehave: one a second is enough.
+log::Throttle gClosingThrottle;
+log::Throttle gPauseThrottle;
+
+bool uidServed(uid_t uid) {
+  static const uid_t own = geteuid();
+  return uid == own || uid == 0;
+}
+
+}  // namespace
+
+size_t heldInputBytesTotal() {
+  return gHeldInput.load(std::memory_order_relaxed);
+}
+
+size_t queuedOutputBytesTotal() {
+  return gQueuedOutput.load(std::memory_order_relaxed);
+}
+
+void WaitingTicket::release() {
+  if (released_.exchange(true)) return;
+  subtract(gHeldInput, bytes_);
+  if (auto connection = connection_.lock()) connection->releaseWaiting(bytes_);
+}
+
 Connection::Connection(stream_protocol::socket socket, AuditToken token,
-                       std::shared_ptr<SerialQueue> deliveryQueue)
+                       std::shared_ptr<SerialQueue> deliveryQueue, bool stampsWriters)
     : socket_(std::move(socket)),
       strand_(asio::make_strand(socket_.get_executor())),
       token_(std::move(token)),
-      deliveryQueue_(std::move(deliveryQueue)) {}
+      deliveryQueue_(std::move(deliveryQueue)),
+      stampsWriters_(stampsWriters) {}
 
-Connection::~Connection() = default;
+Connection::~Connection() {
+  subtract(gHeldInput, held_.size() - heldStart_);
+  subtract(gQueuedOutput, queuedBytes_);
+}
 
 Result<std::shared_ptr<Connection>> Connection::connect(std::string_view serviceName,
                                                         std::shared_ptr<SerialQueue> deliveryQueue,
@@ -173,11 +224,17 @@ Result<std::shared_ptr<Connection>> Connection::connect(std::string_view service
   auto token = AuditToken::forSocket(socket.native_handle());
   if (!token) return EkError::fromErrno(errno, "reading the peer's credentials");
   return std::shared_ptr<Connection>(
-      new Connection(std::move(socket), std::move(*token), std::move(deliveryQueue)));
+      new Connection(std::move(socket), std::move(*token), std::move(deliveryQueue), false));
 }
 
-std::shared_ptr<Connection> Connection::adopt(stream_protocol::socket socket, AuditToken token) {
-  return std::shared_ptr<Connection>(new Connection(std::move(socket), std::move(token), nullptr));
+std::shared_ptr<Connection> Connection::adopt(stream_protocol::socket socket, AuditToken token,
+                                              std::shared_ptr<void> slot) {
+  int on = 1;
+  ::setsockopt(socket.native_handle(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on);
+  auto connection = std::shared_ptr<Connection>(
+      new Connection(std::move(socket), std::move(token), nullptr, true));
+  connection->slot_ = std::move(slot);
+  return connection;
 }
 
 void Connection::setEventHandler(EventHandler handler) {
@@ -199,74 +256,259 @@ void Connection::cancel() {
   asio::dispatch(strand_, [self = shared_from_this()] { self->fail(); });
 }
 
-void Connection::readMore() {
-  if (reading_ || closed_ || unanswered_.load() >= kMaxUnansweredRequests) return;
-  if (inputStart_ == inputEnd_) {
-    inputStart_ = inputEnd_ = 0;
-  }
-  if (input_.size() - inputEnd_ < kMinReadSpace) {
-    if (inputStart_ > 0) {
-      std::memmove(input_.data(), input_.data() + inputStart_, inputEnd_ - inputStart_);
-      inputEnd_ -= inputStart_;
-      inputStart_ = 0;
-    }
-    if (input_.size() - inputEnd_ < kMinReadSpace) {
-      input_.resize(std::max(input_.size() * 2, kReadChunk));
-    }
-  }
-  reading_ = true;
-  socket_.async_read_some(asio::buffer(input_.data() + inputEnd_, input_.size() - inputEnd_),
-                          asio::bind_executor(strand_, [self = shared_from_this()](
-                                                           const asio::error_code& ec, size_t n) {
-                            self->reading_ = false;
-                            if (ec || self->closed_) {
-                              self->fail();
-                              return;
-                            }
-                            self->inputEnd_ += n;
-                            self->parseInput();
-                            self->readMore();
-                          }));
+bool Connection::waitingFull() const {
+  size_t bytes = waitingBytes_.load();
+  return waiting_.load() >= kMaxWaitingMessages || (bytes > 0 && bytes >= kMaxWaitingBytes);
 }
 
-void Connection::parseInput() {
-  while (!closed_ && unanswered_.load() < kMaxUnansweredRequests) {
-    size_t available = inputEnd_ - inputStart_;
-    if (available < kHeaderSize) return;
-    FrameHeader header = decodeHeader(input_.data() + inputStart_);
-    if (header.length > kMaxBodySize) {
-      log::process().error("closing connection from pid=%d: frame of %u bytes", pid(),
-                           header.length);
+void Connection::close(std::string_view reason) {
+  log::process().throttled(gClosingThrottle, log::Level::Error,
+                           "closing connection from pid=%d: %s", pid(), reason);
+  fail();
+}
+
+void Connection::readMore() {
+  if (reading_ || closed_) return;
+  if (waitingFull()) {
+    // Resumed when a waiting message is released. Checked again after setting the flag: the
+    // last release may have come in between.
+    resumeOnRelease_ = true;
+    if (waitingFull()) return;
+    resumeOnRelease_ = false;
+  }
+  if (heldStart_ < held_.size() && held_.size() - heldStart_ >= kHeaderSize) {
+    // Frames read past a pause come first.
+    FrameHeader header = decodeHeader(held_.data() + heldStart_);
+    if (held_.size() - heldStart_ >= kHeaderSize + header.length) {
+      parseHeldInput();
+      if (closed_) return;
+      if (waitingFull()) {
+        readMore();
+        return;
+      }
+    }
+  }
+  if (gHeldInput.load(std::memory_order_relaxed) >= kMaxHeldInputTotal) {
+    log::process().throttled(gPauseThrottle, log::Level::Error,
+                             "pausing input: %zu bytes held for all connections",
+                             gHeldInput.load());
+    if (!retry_) retry_ = std::make_unique<asio::steady_timer>(strand_);
+    reading_ = true;
+    retry_->expires_after(std::chrono::milliseconds(20));
+    retry_->async_wait([self = shared_from_this()](const asio::error_code&) {
+      self->reading_ = false;
+      self->readMore();
+    });
+    return;
+  }
+  reading_ = true;
+  socket_.async_wait(
+      stream_protocol::socket::wait_read,
+      asio::bind_executor(strand_, [self = shared_from_this()](const asio::error_code& ec) {
+        self->reading_ = false;
+        if (ec || self->closed_) {
+          self->fail();
+          return;
+        }
+        self->receive();
+      }));
+}
+
+void Connection::receive() {
+  uint8_t* buffer = scratch();
+  // A few reads per wake-up, then the others' turn.
+  for (int reads = 0; reads < 16; ++reads) {
+    if (closed_ || waitingFull()) break;
+    iovec vector{buffer, kReadChunk};
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(ucred))];
+    msghdr message{};
+    message.msg_iov = &vector;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    ssize_t n = ::recvmsg(socket_.native_handle(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      if (errno == EAGAIN || errno == EWOULDBLOCK) break;
       fail();
       return;
     }
-    if (available < kHeaderSize + header.length) return;
-    auto body = cbor::decode(std::span(input_.data() + inputStart_ + kHeaderSize, header.length));
-    inputStart_ += kHeaderSize + header.length;
-    if (!body) {
-      log::process().error("closing connection from pid=%d: %s", pid(), body.error().message);
+    if (n == 0) {
       fail();
       return;
     }
-    if (header.flags & kFlagReply) {
-      ReplyHandler handler;
-      {
-        std::lock_guard lock(pendingMutex_);
-        auto it = pending_.find(header.id);
-        if (it != pending_.end()) {
-          handler = std::move(it->second);
-          pending_.erase(it);
+    if (message.msg_flags & MSG_CTRUNC) {
+      // Descriptors passed to us: the kernel has closed them, and we want none.
+      close("it passes descriptors");
+      return;
+    }
+    Credentials writer{token_.pid, token_.uid, token_.gid};
+    if (stampsWriters_) {
+      writer = {};
+      for (cmsghdr* c = CMSG_FIRSTHDR(&message); c != nullptr; c = CMSG_NXTHDR(&message, c)) {
+        if (c->cmsg_level == SOL_SOCKET && c->cmsg_type == SCM_CREDENTIALS &&
+            c->cmsg_len >= CMSG_LEN(sizeof(ucred))) {
+          ucred credentials;
+          std::memcpy(&credentials, CMSG_DATA(c), sizeof credentials);
+          writer = {credentials.pid, credentials.uid, credentials.gid};
         }
       }
-      if (handler) deliverReply(std::move(handler), std::move(body).value());
-      continue;
+      if (writer.pid != 0 && !uidServed(writer.uid)) {
+        close(fmt::format("written by pid {} of uid {}", writer.pid, writer.uid));
+        return;
+      }
     }
-    Event event;
-    event.type = EventType::Message;
-    event.message = Message{std::move(body).value(), header.id, header.flags};
-    if (event.message.wantsReply()) unanswered_.fetch_add(1);
-    deliver(std::move(event));
+    ++reads_;
+    if (!consume(buffer, static_cast<size_t>(n), writer)) return;
   }
+  readMore();
+}
+
+// Takes the bytes of one read, all written by writer (the kernel never joins the bytes of two
+// writers in one read); false when the connection has closed.
+bool Connection::consume(const uint8_t* data, size_t size, const Credentials& writer) {
+  if (heldStart_ < held_.size()) {
+    // Only the start of one frame is held when we read: complete it first.
+    if (writer != heldWriter_) {
+      close("a frame written by more than one process");
+      return false;
+    }
+    while (size > 0) {
+      size_t held = held_.size() - heldStart_;
+      size_t want;
+      if (held < kHeaderSize) {
+        want = kHeaderSize - held;
+      } else {
+        FrameHeader header = decodeHeader(held_.data() + heldStart_);
+        if (header.length > kMaxBodySize) break;  // refused by parseHeldInput below
+        size_t total = kHeaderSize + header.length;
+        if (held >= total) break;
+        want = total - held;
+      }
+      size_t take = std::min(want, size);
+      holdInput(data, take, writer);
+      data += take;
+      size -= take;
+    }
+    parseHeldInput();
+    if (closed_) return false;
+    if (heldStart_ < held_.size()) {
+      // Still not whole (all of this read went into it), or a pause left frames held.
+      if (size > 0) holdInput(data, size, writer);
+      return true;
+    }
+  }
+  if (size == 0) return true;
+  size_t used = parseFrames(data, size, writer);
+  if (closed_) return false;
+  if (used < size) holdInput(data + used, size - used, writer);
+  return true;
+}
+
+// Delivers the whole frames at the start of data until a pause; answers the bytes used.
+size_t Connection::parseFrames(const uint8_t* data, size_t size, const Credentials& writer) {
+  size_t used = 0;
+  while (!closed_ && !waitingFull()) {
+    size_t available = size - used;
+    if (available < kHeaderSize) break;
+    FrameHeader header = decodeHeader(data + used);
+    if (header.length > kMaxBodySize) {
+      close(fmt::format("frame of {} bytes", header.length));
+      break;
+    }
+    if (available < kHeaderSize + header.length) break;
+    const uint8_t* body = data + used + kHeaderSize;
+    used += kHeaderSize + header.length;
+    if (!deliverFrame(header, body, writer)) break;
+  }
+  return used;
+}
+
+void Connection::parseHeldInput() {
+  if (heldStart_ >= held_.size()) return;
+  size_t used = parseFrames(held_.data() + heldStart_, held_.size() - heldStart_, heldWriter_);
+  if (closed_) return;
+  dropHeldInput(used);
+}
+
+void Connection::holdInput(const uint8_t* data, size_t size, const Credentials& writer) {
+  if (size == 0) return;
+  if (heldStart_ >= held_.size()) {
+    held_.clear();
+    heldStart_ = 0;
+    heldWriter_ = writer;
+    armDeadline();
+  }
+  held_.insert(held_.end(), data, data + size);
+  gHeldInput.fetch_add(size, std::memory_order_relaxed);
+}
+
+void Connection::dropHeldInput(size_t count) {
+  if (count == 0) return;
+  heldStart_ += count;
+  subtract(gHeldInput, count);
+  if (heldStart_ >= held_.size()) {
+    // Given back: a frame of megabytes must not stay with the connection once parsed.
+    std::vector<uint8_t>().swap(held_);
+    heldStart_ = 0;
+    ++heldGeneration_;
+  } else if (heldStart_ >= held_.size() / 2) {
+    held_.erase(held_.begin(), held_.begin() + static_cast<ptrdiff_t>(heldStart_));
+    heldStart_ = 0;
+  }
+}
+
+void Connection::armDeadline() {
+  if (!deadline_) deadline_ = std::make_unique<asio::steady_timer>(strand_);
+  deadline_->expires_after(kFrameDeadline);
+  deadline_->async_wait(
+      [weak = weak_from_this(), generation = heldGeneration_](const asio::error_code& ec) {
+        auto self = weak.lock();
+        if (ec || !self || self->closed_) return;
+        if (self->heldGeneration_ != generation || self->heldStart_ >= self->held_.size()) return;
+        // Held because we paused reading, not because the peer is slow: give it its time again.
+        if (self->waitingFull()) {
+          self->armDeadline();
+          return;
+        }
+        self->close(fmt::format("frame incomplete {} s after it began", kFrameDeadline.count()));
+      });
+}
+
+bool Connection::deliverFrame(const FrameHeader& header, const uint8_t* bodyBytes,
+                              const Credentials& writer) {
+  auto body = cbor::decode(std::span(bodyBytes, header.length));
+  if (!body) {
+    close(body.error().message);
+    return false;
+  }
+  if (header.flags & kFlagReply) {
+    ReplyHandler handler;
+    {
+      std::lock_guard lock(pendingMutex_);
+      auto it = pending_.find(header.id);
+      if (it != pending_.end()) {
+        handler = std::move(it->second);
+        pending_.erase(it);
+      }
+    }
+    if (handler) deliverReply(std::move(handler), std::move(body).value());
+    return true;
+  }
+  size_t bytes = kHeaderSize + header.length;
+  waiting_.fetch_add(1);
+  waitingBytes_.fetch_add(bytes);
+  gHeldInput.fetch_add(bytes, std::memory_order_relaxed);
+  Event event;
+  event.type = EventType::Message;
+  event.message = Message{std::move(body).value(),
+                          header.id,
+                          header.flags,
+                          writer,
+                          reads_,
+                          std::make_shared<WaitingTicket>(weak_from_this(), bytes)};
+  deliver(std::move(event));
+  return true;
 }
 
 void Connection::deliver(Event event) {
@@ -299,9 +541,16 @@ void Connection::fail() {
     // A write in flight still refers to the queued frames; its completion drops them.
     if (!writing_) {
       output_.clear();
+      subtract(gQueuedOutput, queuedBytes_);
       queuedBytes_ = 0;
     }
   }
+  slot_.reset();
+  subtract(gHeldInput, held_.size() - heldStart_);
+  std::vector<uint8_t>().swap(held_);
+  heldStart_ = 0;
+  if (deadline_) deadline_->cancel();
+  if (retry_) retry_->cancel();
   std::map<uint64_t, ReplyHandler> pending;
   {
     std::lock_guard lock(pendingMutex_);
@@ -317,20 +566,16 @@ void Connection::fail() {
   keepAlive_.reset();
 }
 
-void Connection::releaseUnanswered() {
-  size_t before = unanswered_.load();
-  while (before > 0 && !unanswered_.compare_exchange_weak(before, before - 1)) {
-  }
-  if (before == kMaxUnansweredRequests) {
-    asio::post(strand_, [self = shared_from_this()] {
-      self->parseInput();
-      self->readMore();
-    });
+void Connection::releaseWaiting(size_t bytes) {
+  waiting_.fetch_sub(1);
+  waitingBytes_.fetch_sub(bytes);
+  if (resumeOnRelease_.exchange(false)) {
+    asio::post(strand_, [self = shared_from_this()] { self->readMore(); });
   }
 }
 
-void Connection::enqueueOutput(std::vector<uint8_t> frame, bool answersRequest) {
-  if (answersRequest) releaseUnanswered();
+void Connection::enqueueOutput(std::vector<uint8_t> frame, const Message* answered) {
+  if (answered && answered->ticket) answered->ticket->release();
   if (frame.empty()) return;
   bool failNow = false;
   bool startWriter = false;
@@ -349,14 +594,23 @@ void Connection::enqueueOutput(std::vector<uint8_t> frame, bool answersRequest) 
         sent = static_cast<size_t>(n);
       }
     }
+    size_t rest = frame.size() - sent;
     // One frame of any size a frame may have is always taken: a large answer is not a peer
-    // that fails to read. What piles up behind it is bounded.
+    // that fails to read. What piles up behind it is bounded, and so is all output together.
     if (!failNow && queuedBytes_ > 0 && queuedBytes_ + frame.size() > kMaxQueuedOutput) {
-      log::process().error("closing connection from pid=%d: it does not read its replies", pid());
+      log::process().throttled(gClosingThrottle, log::Level::Error,
+                               "closing connection from pid=%d: it does not read its replies",
+                               pid());
       failNow = true;
-    }
-    if (!failNow) {
-      queuedBytes_ += frame.size() - sent;
+    } else if (!failNow && gQueuedOutput.fetch_add(rest) + rest > kMaxQueuedOutputTotal) {
+      subtract(gQueuedOutput, rest);
+      log::process().throttled(
+          gClosingThrottle, log::Level::Error,
+          "closing connection from pid=%d: replies waiting for all clients exceed %zu bytes", pid(),
+          kMaxQueuedOutputTotal);
+      failNow = true;
+    } else if (!failNow) {
+      queuedBytes_ += rest;
       // Only a frame that starts an empty queue can have been partly sent.
       if (output_.empty()) outputStart_ = sent;
       output_.push_back(std::move(frame));
@@ -378,6 +632,7 @@ void Connection::writeMore() {
     if (closed_ || output_.empty()) {
       output_.clear();
       outputStart_ = 0;
+      subtract(gQueuedOutput, queuedBytes_);
       queuedBytes_ = 0;
       writing_ = false;
       return;
@@ -397,7 +652,9 @@ void Connection::writeMore() {
                           self->output_.pop_front();
                         }
                         self->outputStart_ = 0;
-                        self->queuedBytes_ -= std::min(written, self->queuedBytes_);
+                        size_t done = std::min(written, self->queuedBytes_);
+                        self->queuedBytes_ -= done;
+                        subtract(gQueuedOutput, done);
                       }
                       if (ec) {
                         self->fail();
@@ -414,7 +671,7 @@ size_t Connection::queuedOutputBytes() const {
 void Connection::send(const Value& message) {
   std::vector<uint8_t> frame;
   appendFrame(frame, message, 0, nextId_.fetch_add(1));
-  enqueueOutput(std::move(frame), false);
+  enqueueOutput(std::move(frame), nullptr);
 }
 
 void Connection::sendWithReply(const Value& message, ReplyHandler handler) {
@@ -432,27 +689,32 @@ void Connection::sendWithReply(const Value& message, ReplyHandler handler) {
     deliverReply(std::move(handler), connectionInvalidError());
     return;
   }
-  enqueueOutput(std::move(frame), false);
+  enqueueOutput(std::move(frame), nullptr);
 }
 
 void Connection::reply(const Message& request, const Value& reply) {
-  if (!request.wantsReply()) return;
+  if (!request.wantsReply()) {
+    dropRequest(request);
+    return;
+  }
   std::vector<uint8_t> frame;
   appendFrame(frame, reply, kFlagReply, request.id);
-  enqueueOutput(std::move(frame), true);
+  enqueueOutput(std::move(frame), &request);
 }
 
 void Connection::replyEncoded(const Message& request, std::vector<uint8_t> frame) {
-  if (!request.wantsReply()) return;
+  if (!request.wantsReply()) {
+    dropRequest(request);
+    return;
+  }
   if (frame.size() < kHeaderSize) throw std::logic_error("reply frame without its header");
   encodeHeader({static_cast<uint32_t>(frame.size() - kHeaderSize), kFlagReply, request.id},
                frame.data());
-  enqueueOutput(std::move(frame), true);
+  enqueueOutput(std::move(frame), &request);
 }
 
 void Connection::dropRequest(const Message& request) {
-  if (!request.wantsReply()) return;
-  enqueueOutput({}, true);
+  if (request.ticket) request.ticket->release();
 }
 
 std::string Connection::description() const {
@@ -486,6 +748,7 @@ Result<std::shared_ptr<Listener>> Listener::create(std::string_view serviceName,
       listener->acceptor_.assign(stream_protocol(), fd, ec);
       if (ec) return EkError::posix(ec.value(), "adopting the activation socket: " + ec.message());
       listener->activated_ = true;
+      listener->prepare();
       return listener;
     }
   }
@@ -507,10 +770,14 @@ Result<std::shared_ptr<Listener>> Listener::create(std::string_view serviceName,
   }
   auto& acceptor = listener->acceptor_;
   acceptor.open(stream_protocol(), ec);
+  // The file takes the socket's mode when it is bound: it is never open to others, not even
+  // for a moment. The uid check at accept holds whatever the mode.
+  if (!ec) ::fchmod(acceptor.native_handle(), 0600);
   if (!ec) acceptor.bind(stream_protocol::endpoint(path), ec);
-  if (!ec) ::chmod(path.c_str(), 0666);
+  if (!ec && ::chmod(path.c_str(), 0600) != 0) ec.assign(errno, asio::system_category());
   if (!ec) acceptor.listen(SOMAXCONN, ec);
   if (ec) return EkError::posix(ec.value(), fmt::format("listening on {}: {}", path, ec.message()));
+  listener->prepare();
   return listener;
 }
 
@@ -524,6 +791,22 @@ void Listener::resume() {
   asio::dispatch(strand_, [self = shared_from_this()] { self->acceptMore(); });
 }
 
+void Listener::prepare() {
+  // Accepted sockets inherit this, and bytes written before the accept carry credentials too.
+  int on = 1;
+  ::setsockopt(acceptor_.native_handle(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on);
+}
+
+size_t Listener::connectionLimit() const {
+  // Read at every accept: an administrator may change the limit of a running daemon.
+  struct rlimit files {};
+  if (::getrlimit(RLIMIT_NOFILE, &files) != 0 || files.rlim_cur == RLIM_INFINITY) {
+    return kMaxConnections;
+  }
+  size_t usable = files.rlim_cur > kReservedDescriptors ? files.rlim_cur - kReservedDescriptors : 0;
+  return std::clamp<size_t>(usable / kDescriptorsPerConnection, 1, kMaxConnections);
+}
+
 void Listener::acceptMore() {
   if (cancelled_) return;
   acceptor_.async_accept(asio::bind_executor(
@@ -532,25 +815,66 @@ void Listener::acceptMore() {
         if (self->cancelled_) return;
         if (ec) {
           if (ec == asio::error::operation_aborted) return;
-          EkError error{std::string(kErrorDomain), ec.value(), ec.message()};
-          if (self->handler_) {
-            self->queue_->async([handler = self->handler_, error] { handler({nullptr, error}); });
-          }
-          // Out of descriptors and the like: back off a little instead of spinning.
-          auto timer = std::make_shared<asio::steady_timer>(self->strand_);
-          timer->expires_after(std::chrono::milliseconds(50));
-          timer->async_wait([self, timer](const asio::error_code&) { self->acceptMore(); });
+          self->backOff(ec);
           return;
         }
-        auto token = AuditToken::forSocket(socket.native_handle());
-        if (token && self->handler_) {
-          auto connection = Connection::adopt(std::move(socket), std::move(*token));
-          self->queue_->async([handler = self->handler_, connection] {
-            handler({connection, std::nullopt});
-          });
-        }
+        self->backoff_ = std::chrono::milliseconds(0);
+        self->accepted(std::move(socket));
         self->acceptMore();
       }));
+}
+
+void Listener::backOff(const asio::error_code& ec) {
+  static log::Throttle throttle;
+  uint64_t suppressed = 0;
+  if (handler_ && throttle.admit(&suppressed)) {
+    std::string message = ec.message();
+    if (suppressed > 0) message += fmt::format(" ({} similar errors suppressed)", suppressed);
+    EkError error{std::string(kErrorDomain), ec.value(), std::move(message)};
+    queue_->async([handler = handler_, error] { handler({nullptr, error}); });
+  }
+  // Out of descriptors and the like: back off, longer while it lasts, instead of spinning.
+  // The peers wait in the backlog and are served once descriptors are free again.
+  backoff_ =
+      std::clamp(backoff_ * 2, std::chrono::milliseconds(10), std::chrono::milliseconds(500));
+  auto timer = std::make_shared<asio::steady_timer>(strand_);
+  timer->expires_after(backoff_);
+  timer->async_wait(
+      [self = shared_from_this(), timer](const asio::error_code&) { self->acceptMore(); });
+}
+
+void Listener::accepted(stream_protocol::socket socket) {
+  static log::Throttle refusals;
+  static std::mutex refusedMutex;
+  static std::set<uid_t> refusedUids;
+  auto token = AuditToken::forSocket(socket.native_handle());
+  if (!token) return;
+  if (!uidServed(token->uid)) {
+    bool first = false;
+    {
+      std::lock_guard lock(refusedMutex);
+      // Bounded like everything a peer can grow: past it, refusals are only throttled.
+      if (refusedUids.size() < 1024) first = refusedUids.insert(token->uid).second;
+    }
+    if (first) {
+      log::process().throttled(refusals, log::Level::Error,
+                               "refused connection from pid=%d: uid %u is not served", token->pid,
+                               token->uid);
+    }
+    return;
+  }
+  if (count_->load() >= connectionLimit()) {
+    static log::Throttle full;
+    log::process().throttled(full, log::Level::Error,
+                             "refused connection from pid=%d: %zu connections already", token->pid,
+                             count_->load());
+    return;
+  }
+  count_->fetch_add(1);
+  std::shared_ptr<void> slot(nullptr, [count = count_](void*) { count->fetch_sub(1); });
+  if (!handler_) return;
+  auto connection = Connection::adopt(std::move(socket), std::move(*token), std::move(slot));
+  queue_->async([handler = handler_, connection] { handler({connection, std::nullopt}); });
 }
 
 void Listener::cancel() {

@@ -2,10 +2,17 @@
 
 #include <gtest/gtest.h>
 #include <stdlib.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <filesystem>
+#include <functional>
 #include <future>
+#include <optional>
 
 #include "platform/cbor/Cbor.h"
 
@@ -66,7 +73,10 @@ class WyreLoopback : public ::testing::Test {
           return;
         }
         if (!self || e.type != EventType::Message) return;
-        if (e.message.body.get("encoded")) {
+        if (e.message.body.get("who")) {
+          self->reply(e.message,
+                      Value(Dictionary{{"pid", static_cast<uint64_t>(e.message.sender.pid)}}));
+        } else if (e.message.body.get("encoded")) {
           std::vector<uint8_t> frame(kHeaderSize);
           cbor::encode(e.message.body, frame);
           self->replyEncoded(e.message, std::move(frame));
@@ -150,6 +160,109 @@ TEST_F(WyreLoopback, ConnectingToAnAbsentServiceFails) {
   auto connection = Connection::connect("nobody-listens");
   ASSERT_FALSE(connection.ok());
   EXPECT_EQ(connection.error().code, ENOENT);
+}
+
+// A socket connected to the listener by hand, so that other processes can write on it.
+int rawConnect(const std::string& path) {
+  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+  if (::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+// Runs write in a child process and waits for it.
+void writeFromChild(const std::function<void()>& write) {
+  pid_t child = fork();
+  if (child == 0) {
+    write();
+    _exit(0);
+  }
+  waitpid(child, nullptr, 0);
+}
+
+// The pid the listener saw as the writer of the reply's request; absent when the connection
+// closed instead.
+std::optional<pid_t> replyPid(int fd) {
+  timeval timeout{10, 0};
+  setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
+  std::vector<uint8_t> bytes;
+  uint8_t buffer[4096];
+  while (true) {
+    if (bytes.size() >= kHeaderSize) {
+      FrameHeader header = decodeHeader(bytes.data());
+      if (bytes.size() >= kHeaderSize + header.length) {
+        auto body = cbor::decode(std::span(bytes).subspan(kHeaderSize, header.length));
+        if (!body || !body->getUnsigned("pid")) return std::nullopt;
+        return static_cast<pid_t>(*body->getUnsigned("pid"));
+      }
+    }
+    ssize_t n = ::read(fd, buffer, sizeof buffer);
+    if (n <= 0) return std::nullopt;
+    bytes.insert(bytes.end(), buffer, buffer + n);
+  }
+}
+
+// Every message carries the process that wrote it, whichever process connected; a frame two
+// processes wrote closes the connection.
+TEST_F(WyreLoopback, MessagesCarryTheProcessThatWroteThem) {
+  std::vector<uint8_t> frame;
+  appendFrame(frame, Value(Dictionary{{"who", true}}), kFlagWantsReply, 1);
+  const size_t half = frame.size() / 2;
+  struct Case {
+    const char* name;
+    std::function<pid_t(int fd)> write;  // answers the writer expected, 0 for a closed connection
+  };
+  std::vector<Case> cases{
+      {"the connecting process",
+       [&](int fd) {
+         EXPECT_EQ(::write(fd, frame.data(), frame.size()), ssize_t(frame.size()));
+         return getpid();
+       }},
+      {"a child that kept the socket",
+       [&](int fd) {
+         pid_t writer = 0;
+         int pipeFds[2];
+         EXPECT_EQ(pipe(pipeFds), 0);
+         writeFromChild([&] {
+           pid_t self = getpid();
+           (void)!::write(pipeFds[1], &self, sizeof self);
+           (void)!::write(fd, frame.data(), frame.size());
+         });
+         EXPECT_EQ(::read(pipeFds[0], &writer, sizeof writer), ssize_t(sizeof writer));
+         ::close(pipeFds[0]);
+         ::close(pipeFds[1]);
+         return writer;
+       }},
+      {"a frame begun by one process and ended by another",
+       [&](int fd) {
+         EXPECT_EQ(::write(fd, frame.data(), half), ssize_t(half));
+         writeFromChild([&] { (void)!::write(fd, frame.data() + half, frame.size() - half); });
+         return pid_t{0};
+       }},
+  };
+  for (const Case& c : cases) {
+    int fd = rawConnect(listener_->path());
+    ASSERT_GE(fd, 0) << c.name;
+    pid_t expected = c.write(fd);
+    std::optional<pid_t> seen = replyPid(fd);
+    if (expected == 0) {
+      EXPECT_FALSE(seen) << c.name;
+    } else {
+      EXPECT_EQ(seen, expected) << c.name;
+    }
+    ::close(fd);
+  }
+}
+
+TEST_F(WyreLoopback, SocketIsForItsOwnerOnly) {
+  struct stat st {};
+  ASSERT_EQ(::stat(listener_->path().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
 }
 
 }  // namespace
