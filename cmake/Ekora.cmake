@@ -15,6 +15,32 @@ if(EKORA_SANITIZE)
   add_link_options(-fsanitize=${EKORA_SANITIZE})
 endif()
 
+# The programs of the package are hardened as Debian builds its own; an optimised build only,
+# since _FORTIFY_SOURCE needs the optimiser (and warns, hence fails, without it).
+if(NOT EKORA_SANITIZE AND NOT EKORA_FUZZ)
+  add_compile_options($<$<CONFIG:Release,RelWithDebInfo,MinSizeRel>:-D_FORTIFY_SOURCE=2>)
+  add_link_options(-Wl,-z,relro,-z,now)
+endif()
+
+# lld links the many test binaries several times faster than the default linker.
+find_program(EKORA_LLD ld.lld)
+option(EKORA_USE_LLD "Link with lld when it is installed" ON)
+if(EKORA_USE_LLD AND EKORA_LLD)
+  add_link_options(-fuse-ld=lld)
+endif()
+
+# Test binaries share one precompiled header of the heavy third-party headers they all parse.
+# It is made from an empty library with the tests' own flags, since a header precompiled
+# under other flags is refused.
+if(EKORA_TESTS AND EKORA_TEST_PCH)
+  file(WRITE ${PROJECT_BINARY_DIR}/ek_test_pch.cpp "")
+  add_library(ek_test_pch STATIC ${PROJECT_BINARY_DIR}/ek_test_pch.cpp)
+  target_compile_options(ek_test_pch PRIVATE ${EKORA_WARNINGS})
+  target_link_libraries(ek_test_pch PRIVATE GTest::gtest GTest::gmock fmt::fmt)
+  target_precompile_headers(ek_test_pch PRIVATE <gtest/gtest.h> <gmock/gmock.h>
+    <fmt/format.h> <string> <vector> <map> <memory> <functional> <optional> <thread>)
+endif()
+
 # ek_library(NAME SOURCES... DEPS ...): a static library of our own code.
 function(ek_library name)
   cmake_parse_arguments(ARG "" "" "SOURCES;DEPS" ${ARGN})
@@ -26,8 +52,14 @@ endfunction()
 
 # ek_test(NAME SOURCES... DEPS ... [LABELS ...]): a GoogleTest binary registered with CTest.
 function(ek_test name)
+  if(NOT EKORA_TESTS)
+    return()
+  endif()
   cmake_parse_arguments(ARG "" "" "SOURCES;DEPS;LABELS" ${ARGN})
   add_executable(${name} ${ARG_SOURCES})
+  if(TARGET ek_test_pch)
+    target_precompile_headers(${name} REUSE_FROM ek_test_pch)
+  endif()
   target_compile_options(${name} PRIVATE ${EKORA_WARNINGS})
   target_link_libraries(${name} PRIVATE ${ARG_DEPS} GTest::gtest GTest::gtest_main GTest::gmock)
   include(GoogleTest)
@@ -42,4 +74,24 @@ function(ek_test name)
     message(FATAL_ERROR "ek_test(${name}): one label per test binary, not '${ARG_LABELS}'")
   endif()
   gtest_discover_tests(${name} PROPERTIES LABELS ${ARG_LABELS} DISCOVERY_TIMEOUT 60)
+  ek_test_needs(${ARG_LABELS} ${name})
+endfunction()
+
+# ek_test_needs(LABEL TARGETS...): the tests labelled LABEL need TARGETS built. The target
+# tests_LABEL (made by ek_test_targets) builds exactly those, so that a stage that runs one
+# label builds no more than it runs.
+function(ek_test_needs label)
+  set_property(GLOBAL APPEND PROPERTY EK_TEST_LABELS ${label})
+  set_property(GLOBAL APPEND PROPERTY EK_TEST_TARGETS_${label} ${ARGN})
+endfunction()
+
+# Called once at the end of the top-level list, when every test is known.
+function(ek_test_targets)
+  get_property(labels GLOBAL PROPERTY EK_TEST_LABELS)
+  list(REMOVE_DUPLICATES labels)
+  foreach(label IN LISTS labels)
+    get_property(targets GLOBAL PROPERTY EK_TEST_TARGETS_${label})
+    add_custom_target(tests_${label})
+    add_dependencies(tests_${label} ${targets})
+  endforeach()
 endfunction()
