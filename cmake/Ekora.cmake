@@ -32,7 +32,7 @@ endif()
 # Test binaries share one precompiled header of the heavy third-party headers they all parse.
 # It is made from an empty library with the tests' own flags, since a header precompiled
 # under other flags is refused.
-if(EKORA_TESTS AND EKORA_TEST_PCH)
+if(EKORA_BUILD_TESTS AND EKORA_TEST_PCH)
   file(WRITE ${PROJECT_BINARY_DIR}/ek_test_pch.cpp "")
   add_library(ek_test_pch STATIC ${PROJECT_BINARY_DIR}/ek_test_pch.cpp)
   target_compile_options(ek_test_pch PRIVATE ${EKORA_WARNINGS})
@@ -51,11 +51,15 @@ function(ek_library name)
 endfunction()
 
 # ek_test(NAME SOURCES... DEPS ... [LABELS ...]): a GoogleTest binary registered with CTest.
+# With EKORA_BUILD_TESTS off the binary is still defined (folders may refer to it) but neither
+# built by default nor registered.
 function(ek_test name)
-  if(NOT EKORA_TESTS)
+  cmake_parse_arguments(ARG "" "" "SOURCES;DEPS;LABELS" ${ARGN})
+  if(NOT EKORA_BUILD_TESTS)
+    add_executable(${name} EXCLUDE_FROM_ALL ${ARG_SOURCES})
+    target_link_libraries(${name} PRIVATE ${ARG_DEPS} GTest::gtest GTest::gtest_main GTest::gmock)
     return()
   endif()
-  cmake_parse_arguments(ARG "" "" "SOURCES;DEPS;LABELS" ${ARGN})
   add_executable(${name} ${ARG_SOURCES})
   if(TARGET ek_test_pch)
     target_precompile_headers(${name} REUSE_FROM ek_test_pch)
