@@ -16,8 +16,7 @@ if(EKORA_SANITIZE)
 endif()
 
 # The programs of the package resolve every symbol at start and keep the relocated data
-# read-only, as Debian links its own. (_FORTIFY_SOURCE would make g++ 12 report false
-# out-of-bounds copies in std::string code, which -Werror turns into failures.)
+# read-only, as Debian links its own.
 if(NOT EKORA_SANITIZE AND NOT EKORA_FUZZ)
   add_link_options(-Wl,-z,relro,-z,now)
 endif()
@@ -27,20 +26,6 @@ find_program(EKORA_LLD ld.lld)
 option(EKORA_USE_LLD "Link with lld when it is installed" ON)
 if(EKORA_USE_LLD AND EKORA_LLD)
   add_link_options(-fuse-ld=lld)
-endif()
-
-# Test binaries share one precompiled header of the heavy headers they all parse. It is made
-# from an empty library with the tests' own flags, since a header precompiled under other
-# flags is refused. Only headers that read none of the macros the tests' libraries define
-# (fmt reads FMT_SHARED, asio its own) go in; should one still differ, the test compiles
-# without the header instead of failing.
-if(EKORA_BUILD_TESTS AND EKORA_TEST_PCH)
-  file(WRITE ${PROJECT_BINARY_DIR}/ek_test_pch.cpp "")
-  add_library(ek_test_pch STATIC ${PROJECT_BINARY_DIR}/ek_test_pch.cpp)
-  target_compile_options(ek_test_pch PRIVATE ${EKORA_WARNINGS} -Wno-error=invalid-pch)
-  target_link_libraries(ek_test_pch PRIVATE GTest::gtest GTest::gmock)
-  target_precompile_headers(ek_test_pch PRIVATE <gtest/gtest.h> <gmock/gmock.h> <string>
-    <vector> <map> <memory> <functional> <optional> <thread>)
 endif()
 
 # ek_library(NAME SOURCES... DEPS ...): a static library of our own code.
@@ -63,10 +48,6 @@ function(ek_test name)
     return()
   endif()
   add_executable(${name} ${ARG_SOURCES})
-  if(TARGET ek_test_pch)
-    target_precompile_headers(${name} REUSE_FROM ek_test_pch)
-    target_compile_options(${name} PRIVATE -Wno-error=invalid-pch)
-  endif()
   target_compile_options(${name} PRIVATE ${EKORA_WARNINGS})
   target_link_libraries(${name} PRIVATE ${ARG_DEPS} GTest::gtest GTest::gtest_main GTest::gmock)
   include(GoogleTest)
