@@ -18,6 +18,9 @@ foreach(page ekd.8 ekctl.1 ek-sandbox-exec.1)
   list(APPEND ekora_compressed ${compressed})
 endforeach()
 
+set(EKORA_PACKAGE_MAINTAINER "Ekora developers <ekora@corvane.com>"
+    CACHE STRING "Maintainer field of the Debian package")
+
 configure_file(${PROJECT_SOURCE_DIR}/packaging/changelog.in ${PROJECT_BINARY_DIR}/changelog @ONLY)
 add_custom_command(OUTPUT ${PROJECT_BINARY_DIR}/changelog.gz
   COMMAND ${EKORA_GZIP} -9n -c ${PROJECT_BINARY_DIR}/changelog > ${PROJECT_BINARY_DIR}/changelog.gz
@@ -26,9 +29,6 @@ add_custom_target(ekora_package_files ALL DEPENDS ${ekora_compressed}
   ${PROJECT_BINARY_DIR}/changelog.gz)
 install(FILES ${PROJECT_SOURCE_DIR}/packaging/copyright ${PROJECT_BINARY_DIR}/changelog.gz
   DESTINATION ${CMAKE_INSTALL_DATAROOTDIR}/doc/ekora)
-
-set(EKORA_PACKAGE_MAINTAINER "Ekora developers <ekora@corvane.com>"
-    CACHE STRING "Maintainer field of the Debian package")
 
 set(CPACK_GENERATOR DEB)
 set(CPACK_PACKAGE_NAME ekora)
