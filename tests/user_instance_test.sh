@@ -121,6 +121,8 @@ run_case "$scratch/xdg-run" "$scratch/xdg-run/ekora"
 fallback=/tmp/ekora-$uid
 if [[ -e $fallback ]]; then
   echo "not trying the fallback: $fallback exists already"
+elif [[ $(stat -c %a /tmp) != 1777 ]]; then
+  echo "not trying the fallback: /tmp is mode $(stat -c %a /tmp), not 1777, so no user may use it"
 else
   fallback_made=$fallback
   run_case "" "$fallback"
