@@ -15,6 +15,19 @@ if(EKORA_SANITIZE)
   add_link_options(-fsanitize=${EKORA_SANITIZE})
 endif()
 
+# The programs of the package resolve every symbol at start and keep the relocated data
+# read-only, as Debian links its own.
+if(NOT EKORA_SANITIZE AND NOT EKORA_FUZZ)
+  add_link_options(-Wl,-z,relro,-z,now)
+endif()
+
+# lld links the many test binaries several times faster than the default linker.
+find_program(EKORA_LLD ld.lld)
+option(EKORA_USE_LLD "Link with lld when it is installed" ON)
+if(EKORA_USE_LLD AND EKORA_LLD)
+  add_link_options(-fuse-ld=lld)
+endif()
+
 # ek_library(NAME SOURCES... DEPS ...): a static library of our own code.
 function(ek_library name)
   cmake_parse_arguments(ARG "" "" "SOURCES;DEPS" ${ARGN})
@@ -25,8 +38,15 @@ function(ek_library name)
 endfunction()
 
 # ek_test(NAME SOURCES... DEPS ... [LABELS ...]): a GoogleTest binary registered with CTest.
+# With EKORA_BUILD_TESTS off the binary is still defined (folders may refer to it) but neither
+# built by default nor registered.
 function(ek_test name)
   cmake_parse_arguments(ARG "" "" "SOURCES;DEPS;LABELS" ${ARGN})
+  if(NOT EKORA_BUILD_TESTS)
+    add_executable(${name} EXCLUDE_FROM_ALL ${ARG_SOURCES})
+    target_link_libraries(${name} PRIVATE ${ARG_DEPS} GTest::gtest GTest::gtest_main GTest::gmock)
+    return()
+  endif()
   add_executable(${name} ${ARG_SOURCES})
   target_compile_options(${name} PRIVATE ${EKORA_WARNINGS})
   target_link_libraries(${name} PRIVATE ${ARG_DEPS} GTest::gtest GTest::gtest_main GTest::gmock)
@@ -42,4 +62,24 @@ function(ek_test name)
     message(FATAL_ERROR "ek_test(${name}): one label per test binary, not '${ARG_LABELS}'")
   endif()
   gtest_discover_tests(${name} PROPERTIES LABELS ${ARG_LABELS} DISCOVERY_TIMEOUT 60)
+  ek_test_needs(${ARG_LABELS} ${name})
+endfunction()
+
+# ek_test_needs(LABEL TARGETS...): the tests labelled LABEL need TARGETS built. The target
+# tests_LABEL (made by ek_test_targets) builds exactly those, so that a stage that runs one
+# label builds no more than it runs.
+function(ek_test_needs label)
+  set_property(GLOBAL APPEND PROPERTY EK_TEST_LABELS ${label})
+  set_property(GLOBAL APPEND PROPERTY EK_TEST_TARGETS_${label} ${ARGN})
+endfunction()
+
+# Called once at the end of the top-level list, when every test is known.
+function(ek_test_targets)
+  get_property(labels GLOBAL PROPERTY EK_TEST_LABELS)
+  list(REMOVE_DUPLICATES labels)
+  foreach(label IN LISTS labels)
+    get_property(targets GLOBAL PROPERTY EK_TEST_TARGETS_${label})
+    add_custom_target(tests_${label})
+    add_dependencies(tests_${label} ${targets})
+  endforeach()
 endfunction()

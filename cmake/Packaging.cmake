@@ -1,12 +1,34 @@
 # The Debian package: `cpack` in a build directory makes ekora_<version>_<arch>.deb holding
-# the daemon, its command-line tools, the systemd units and the manual pages. Only the targets
+# the daemon, its command-line tools, the systemd units (the root instance's and the per-user
+# ones), the manual pages, the copyright file and the maintainer scripts. Only the targets
 # that call install() end up in it; libraries and tests do not.
 
-install(FILES ${PROJECT_SOURCE_DIR}/man/ekd.8 DESTINATION ${CMAKE_INSTALL_MANDIR}/man8)
-install(FILES ${PROJECT_SOURCE_DIR}/man/ekctl.1 DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
+# Manual pages go in compressed, as Debian's policy wants them; -n keeps the archive free of
+# the build's time, so two builds of one tree make the same package.
+find_program(EKORA_GZIP gzip REQUIRED)
+set(ekora_compressed "")
+foreach(page ekd.8 ekctl.1 ek-sandbox-exec.1)
+  set(compressed ${PROJECT_BINARY_DIR}/man/${page}.gz)
+  add_custom_command(OUTPUT ${compressed}
+    COMMAND ${CMAKE_COMMAND} -E make_directory ${PROJECT_BINARY_DIR}/man
+    COMMAND ${EKORA_GZIP} -9n -c ${PROJECT_SOURCE_DIR}/man/${page} > ${compressed}
+    DEPENDS ${PROJECT_SOURCE_DIR}/man/${page} VERBATIM)
+  string(REGEX REPLACE ".*\\." "" section ${page})
+  install(FILES ${compressed} DESTINATION ${CMAKE_INSTALL_MANDIR}/man${section})
+  list(APPEND ekora_compressed ${compressed})
+endforeach()
 
 set(EKORA_PACKAGE_MAINTAINER "Ekora developers <ekora@corvane.com>"
     CACHE STRING "Maintainer field of the Debian package")
+
+configure_file(${PROJECT_SOURCE_DIR}/packaging/changelog.in ${PROJECT_BINARY_DIR}/changelog @ONLY)
+add_custom_command(OUTPUT ${PROJECT_BINARY_DIR}/changelog.gz
+  COMMAND ${EKORA_GZIP} -9n -c ${PROJECT_BINARY_DIR}/changelog > ${PROJECT_BINARY_DIR}/changelog.gz
+  DEPENDS ${PROJECT_BINARY_DIR}/changelog VERBATIM)
+add_custom_target(ekora_package_files ALL DEPENDS ${ekora_compressed}
+  ${PROJECT_BINARY_DIR}/changelog.gz)
+install(FILES ${PROJECT_SOURCE_DIR}/packaging/copyright ${PROJECT_BINARY_DIR}/changelog.gz
+  DESTINATION ${CMAKE_INSTALL_DATAROOTDIR}/doc/ekora)
 
 set(CPACK_GENERATOR DEB)
 set(CPACK_PACKAGE_NAME ekora)
@@ -27,6 +49,10 @@ the ekctl command-line client and the ek-sandbox-exec launcher.")
 set(CPACK_STRIP_FILES ON)
 
 set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
+# Enable the root socket and every user's socket on installation, disable them on removal.
+set(CPACK_DEBIAN_PACKAGE_CONTROL_EXTRA ${PROJECT_SOURCE_DIR}/packaging/postinst
+    ${PROJECT_SOURCE_DIR}/packaging/prerm ${PROJECT_SOURCE_DIR}/packaging/postrm)
+set(CPACK_DEBIAN_PACKAGE_CONTROL_STRICT_PERMISSION ON)
 set(CPACK_DEBIAN_PACKAGE_SECTION admin)
 set(CPACK_DEBIAN_PACKAGE_PRIORITY optional)
 set(CPACK_DEBIAN_PACKAGE_MAINTAINER "${EKORA_PACKAGE_MAINTAINER}")

@@ -10,13 +10,17 @@
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <iterator>
 #include <optional>
 #include <string>
+#include <string_view>
+#include <utility>
 
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDServer.h"
 #include "platform/log/Log.h"
+#include "platform/paths/Directories.h"
 
 namespace {
 
@@ -67,6 +71,55 @@ void raiseDescriptorLimit() {
   std::exit(2);
 }
 
+#ifndef EKORA_VERSION
+#define EKORA_VERSION "unknown"
+#endif
+
+// The long options stand alone: getopt would read "--help" as the unknown option '-'.
+void answerLongOption(int argc, char* argv[]) {
+  for (int i = 1; i < argc; ++i) {
+    std::string_view argument = argv[i];
+    if (argument == "--") return;
+    if (argument == "--version") {
+      std::printf("ekd %s\n", EKORA_VERSION);
+      std::exit(0);
+    }
+    if (argument == "--help") {
+      std::printf(
+          "Usage: ekd [-S servicename] [-d annotation-file] [-c cache-limit] [-v]\n"
+          "       ekd --help | --version\n"
+          "\n"
+          "The plug-in daemon: keeps the registry of installed plug-ins and answers the\n"
+          "processes of one user over the socket $EKORA_RUNTIME_DIR/servicename.\n"
+          "\n"
+          "  -S servicename      service to listen on (default %s)\n"
+          "  -d annotation-file  file of the user's per-plug-in choices\n"
+          "                      (default $EKORA_STATE_DIR/Ekora-Annotations)\n"
+          "  -c cache-limit      cached plug-in records kept without a purge (default 1000000)\n"
+          "  -v                  no effect; log levels come from EKORA_LOG\n"
+          "  --help              print this text and exit\n"
+          "  --version           print the version and exit\n"
+          "\n"
+          "Directories for this user:\n"
+          "  EKORA_RUNTIME_DIR  %s\n"
+          "  EKORA_STATE_DIR    %s\n"
+          "  EKORA_SYSTEM_ROOT  %s\n"
+          "\n"
+          "SIGTERM or SIGINT releases every hold, removes the socket and exits 0. See ekd(8).\n",
+          std::string(ek::protocol::kServiceName).c_str(), ek::paths::runtimeDir().c_str(),
+          ek::paths::stateDir().c_str(), ek::paths::systemRoot().c_str());
+      std::exit(0);
+    }
+  }
+}
+
+// A directory ekd must write to, made when missing. Absent when usable, else the reason.
+std::optional<std::string> unusableDirectory(const std::string& directory) {
+  if (auto made = ek::paths::ensureDirectory(directory); !made.ok()) return made.error().message;
+  if (access(directory.c_str(), W_OK | X_OK) != 0) return std::strerror(errno);
+  return std::nullopt;
+}
+
 }  // namespace
 
 int main(int argc, char* argv[]) {
@@ -85,6 +138,9 @@ int main(int argc, char* argv[]) {
   std::optional<std::string> database;
   int cacheLimit = 1000000;
   unsigned verbose = 0;
+
+  answerLongOption(argc, argv);
+  auto startTime = std::chrono::steady_clock::now();
 
   int option;
   while ((option = getopt(argc, argv, "c:d:S:v")) != -1) {
@@ -120,7 +176,19 @@ int main(int argc, char* argv[]) {
 
   // The main run loop: start-up and the termination signal run here.
   asio::io_context mainLoop;
-  asio::signal_set termination(mainLoop, SIGTERM);
+  // An interactive ^C stops the daemon as cleanly as the service manager does.
+  asio::signal_set termination(mainLoop, SIGTERM, SIGINT);
+
+  // Without these the server cannot start; say which one and why instead of failing deep
+  // inside start-up.
+  const std::pair<const char*, std::string> directories[] = {{"state", ek::paths::stateDir()},
+                                                             {"runtime", ek::paths::runtimeDir()}};
+  for (const auto& [kind, directory] : directories) {
+    if (auto reason = unusableDirectory(directory)) {
+      log::ops().error("unusable %s directory %s: %s", kind, directory, *reason);
+      return 1;
+    }
+  }
 
   auto server = EkDServer::initForService(serviceName, database);
   if (!server) {
@@ -141,6 +209,13 @@ int main(int argc, char* argv[]) {
   });
 
   server->run();
+  auto elapsed = std::chrono::duration_cast<std::chrono::milliseconds>(
+      std::chrono::steady_clock::now() - startTime);
+  log::ops().defaultLevel(
+      "ekd %s listening on %s%s, %llu plug-ins registered, started in %llu ms", EKORA_VERSION,
+      server->service()->path(), server->service()->activated() ? " (socket-activated)" : "",
+      static_cast<unsigned long long>(server->registry()->installedPlugIns().size()),
+      static_cast<unsigned long long>(elapsed.count()));
   auto guard = asio::make_work_guard(mainLoop);
   mainLoop.run();
   return 0;

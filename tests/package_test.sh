@@ -37,7 +37,7 @@ fail() {
   exit 1
 }
 
-for tool in dpkg-deb groff timeout; do
+for tool in dpkg-deb groff timeout gzip; do
   command -v "$tool" >/dev/null || fail "$tool is not installed"
 done
 [[ -f $build/CPackConfig.cmake ]] || fail "no CPackConfig.cmake in $build"
@@ -70,26 +70,60 @@ expected="./usr/bin/ek-sandbox-exec
 ./usr/bin/ekctl
 ./usr/lib/systemd/system/ekd.service
 ./usr/lib/systemd/system/ekd.socket
+./usr/lib/systemd/user/ekd.service
+./usr/lib/systemd/user/ekd.socket
 ./usr/sbin/ekd
-./usr/share/man/man1/ekctl.1
-./usr/share/man/man8/ekd.8"
+./usr/share/doc/ekora/changelog.gz
+./usr/share/doc/ekora/copyright
+./usr/share/man/man1/ek-sandbox-exec.1.gz
+./usr/share/man/man1/ekctl.1.gz
+./usr/share/man/man8/ekd.8.gz"
 actual=$(cd "$root" && find . ! -type d | LC_ALL=C sort)
 if [[ $actual != "$expected" ]]; then
   diff <(echo "$expected") <(echo "$actual") >&2 || true
-  fail "the package holds other files than the runtime programs, units and manual pages"
+  fail "the package holds other files than the programs, units, manual pages and documents"
+fi
+grep -q '^SocketMode=0600$' "$root/usr/lib/systemd/system/ekd.socket" ||
+  fail "the root instance's socket is not 0600"
+grep -q '^ListenStream=%t/ekora/com.corvane.ekora.ekd$' "$root/usr/lib/systemd/user/ekd.socket" ||
+  fail "the user socket is not \$XDG_RUNTIME_DIR/ekora/com.corvane.ekora.ekd"
+
+# The maintainer scripts enable the root socket and every user's, and disable them again.
+control=$scratch/control
+dpkg-deb -e "$deb" "$control" || fail "dpkg-deb could not extract the control files"
+for script in postinst prerm postrm; do
+  [[ -x $control/$script ]] || fail "no executable $script"
+  sh -n "$control/$script" || fail "$script is not valid sh"
+done
+grep -q 'deb-systemd-helper enable ekd.socket' "$control/postinst" ||
+  fail "postinst does not enable ekd.socket"
+grep -q 'deb-systemd-helper --user enable ekd.socket' "$control/postinst" ||
+  fail "postinst does not enable the user socket"
+grep -q 'deb-systemd-helper --user disable ekd.socket' "$control/postrm" ||
+  fail "postrm does not disable the user socket"
+
+if command -v lintian >/dev/null; then
+  # lintian frowns on running as root but checks the same.
+  lintian --fail-on error,warning "$deb" >"$scratch/lintian.log" 2>&1 || {
+    cat "$scratch/lintian.log" >&2
+    fail "lintian finds fault with the package"
+  }
+  echo "lintian: no errors or warnings"
+else
+  echo "lintian is not installed: not run"
 fi
 for program in usr/sbin/ekd usr/bin/ekctl usr/bin/ek-sandbox-exec; do
   [[ -x $root/$program ]] || fail "$program is not executable"
 done
 
-for page in "$root/usr/share/man/man8/ekd.8" "$root/usr/share/man/man1/ekctl.1"; do
-  warnings=$(LC_ALL=C.UTF-8 groff -man -Tutf8 -ww -z "$page" 2>&1) ||
+for page in "$root"/usr/share/man/man*/*.gz; do
+  warnings=$(gzip -dc "$page" | LC_ALL=C.UTF-8 groff -man -Tutf8 -ww -z 2>&1) ||
     fail "groff could not format $(basename "$page")"
   [[ -z $warnings ]] || fail "$(basename "$page") formats with warnings: $warnings"
 done
 
 # Every command and global option that ekctl offers has an entry in its manual page.
-manual=$(LC_ALL=C.UTF-8 groff -man -Tutf8 -P-cbou "$root/usr/share/man/man1/ekctl.1")
+manual=$(gzip -dc "$root/usr/share/man/man1/ekctl.1.gz" | LC_ALL=C.UTF-8 groff -man -Tutf8 -P-cbou)
 help=$(timeout 10 "$root/usr/bin/ekctl" --help) || fail "ekctl --help failed"
 commands=$(awk '/^Subcommands:/ { listing = 1; next } listing && NF { print $1 }' <<<"$help")
 [[ -n $commands ]] || fail "ekctl --help lists no commands"

@@ -57,7 +57,7 @@ std::string stateDir() {
 
 std::string systemRoot() {
   if (auto dir = fromEnvironment("EKORA_SYSTEM_ROOT")) return *dir;
-  return "/System";
+  return "/usr/lib/ekora";
 }
 
 std::string servicePath(std::string_view name) {

@@ -13,7 +13,7 @@ namespace ek::paths {
 std::string runtimeDir();
 // EKORA_STATE_DIR, else /var/lib/ekora for root, $XDG_STATE_HOME/ekora or ~/.local/state/ekora.
 std::string stateDir();
-// EKORA_SYSTEM_ROOT, else /System.
+// EKORA_SYSTEM_ROOT, else /usr/lib/ekora.
 std::string systemRoot();
 
 // The socket of the Wyre service named name.

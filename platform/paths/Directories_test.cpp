@@ -77,7 +77,7 @@ TEST_F(PathsTest, EnvironmentOverridesEveryDefault) {
 
 TEST_F(PathsTest, EmptyVariableMeansUnset) {
   setenv("EKORA_SYSTEM_ROOT", "", 1);
-  EXPECT_EQ(systemRoot(), "/System");
+  EXPECT_EQ(systemRoot(), "/usr/lib/ekora");
 }
 
 TEST_F(PathsTest, RootDefaults) {
@@ -85,7 +85,7 @@ TEST_F(PathsTest, RootDefaults) {
   setenv("XDG_RUNTIME_DIR", "/run/user/0", 1);
   EXPECT_EQ(runtimeDir(), "/run/ekora");
   EXPECT_EQ(stateDir(), "/var/lib/ekora");
-  EXPECT_EQ(systemRoot(), "/System");
+  EXPECT_EQ(systemRoot(), "/usr/lib/ekora");
   EXPECT_EQ(servicePath("x"), "/run/ekora/x");
 }
 
@@ -95,7 +95,7 @@ TEST_F(PathsTest, OtherUserDefaultsFollowXdg) {
   setenv("XDG_STATE_HOME", "/home/nobody/state", 1);
   auto text = runAs(65534, [] { return runtimeDir() + "|" + stateDir() + "|" + systemRoot(); });
   ASSERT_TRUE(text);
-  EXPECT_EQ(*text, "/run/user/65534/ekora|/home/nobody/state/ekora|/System");
+  EXPECT_EQ(*text, "/run/user/65534/ekora|/home/nobody/state/ekora|/usr/lib/ekora");
 }
 
 TEST_F(PathsTest, OtherUserFallbacksWithoutXdg) {
