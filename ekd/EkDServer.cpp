@@ -10,9 +10,11 @@
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDAnnotationStore.h"
 #include "ekd/EkDPlugInHold.h"
+#include "ekd/EkDSystemVolumeWatch.h"
 #include "ekd/EkDUserPrefs.h"
 #include "ekd/EkDWyreClient.h"
 #include "platform/log/Log.h"
+#include "platform/paths/Directories.h"
 #include "platform/vantor/SqliteRegistry.h"
 
 namespace ek {
@@ -22,6 +24,7 @@ constexpr size_t kMaxHostWatches = 256;
 // Long enough that a host's burst of requests is over, short enough that the footprint is
 // back before anyone looks.
 constexpr auto kHeapTrimQuiet = std::chrono::milliseconds(500);
+constexpr auto kSystemVolumeSettle = std::chrono::milliseconds(500);
 
 std::shared_ptr<EkDServer> gServer;
 std::mutex gServerMutex;
@@ -133,7 +136,27 @@ void EkDServer::handleListenerEvent(const wyre::ListenerEvent& event) {
 }
 
 void EkDServer::run() {
+  // Bundles added to or removed from the system volume while the daemon runs are registered
+  // or unregistered without a restart. The settle time lets a package manager finish first.
+  const std::string plugIns = paths::join(paths::systemRoot(), "Library/PlugIns");
+  auto watch = EkDSystemVolumeWatch::make(wyre::ioContext(), plugIns, kSystemVolumeSettle,
+                                          [weak = weak_from_this()] {
+                                            auto self = weak.lock();
+                                            if (!self) return;
+                                            log::vr().info("rescanning the system volume");
+                                            self->registry()->rescanSystemVolume();
+                                          });
+  if (watch) {
+    systemVolumeWatch_ = std::move(watch).value();
+  } else {
+    log::vr().error("cannot watch %s: %{public}@; system plug-ins are read at start only", plugIns,
+                    watch.error());
+  }
   service_->resume();
+}
+
+void EkDServer::rescanSystemVolume() {
+  if (systemVolumeWatch_) systemVolumeWatch_->requestRescan();
 }
 
 void EkDServer::submitWork(std::function<void()> work) {
@@ -149,6 +172,7 @@ void EkDServer::memoryChurned() {
 
 void EkDServer::stop() {
   service_->cancel();
+  if (systemVolumeWatch_) systemVolumeWatch_->cancel();
   std::vector<std::shared_ptr<EkDPlugInHold>> released;
   syncQueue_->sync([&] {
     for (const auto& hold : holds_) {

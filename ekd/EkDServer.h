@@ -1,6 +1,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -26,6 +27,7 @@
 namespace ek {
 
 class EkDPlugInHold;
+class EkDSystemVolumeWatch;
 class EkDUserPrefs;
 class EkDWyreClient;
 
@@ -68,6 +70,9 @@ class EkDServer : public EkDatabase,
 
   // Starts accepting connections. The caller then runs the main run loop.
   void run();
+  // Registers and unregisters system plug-ins as the system volume now holds them (SIGHUP),
+  // a moment later and off the request threads. Any thread.
+  void rescanSystemVolume();
   // Enqueues work on the work queue "service"; the only way request work reaches it. From a
   // connection's handler, the work runs on that thread once the handler returns, which must
   // not wait for it (SerialQueue::asyncContinuation).
@@ -94,6 +99,8 @@ class EkDServer : public EkDatabase,
   // pidfd. Without a pidfd they go at the next declaration or daemon start instead.
   void watchHostExit(const AuditToken& host);
 
+  // When the server was built: the daemon's start, for its uptime.
+  std::chrono::steady_clock::time_point startTime() const { return startTime_; }
   uint32_t verbose() const { return verbose_; }
   void setVerbose(uint32_t verbose) { verbose_ = verbose; }
   const std::optional<std::string>& databasePath() const { return databasePath_; }
@@ -109,6 +116,7 @@ class EkDServer : public EkDatabase,
   EkDServer() = default;
   void handleListenerEvent(const wyre::ListenerEvent& event);
 
+  const std::chrono::steady_clock::time_point startTime_ = std::chrono::steady_clock::now();
   std::atomic<uint32_t> verbose_{0};
   std::optional<std::string> databasePath_;
   EkDPlatform platform_;
@@ -121,6 +129,7 @@ class EkDServer : public EkDatabase,
       hostWatches_;  // on syncQueue_
   std::shared_ptr<EkDUserPrefs> userPrefs_;
   std::shared_ptr<EkDHeapTrim> heapTrim_;
+  std::shared_ptr<EkDSystemVolumeWatch> systemVolumeWatch_;
 };
 
 }  // namespace ek

@@ -11,6 +11,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <functional>
 #include <iterator>
 #include <optional>
 #include <string>
@@ -105,7 +106,8 @@ void answerLongOption(int argc, char* argv[]) {
           "  EKORA_STATE_DIR    %s\n"
           "  EKORA_SYSTEM_ROOT  %s\n"
           "\n"
-          "SIGTERM or SIGINT releases every hold, removes the socket and exits 0. See ekd(8).\n",
+          "SIGTERM or SIGINT releases every hold, removes the socket and exits 0. SIGHUP\n"
+          "registers the system volume's plug-ins as they are now. See ekd(8).\n",
           std::string(ek::protocol::kServiceName).c_str(), ek::paths::runtimeDir().c_str(),
           ek::paths::stateDir().c_str(), ek::paths::systemRoot().c_str());
       std::exit(0);
@@ -207,6 +209,18 @@ int main(int argc, char* argv[]) {
     std::fflush(nullptr);
     _exit(0);
   });
+
+  // SIGHUP (systemctl reload, ekctl rescan) registers the system volume's bundles as they
+  // are now, as the watch on it does when bundles come and go.
+  asio::signal_set reload(mainLoop, SIGHUP);
+  std::function<void(const asio::error_code&, int)> onReload = [&](const asio::error_code& ec,
+                                                                   int) {
+    if (ec) return;
+    log::vr().defaultLevel("SIGHUP: rescanning the system volume");
+    server->rescanSystemVolume();
+    reload.async_wait(onReload);
+  };
+  reload.async_wait(onReload);
 
   server->run();
   auto elapsed = std::chrono::duration_cast<std::chrono::milliseconds>(

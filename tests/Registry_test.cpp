@@ -2,7 +2,9 @@
 // survives restarts and corruption.
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <fstream>
+#include <thread>
 
 #include "platform/vantor/SqliteRegistry.h"
 #include "tests/EkdProcess.h"
@@ -54,6 +56,38 @@ TEST(DaemonRegistry, SystemPlugInsAreRegisteredAtStartAndForgottenWhenRemoved) {
   auto registry = openStopped(daemon);
   ASSERT_TRUE(registry);
   EXPECT_TRUE(registry->installedPlugIns().empty());
+}
+
+// Whether ekctl finds the plug-in at path within ten seconds (present) or stops finding it.
+bool becomes(const EkdProcess& daemon, const fs::path& path, bool present) {
+  for (int i = 0; i < 100; ++i) {
+    if ((daemon.ekctl({"info", path.string()}).status == 0) == present) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  }
+  return false;
+}
+
+TEST(DaemonRegistry, SystemVolumeIsFollowedWhileRunning) {
+  EkdProcess daemon;
+  fs::path plugIns = daemon.root().path() / "System/Library/PlugIns";
+  fs::create_directories(plugIns);
+  ASSERT_TRUE(daemon.start()) << daemon.log();
+  fs::path bundle = plugIns / "SpellCheck.bundle";
+  fs::copy(fs::path(EXAMPLES_DIR) / "System/Library/PlugIns/SpellCheck.bundle",
+           daemon.root().path() / "staged", fs::copy_options::recursive);
+  fs::rename(daemon.root().path() / "staged", bundle);
+  EXPECT_TRUE(becomes(daemon, bundle, true)) << daemon.log();
+  auto status = daemon.ekctl({"status", "-o", "json"});
+  ASSERT_EQ(status.status, 0) << status.err;
+  EXPECT_NE(status.out.find("\"plugins\": 1,"), std::string::npos) << status.out;
+  EXPECT_NE(status.out.find("\"pid\": " + std::to_string(daemon.pid())), std::string::npos);
+
+  fs::remove_all(bundle);
+  EXPECT_TRUE(becomes(daemon, bundle, false)) << daemon.log();
+  // A rescan asked for (SIGHUP) leaves the daemon serving.
+  EXPECT_EQ(daemon.ekctl({"rescan"}).status, 0);
+  EXPECT_TRUE(answers(daemon));
+  EXPECT_EQ(daemon.terminate(), 0);
 }
 
 TEST(DaemonRegistry, CorruptRegistryIsSetAsideAndRebuilt) {

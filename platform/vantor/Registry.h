@@ -161,6 +161,9 @@ class Registry {
   // Moves everything the registry's log holds into its main file and gives free space back,
   // so that the file alone is the registry; the daemon asks for it when it stops.
   virtual void checkpoint() {}
+  // Brings the system volume's plug-ins up to date with the bundles there now, as at start.
+  // Takes as long as reading what changed; does nothing by default.
+  virtual void rescanSystemVolume() {}
 
   // Observers are held weakly; one that is gone is dropped.
   virtual void addObserver(std::weak_ptr<RegistryObserver> observer) = 0;

@@ -80,6 +80,7 @@ class SqliteRegistry : public Registry, public std::enable_shared_from_this<Sqli
   Uuid knowledgeUuid() override;
   void clearCaches() override;
   void checkpoint() override;
+  void rescanSystemVolume() override { reconcile(); }
   void addObserver(std::weak_ptr<RegistryObserver> observer) override;
   void removeObserver(const std::shared_ptr<RegistryObserver>& observer) override;
 
