@@ -39,6 +39,8 @@ inline constexpr std::string_view kAnnotate = "annotate";
 inline constexpr std::string_view kBulkAnnotate = "bulk-annotate";
 inline constexpr std::string_view kLock = "lock";
 inline constexpr std::string_view kFind = "find";
+// The daemon's own state, for administrators; no plug-in is involved.
+inline constexpr std::string_view kStatus = "status";
 
 // Discovery flags of "match".
 inline constexpr uint64_t kDiscoverKeepVersions = 0x1;

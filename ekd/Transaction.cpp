@@ -30,6 +30,7 @@ const std::unordered_map<std::string_view, Handler>& requestTable() {
       {protocol::kBulkAnnotate, &Transaction::bulkAnnotatePlugIns},
       {protocol::kLock, &Transaction::lockDownPlugIns},
       {protocol::kFind, &Transaction::findPlugIn},
+      {protocol::kStatus, &Transaction::reportStatus},
   };
   return table;
 }

@@ -90,6 +90,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   void bulkAnnotatePlugIns();
   void lockDownPlugIns();
   void findPlugIn();
+  // Not a plug-in request: the daemon's version, process, directories and counts.
+  void reportStatus();
   std::shared_ptr<EkDPlugIn> findPlugInByUUID(const Uuid& uuid);
   std::shared_ptr<EkDPlugIn> findPlugInByPathURL(const std::string& url);
 

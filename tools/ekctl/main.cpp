@@ -334,6 +334,9 @@ int main(int argc, char** argv) {
   list->add_option("--flags", flags);
   auto* info = app.add_subcommand("info", "show one plug-in");
   info->add_option("PLUGIN", infoTarget, "a plug-in's identifier, UUID or bundle path")->required();
+  auto* status = app.add_subcommand("status", "show the daemon's version, process and counts");
+  auto* rescan = app.add_subcommand(
+      "rescan", "have the daemon register the system volume's plug-ins as they are now");
   auto* find = app.add_subcommand("find", "look one plug-in up");
   auto* findUuid = find->add_option("--uuid", uuidText);
   auto* findUrl = find->add_option("--url", urlText);
@@ -454,6 +457,33 @@ int main(int argc, char** argv) {
           c.matchPlugIns(Dictionary{}, flags, std::move(r));
         },
         nullptr, shape);
+  }
+  if (status->parsed() || rescan->parsed()) {
+    Dictionary message{{std::string(protocol::kRequest), Value(protocol::kStatus)},
+                       {std::string(protocol::kVersion), Value(protocol::kCurrentVersion)}};
+    if (status->parsed()) {
+      return run(options, "status", [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+        c.send(std::move(message), std::move(r));
+      });
+    }
+    // The daemon rescans on SIGHUP, as systemctl reload asks it to; its status names it.
+    Shaper signal = [](Value reply) -> Result<Value> {
+      const uint64_t* pid = reply.getUnsigned("pid");
+      if (!pid || *pid == 0 || *pid > INT32_MAX) {
+        return EkError::ekora(protocol::kErrorInvalidRequest, "the daemon did not say its pid");
+      }
+      if (::kill(static_cast<pid_t>(*pid), SIGHUP) != 0) {
+        return EkError::posix(errno, fmt::format("cannot signal the daemon (pid {}): {}", *pid,
+                                                 std::strerror(errno)));
+      }
+      return Value(Dictionary{});
+    };
+    return run(
+        options, "rescan",
+        [&](EkDaemonClient& c, EkDaemonClient::Reply r) {
+          c.send(std::move(message), std::move(r));
+        },
+        nullptr, signal);
   }
   if (find->parsed()) {
     if (uuidText.empty() == urlText.empty()) usageError("find takes one of --uuid or --url");
