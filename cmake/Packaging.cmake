@@ -29,6 +29,8 @@ add_custom_target(ekora_package_files ALL DEPENDS ${ekora_compressed}
   ${PROJECT_BINARY_DIR}/changelog.gz)
 install(FILES ${PROJECT_SOURCE_DIR}/packaging/copyright ${PROJECT_BINARY_DIR}/changelog.gz
   DESTINATION ${CMAKE_INSTALL_DATAROOTDIR}/doc/ekora)
+install(FILES ${PROJECT_SOURCE_DIR}/packaging/lintian-overrides
+  DESTINATION ${CMAKE_INSTALL_DATAROOTDIR}/lintian/overrides RENAME ekora)
 
 set(CPACK_GENERATOR DEB)
 set(CPACK_PACKAGE_NAME ekora)

@@ -68,21 +68,30 @@ dpkg-deb -x "$deb" "$root" || fail "dpkg-deb could not extract the package"
 
 expected="./usr/bin/ek-sandbox-exec
 ./usr/bin/ekctl
+./usr/bin/ekctl.entitlements
 ./usr/lib/systemd/system/ekd.service
 ./usr/lib/systemd/system/ekd.socket
 ./usr/lib/systemd/user/ekd.service
 ./usr/lib/systemd/user/ekd.socket
 ./usr/sbin/ekd
+./usr/share/bash-completion/completions/ekctl
 ./usr/share/doc/ekora/changelog.gz
 ./usr/share/doc/ekora/copyright
+./usr/share/lintian/overrides/ekora
 ./usr/share/man/man1/ek-sandbox-exec.1.gz
 ./usr/share/man/man1/ekctl.1.gz
-./usr/share/man/man8/ekd.8.gz"
+./usr/share/man/man8/ekd.8.gz
+./usr/share/zsh/vendor-completions/_ekctl"
 actual=$(cd "$root" && find . ! -type d | LC_ALL=C sort)
 if [[ $actual != "$expected" ]]; then
   diff <(echo "$expected") <(echo "$actual") >&2 || true
   fail "the package holds other files than the programs, units, manual pages and documents"
 fi
+# The installed ekctl is the administrator's: an entitlements file only root may change.
+[[ $(stat -c %a "$root/usr/bin/ekctl.entitlements") == 644 ]] ||
+  fail "ekctl.entitlements is not mode 0644"
+grep -q com.corvane.private.ekora.manager "$root/usr/bin/ekctl.entitlements" ||
+  fail "the installed ekctl lacks the manager entitlement"
 grep -q '^SocketMode=0600$' "$root/usr/lib/systemd/system/ekd.socket" ||
   fail "the root instance's socket is not 0600"
 grep -q '^ListenStream=%t/ekora/com.corvane.ekora.ekd$' "$root/usr/lib/systemd/user/ekd.socket" ||
@@ -177,8 +186,12 @@ output=$(ekctl --json match '{"ZuExtensionPointIdentifier":"com.corvane.none"}')
   fail "ekctl match with unmatched rules failed"
 [[ $output != *com.corvane.spellcheck* ]] || fail "ekctl match ignored its rules"
 
+# Privileged discovery: granted to the installed ekctl, refused to a copy without its file.
+ekctl match --flags 512 >/dev/null || fail "the installed ekctl was refused a privileged match"
+cp "$root/usr/bin/ekctl" "$scratch/ekctl-plain"
 status=0
-ekctl match --flags 512 >/dev/null 2>"$scratch/refused.err" || status=$?
+timeout 15 "$scratch/ekctl-plain" -S "$service" --timeout 10 match --flags 512 >/dev/null \
+  2>"$scratch/refused.err" || status=$?
 [[ $status -eq 1 ]] || fail "an unauthorized match exited $status, expected 1"
 grep -q '^ekctl: error 11: ' "$scratch/refused.err" || fail "no error line for the refused match"
 
