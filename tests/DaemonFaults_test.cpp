@@ -4,7 +4,6 @@
 #include <unistd.h>
 
 #include <filesystem>
-#include <fstream>
 #include <thread>
 
 #include "platform/cbor/Cbor.h"
@@ -26,15 +25,6 @@ std::vector<uint8_t> frameWithBody(std::vector<uint8_t> body) {
   auto bytes = header(static_cast<uint32_t>(body.size()), wyre::kFlagWantsReply, 1);
   bytes.insert(bytes.end(), body.begin(), body.end());
   return bytes;
-}
-
-long residentKiB(pid_t pid) {
-  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
-  }
-  return -1;
 }
 
 class DaemonFaults : public ::testing::Test {

@@ -272,4 +272,13 @@ std::string replyError(const Value& reply) {
   return text ? *text : std::string();
 }
 
+long residentKiB(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
+  }
+  return -1;
+}
+
 }  // namespace ek::test

@@ -102,6 +102,9 @@ std::string ekctlWithEntitlements(const std::filesystem::path& dir,
 int64_t replyErrorCode(const Value& reply);
 std::string replyError(const Value& reply);
 
+// A process's resident memory in KiB, or -1 when it cannot be read.
+long residentKiB(pid_t pid);
+
 // The paths of the built programs.
 std::string ekdPath();
 std::string ekctlPath();
