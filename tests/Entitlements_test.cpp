@@ -12,14 +12,12 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr const char* kEntitlements = R"(<?xml version="1.0" encoding="UTF-8"?>
-<dmap version="1.0">
-<dict>
-	<key>com.corvane.private.ekora.manager</key>
-	<true/>
-</dict>
-</dmap>
-)";
+// The manager entitlement with the given dmap value.
+std::string entitlements(const std::string& value) {
+  return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<dmap version=\"1.0\">\n<dict>\n"
+         "\t<key>com.corvane.private.ekora.manager</key>\n\t" +
+         value + "\n</dict>\n</dmap>\n";
+}
 
 class Entitlements : public ::testing::Test {
  protected:
@@ -27,12 +25,13 @@ class Entitlements : public ::testing::Test {
   void TearDown() override { EXPECT_EQ(daemon_.terminate(), 0); }
 
   // A copy of ekctl with an entitlements file of the given mode and owner beside it.
-  std::string ekctlCopy(const std::string& name, mode_t mode, uid_t owner) {
+  std::string ekctlCopy(const std::string& name, mode_t mode, uid_t owner,
+                        const std::string& value = "<true/>") {
     fs::path dir = daemon_.root().path() / name;
     fs::create_directories(dir);
     fs::path program = dir / "ekctl";
     fs::copy_file(ekctlPath(), program);
-    std::ofstream(program.string() + ".entitlements") << kEntitlements;
+    std::ofstream(program.string() + ".entitlements") << entitlements(value);
     std::string entitlements = program.string() + ".entitlements";
     EXPECT_EQ(chmod(entitlements.c_str(), mode), 0);
     EXPECT_EQ(chown(entitlements.c_str(), owner, static_cast<gid_t>(-1)), 0);
@@ -56,6 +55,24 @@ TEST_F(Entitlements, FileOwnedAndWritableOnlyByTheOwnerIsHonoured) {
   std::string program = ekctlCopy("trusted", 0644, geteuid());
   ask(program);
   EXPECT_FALSE(refusalLogged(program)) << daemon_.log();
+}
+
+// Held when present and not false, whatever else the value is: privileged discovery shows it.
+TEST_F(Entitlements, AnEntitlementIsHeldUnlessItIsFalse) {
+  const struct {
+    const char* name;
+    const char* value;
+    int status;
+  } cases[] = {{"true", "<true/>", 0},
+               {"zero", "<integer>0</integer>", 0},
+               {"text", "<string>no</string>", 0},
+               {"false", "<false/>", 1}};
+  for (const auto& c : cases) {
+    std::string program = ekctlCopy(c.name, 0644, geteuid(), c.value);
+    auto result = runCommand({program, "-S", daemon_.service(), "match", "--flags", "512"},
+                             daemon_.environment());
+    EXPECT_EQ(result.status, c.status) << c.name << ": " << result.err;
+  }
 }
 
 TEST_F(Entitlements, FileWritableByOthersGrantsNothing) {

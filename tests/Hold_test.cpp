@@ -7,6 +7,7 @@
 
 #include <chrono>
 #include <filesystem>
+#include <fstream>
 #include <thread>
 
 #include <fmt/format.h>
@@ -216,6 +217,24 @@ TEST_F(HoldRequests, ReadyDeclaresThePlugInForTheHost) {
   EXPECT_EQ(replyError(environment),
             "Transmission of environment variables requires the "
             "com.corvane.developer.ekora.provide-environment host entitlement");
+}
+
+// A bundle that declares no executable is launched as the bundle itself.
+TEST_F(HoldRequests, ReadyOfAPlugInWithoutExecutableDeclaresIt) {
+  fs::path info = fs::path(notesShare()) / "Info.dmap";
+  auto dictionary = dmap::readFile(info.string());
+  ASSERT_TRUE(dictionary.ok());
+  dictionary->dictionary()->erase("QvBundleExecutable");
+  auto text = dmap::write(*dictionary);
+  ASSERT_TRUE(text.ok());
+  std::ofstream(info) << *text;
+  ASSERT_EQ(replyErrorCode(ask(request("add", {{"paths", Value(Array{Value(app("Notes"))})}}))), 0);
+  Value found = ask(request("find", {{"paths", Value("file://" + notesShare())}}));
+  const Value* form = found.get("matches");
+  ASSERT_TRUE(form && form->getDictionary("bundleInfo")) << found.description();
+  ASSERT_FALSE(form->getDictionary("bundleInfo")->contains("QvBundleExecutable"));
+  Value ready = ask(request("ready", {{"uuids", Value(Array{Value(uuidOf(notesShare()))})}}));
+  EXPECT_EQ(replyErrorCode(ready), 0) << ready.description();
 }
 
 TEST_F(HoldRequests, DeclarationsOfAnExitedHostArePrunedAndALiveHostsStay) {
