@@ -120,6 +120,11 @@ Result<Value> onePlugInNamed(Value reply, const std::string& identifier) {
 
 std::optional<std::string> nextStep(std::string_view command, const EkError& error,
                                     const std::string& executable) {
+  if (command == "add" && error.code == protocol::kErrorRegistry) {
+    return std::string(
+        "the daemon's log names the file and what is wrong with it (journalctl --user -u ekd, "
+        "or the daemon's standard error)");
+  }
   if (error.code != protocol::kErrorNotPermitted) return std::nullopt;
   if (command != "remove" && command != "match" && command != "list") return std::nullopt;
   return fmt::format(
