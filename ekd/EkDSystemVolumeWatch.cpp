@@ -6,6 +6,7 @@
 #include <asio/post.hpp>
 
 #include <cerrno>
+#include <cstring>
 
 #include "platform/log/Log.h"
 
@@ -55,9 +56,10 @@ void EkDSystemVolumeWatch::readEvents() {
         if (!self || error) return;
         bool gone = false;
         for (size_t offset = 0; offset + sizeof(inotify_event) <= size;) {
-          const auto* event = reinterpret_cast<const inotify_event*>(self->buffer_ + offset);
-          gone = gone || (event->mask & (IN_DELETE_SELF | IN_MOVE_SELF | IN_IGNORED));
-          offset += sizeof(inotify_event) + event->len;
+          inotify_event event;
+          std::memcpy(&event, self->buffer_ + offset, sizeof event);
+          gone = gone || (event.mask & (IN_DELETE_SELF | IN_MOVE_SELF | IN_IGNORED));
+          offset += sizeof event + event.len;
         }
         self->settleThenRescan();
         if (gone) {

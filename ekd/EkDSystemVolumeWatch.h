@@ -7,6 +7,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
@@ -55,7 +56,7 @@ class EkDSystemVolumeWatch : public std::enable_shared_from_this<EkDSystemVolume
   std::shared_ptr<SerialQueue> queue_;
   std::atomic<bool> queued_{false};
   std::atomic<bool> watching_{false};
-  char buffer_[8192];  // on strand_
+  alignas(alignof(uint32_t)) char buffer_[8192];  // on strand_
 };
 
 }  // namespace ek

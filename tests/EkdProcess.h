@@ -102,6 +102,15 @@ std::string ekctlWithEntitlements(const std::filesystem::path& dir,
 int64_t replyErrorCode(const Value& reply);
 std::string replyError(const Value& reply);
 
+// Whether the programs are built with a sanitizer. Its runtime keeps freed memory in quarantine
+// and needs descriptors of its own for its checks, so bounds on the daemon's memory and on
+// running out of descriptors cannot be judged then.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+inline constexpr bool kSanitized = true;
+#else
+inline constexpr bool kSanitized = false;
+#endif
+
 // A process's resident memory in KiB, or -1 when it cannot be read.
 long residentKiB(pid_t pid);
 

@@ -227,7 +227,10 @@ TEST_F(HostileConnection, OtherUsersAreRefused) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to connect as another user";
 
   // Opened up as a careless administrator might: the uid check at accept still holds.
-  for (fs::path p = daemon_->socketPath(); p.has_relative_path(); p = p.parent_path()) {
+  // Only the daemon's own directories: what lies above them is the system's.
+  const fs::path root = daemon_->root().path();
+  for (fs::path p = daemon_->socketPath(); p.has_relative_path() && p != root.parent_path();
+       p = p.parent_path()) {
     chmod(p.c_str(), p == daemon_->socketPath() ? 0666 : 0755);
   }
   for (int attempt = 0; attempt < 2; ++attempt) {
@@ -269,7 +272,9 @@ TEST_F(HostileConnection, FloodOfMessagesWantingNoReplyIsBounded) {
   ::shutdown(flooder.fd(), SHUT_RDWR);
   flood.join();
   EXPECT_GT(sent.load(), static_cast<int>(wyre::kMaxWaitingMessages));
-  EXPECT_LT(peak - baseline, 64 * 1024) << "KiB grown while flooded";
+  if (!kSanitized) {
+    EXPECT_LT(peak - baseline, 64 * 1024) << "KiB grown while flooded";
+  }
 }
 
 // (e) A frame left half-sent is closed after 10 s, and holds nothing after.
@@ -340,7 +345,13 @@ TEST(HostileDescriptors, ConnectionsAreBoundedAndTheDaemonRecoversFromRunningOut
   extra.clear();
 
   // Now out of descriptors altogether: a descriptor takes the lowest free number, and no
-  // number from there on may be used.
+  // number from there on may be used. A sanitizer's runtime needs descriptors for its own
+  // checks and reports false errors without them.
+  if (kSanitized) {
+    flood.clear();
+    EXPECT_EQ(daemon.terminate(), 0) << daemon.log();
+    return;
+  }
   std::set<int> open;
   for (const auto& entry :
        fs::directory_iterator("/proc/" + std::to_string(daemon.pid()) + "/fd")) {
