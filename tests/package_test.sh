@@ -175,6 +175,10 @@ echo "raw match: $reply"
 [[ $reply == *com.corvane.spellcheck* ]] || fail "the raw match reply lacks the system plug-in"
 [[ -f $state/registry.db ]] || fail "ekd kept no registry in EKORA_STATE_DIR"
 
+output=$(ekctl status -o json) || fail "ekctl status failed"
+[[ $output == *"\"pid\": $ekd_pid,"* ]] || fail "ekctl status did not name the daemon: $output"
+[[ $output == *'"plugins": 1,'* ]] || fail "ekctl status did not count the system plug-in: $output"
+
 output=$(ekctl match) || fail "ekctl match failed"
 [[ $output == *com.corvane.spellcheck* ]] || fail "ekctl match did not list the system plug-in"
 
