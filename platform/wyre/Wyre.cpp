@@ -32,9 +32,6 @@ namespace {
 using asio::local::stream_protocol;
 
 constexpr size_t kReadChunk = 64 * 1024;
-// Free space below this grows (or compacts) the input buffer before the next read; the
-// buffer only grows with bytes actually received, never with a header's promise.
-constexpr size_t kMinReadSpace = 16 * 1024;
 // Frames gathered into one write call.
 constexpr size_t kMaxGather = 64;
 // Descriptors the process keeps for itself (database, bundles, log) below its limit, and what
