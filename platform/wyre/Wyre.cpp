@@ -266,24 +266,24 @@ void Connection::close(std::string_view reason) {
 
 void Connection::readMore() {
   if (reading_ || closed_) return;
-  if (waitingFull()) {
-    // Resumed when a waiting message is released. Checked again after setting the flag: the
-    // last release may have come in between.
-    resumeOnRelease_ = true;
-    if (waitingFull()) return;
-    resumeOnRelease_ = false;
-  }
-  if (heldStart_ < held_.size() && held_.size() - heldStart_ >= kHeaderSize) {
-    // Frames read past a pause come first.
-    FrameHeader header = decodeHeader(held_.data() + heldStart_);
-    if (held_.size() - heldStart_ >= kHeaderSize + header.length) {
-      parseHeldInput();
-      if (closed_) return;
-      if (waitingFull()) {
-        readMore();
-        return;
-      }
+  // Frames read past a pause come first, until none is whole or the waiting are full again.
+  // A release may come at any moment from another thread, also between parsing stopping for
+  // a full queue and the check after it: so the held frames are looked at again each time.
+  for (;;) {
+    if (waitingFull()) {
+      // Resumed when a waiting message is released. Checked again after setting the flag:
+      // the last release may have come in between.
+      resumeOnRelease_ = true;
+      if (waitingFull()) return;
+      resumeOnRelease_ = false;
     }
+    size_t held = held_.size() - heldStart_;
+    if (heldStart_ >= held_.size() || held < kHeaderSize) break;
+    FrameHeader header = decodeHeader(held_.data() + heldStart_);
+    // One too large is refused by the parse.
+    if (header.length <= kMaxBodySize && held < kHeaderSize + header.length) break;
+    parseHeldInput();
+    if (closed_) return;
   }
   if (gHeldInput.load(std::memory_order_relaxed) >= kMaxHeldInputTotal) {
     log::process().throttled(gPauseThrottle, log::Level::Error,
