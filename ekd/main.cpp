@@ -222,7 +222,8 @@ int main(int argc, char* argv[]) {
   };
   reload.async_wait(onReload);
 
-  server->run();
+  // The socket listens already (clients wait in its backlog): the line comes out before any
+  // answer does.
   auto elapsed = std::chrono::duration_cast<std::chrono::milliseconds>(
       std::chrono::steady_clock::now() - startTime);
   log::ops().defaultLevel(
@@ -230,6 +231,8 @@ int main(int argc, char* argv[]) {
       server->service()->path(), server->service()->activated() ? " (socket-activated)" : "",
       static_cast<unsigned long long>(server->registry()->installedPlugIns().size()),
       static_cast<unsigned long long>(elapsed.count()));
+  log::flush();
+  server->run();
   auto guard = asio::make_work_guard(mainLoop);
   mainLoop.run();
   return 0;
