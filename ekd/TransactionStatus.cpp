@@ -24,7 +24,7 @@ void Transaction::reportStatus() {
   reply()["socket"] = Value(daemon.service()->path());
   reply()["state"] = Value(paths::stateDir());
   reply()["system"] = Value(paths::systemRoot());
-  reply()["plugins"] = Value(static_cast<uint64_t>(daemon.registry()->installedPlugIns().size()));
+  reply()["plugins"] = Value(static_cast<uint64_t>(daemon.registry()->queryUuids({}).size()));
   reply()["connections"] = Value(static_cast<uint64_t>(daemon.service()->connectionCount()));
   reply()["holds"] = Value(static_cast<uint64_t>(daemon.holdCount()));
   done();

@@ -229,7 +229,7 @@ int main(int argc, char* argv[]) {
   log::ops().defaultLevel(
       "ekd %s listening on %s%s, %llu plug-ins registered, started in %llu ms", EKORA_VERSION,
       server->service()->path(), server->service()->activated() ? " (socket-activated)" : "",
-      static_cast<unsigned long long>(server->registry()->installedPlugIns().size()),
+      static_cast<unsigned long long>(server->registry()->queryUuids({}).size()),
       static_cast<unsigned long long>(elapsed.count()));
   log::flush();
   server->run();
