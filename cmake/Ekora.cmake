@@ -37,6 +37,24 @@ function(ek_library name)
   target_link_libraries(${name} PUBLIC ${ARG_DEPS})
 endfunction()
 
+# A test file's own code is compiled without optimisation: optimising GoogleTest's macros is
+# most of what compiling a test costs, and the code under test, in its libraries, keeps the
+# build's optimisation.
+set(EKORA_TEST_OPTIONS ${EKORA_WARNINGS} -O0)
+
+# The headers every test file includes, compiled once for all of them.
+function(ek_test_pch)
+  if(TARGET ek_test_pch)
+    return()
+  endif()
+  file(WRITE ${PROJECT_BINARY_DIR}/ek_test_pch.cpp "")
+  add_library(ek_test_pch OBJECT ${PROJECT_BINARY_DIR}/ek_test_pch.cpp)
+  target_compile_options(ek_test_pch PRIVATE ${EKORA_TEST_OPTIONS})
+  target_link_libraries(ek_test_pch PRIVATE GTest::gtest GTest::gmock)
+  target_precompile_headers(ek_test_pch PRIVATE <gtest/gtest.h> <gmock/gmock.h> <chrono>
+    <functional> <map> <memory> <optional> <string> <thread> <variant> <vector>)
+endfunction()
+
 # ek_test(NAME SOURCES... DEPS ... [LABELS ...]): a GoogleTest binary registered with CTest.
 # With EKORA_BUILD_TESTS off the binary is still defined (folders may refer to it) but neither
 # built by default nor registered.
@@ -48,8 +66,11 @@ function(ek_test name)
     return()
   endif()
   add_executable(${name} ${ARG_SOURCES})
-  target_compile_options(${name} PRIVATE ${EKORA_WARNINGS})
+  target_compile_options(${name} PRIVATE ${EKORA_TEST_OPTIONS})
+  target_compile_definitions(${name} PRIVATE EXAMPLES_DIR="${PROJECT_SOURCE_DIR}/examples")
   target_link_libraries(${name} PRIVATE ${ARG_DEPS} GTest::gtest GTest::gtest_main GTest::gmock)
+  ek_test_pch()
+  target_precompile_headers(${name} REUSE_FROM ek_test_pch)
   include(GoogleTest)
   # One label per test binary: unit (default), concurrency (also run under the thread
   # sanitizer), e2e (starts the real daemon; also run under the thread sanitizer).

@@ -577,7 +577,7 @@ TEST_F(EkDAnnotationStoreTest, TemporariesOfAKilledDaemonAreRemovedAtOpening) {
 // ---- Plug-ins --------------------------------------------------------------------------------
 
 TEST_F(EkDAnnotationStoreTest, PlugInsSharingAnAnnotationKeyShareOneAnnotation) {
-  fs::path examples = fs::path(__FILE__).parent_path().parent_path() / "examples";
+  fs::path examples = EXAMPLES_DIR;
   Result<Value> info = dmap::readFile(
       (examples / "Applications/Viewer.app/PlugIns/Thumbs.appex/Info.dmap").string());
   ASSERT_TRUE(info.ok());

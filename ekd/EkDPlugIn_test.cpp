@@ -31,7 +31,7 @@ constexpr std::string_view kReplacePlugIn = "com.corvane.developer.replace-plugi
 constexpr double kRegistered = 1700000000.75;
 
 fs::path examplesDir() {
-  return fs::path(__FILE__).parent_path().parent_path() / "examples";
+  return EXAMPLES_DIR;
 }
 
 // The Info.dmap of one of the example bundles, as the registry would hand it out.
