@@ -10,6 +10,7 @@
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDFormCache.h"
 #include "ekd/EkDPlugIn.h"
+#include "ekd/EkDPlugInHold.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDUserPrefs.h"
 #include "ekd/EkDWyreClient.h"
@@ -152,6 +153,8 @@ void Transaction::matchPlugIns() {
   std::unordered_map<std::string, MatchRef> overrides;
   const Dictionary* matchRules = rules ? &*rules : nullptr;
   EkDFormCache& forms = database.formCache();
+  // The holds as they stand now decide for every candidate.
+  const std::shared_ptr<const EkDPlugInHolds> holds = database.holds();
   for (const auto& plugIn : candidates) {
     EkDPlugIn::CurrentInfoRef current = plugIn->currentInfo();
     if (!all) {
@@ -163,7 +166,7 @@ void Transaction::matchPlugIns() {
         auto path = plugIn->path();
         if (!pluginsPath || !path || !path->starts_with(*pluginsPath)) continue;
       }
-      if (database.holdOnPlugIn(*plugIn)) continue;
+      if (holds->blocks(*plugIn)) continue;
     }
     if (!plugIn->match(matchRules, *current)) continue;
     bool excluded = false;

@@ -5,6 +5,7 @@
 #include "Ekora/EkProtocol.h"
 #include "Ekora/EkSandboxExtension.h"
 #include "ekd/EkDPlugIn.h"
+#include "ekd/EkDPlugInHold.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDWyreClient.h"
 #include "ekd/Transaction.h"
@@ -29,11 +30,12 @@ void Transaction::readyPlugIns() {
   EkDServer& database = server();
   std::vector<std::shared_ptr<EkDPlugIn>> accepted;
   std::unordered_set<Uuid> seen;
+  const std::shared_ptr<const EkDPlugInHolds> holds = database.holds();
   bool walked = processUuidList([&](const std::shared_ptr<EkDPlugIn>& plugIn) {
     std::string uuid = plugIn->uuid().string();
     std::string identifier = plugIn->identifier().value_or("(null)");
     EK_PROBE1(plugin_ready, uuid.c_str());
-    if (database.holdOnPlugIn(*plugIn)) {
+    if (holds->blocks(*plugIn)) {
       log::ops().defaultLevel(
           "denied access to %d for plugin %{public}@(%{public}@): the plug-in is on hold",
           client_->pid(), identifier, uuid);
