@@ -85,7 +85,9 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
   // without waking another thread, and handlers run one at a time all the same. The database
   // is theirs: its cache and annotations are touched on this queue only.
   server->mainQueue_ = SerialQueue::make("service", wyre::ioContext());
-  if (!server->initWithStore(store.get(), std::move(databasePlatform), server->mainQueue_)) {
+  server->database_ = std::make_shared<EkDatabase>();
+  if (!server->database_->initWithStore(store.get(), std::move(databasePlatform),
+                                        server->mainQueue_)) {
     return nullptr;
   }
   server->userPrefs_ = EkDUserPrefs::init(server->platform_.preferences);
@@ -102,8 +104,10 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
     std::lock_guard lock(gServerMutex);
     gServer = server;
   }
-  server->setDelegate(std::static_pointer_cast<EkDatabaseDelegate>(server));
-  server->registry()->addObserver(std::static_pointer_cast<vantor::RegistryObserver>(server));
+  server->database_->setDelegate([weak = std::weak_ptr<EkDServer>(server)](const auto& plugIns) {
+    if (auto self = weak.lock()) self->removedPlugIns(plugIns);
+  });
+  server->registry()->addObserver(server->database_);
   // The listener holds the server weakly: the process-wide reference keeps it alive.
   std::weak_ptr<EkDServer> weak = server;
   server->service_->setEventHandler([weak](const wyre::ListenerEvent& event) {
@@ -119,7 +123,7 @@ std::shared_ptr<EkDServer> EkDServer::server() {
 
 void EkDServer::handleListenerEvent(const wyre::ListenerEvent& event) {
   if (event.connection) {
-    EkDWyreClient::initWithConnection(event.connection, self());
+    EkDWyreClient::initWithConnection(event.connection, shared_from_this());
     return;
   }
   if (event.error && event.error->domain == wyre::kErrorDomain &&
@@ -140,7 +144,7 @@ void EkDServer::run() {
   // or unregistered without a restart. The settle time lets a package manager finish first.
   const std::string plugIns = paths::join(paths::systemRoot(), "Library/PlugIns");
   auto watch = EkDSystemVolumeWatch::make(wyre::ioContext(), plugIns, kSystemVolumeSettle,
-                                          [weak = std::weak_ptr<EkDServer>(self())] {
+                                          [weak = weak_from_this()] {
                                             auto self = weak.lock();
                                             if (!self) return;
                                             log::vr().info("rescanning the system volume");
@@ -180,8 +184,8 @@ void EkDServer::stop() {
     }
     holds.clear();
   });
-  notifier()->post(protocol::kAnnotationChangeNotification);
-  workspace()->checkpoint();
+  platform_.notifier->post(protocol::kAnnotationChangeNotification);
+  registry()->checkpoint();
 }
 
 void EkDServer::changeHolds(
@@ -218,17 +222,16 @@ void EkDServer::watchHostExit(const AuditToken& host) {
   auto watch = std::make_shared<asio::posix::stream_descriptor>(wyre::ioContext(), fd);
   hostWatches_.emplace(host.pid, watch);
   // A pidfd becomes readable when its process has exited.
-  watch->async_wait(
-      asio::posix::stream_descriptor::wait_read,
-      [weak = std::weak_ptr<EkDServer>(self()), pid = host.pid](const asio::error_code& error) {
-        auto server = weak.lock();
-        if (!server || error == asio::error::operation_aborted) return;
-        server->mainQueue_->async([server, pid] {
-          server->hostWatches_.erase(pid);
-          log::ops().debug("host %d exited: pruning its service declarations", pid);
-          server->platform_.serviceManager->pruneDeclarations();
-        });
-      });
+  watch->async_wait(asio::posix::stream_descriptor::wait_read,
+                    [weak = weak_from_this(), pid = host.pid](const asio::error_code& error) {
+                      auto server = weak.lock();
+                      if (!server || error == asio::error::operation_aborted) return;
+                      server->mainQueue_->async([server, pid] {
+                        server->hostWatches_.erase(pid);
+                        log::ops().debug("host %d exited: pruning its service declarations", pid);
+                        server->platform_.serviceManager->pruneDeclarations();
+                      });
+                    });
 }
 
 void EkDServer::addHold(std::shared_ptr<EkDPlugInHold> hold) {
@@ -247,7 +250,7 @@ void EkDServer::addHold(std::shared_ptr<EkDPlugInHold> hold) {
     holds.push_back(hold);
     added = true;
   });
-  if (added) notifier()->post(protocol::kAnnotationChangeNotification);
+  if (added) platform_.notifier->post(protocol::kAnnotationChangeNotification);
 }
 
 void EkDServer::unholdToken(const Uuid& token) {
@@ -263,7 +266,7 @@ void EkDServer::unholdToken(const Uuid& token) {
         }
       }
     });
-    if (released) notifier()->post(protocol::kAnnotationChangeNotification);
+    if (released) platform_.notifier->post(protocol::kAnnotationChangeNotification);
   }
 }
 
@@ -278,7 +281,8 @@ void EkDServer::unholdClient(const std::shared_ptr<EkDWyreClient>& client) {
       return true;
     });
   });
-  for (size_t i = 0; i < released; ++i) notifier()->post(protocol::kAnnotationChangeNotification);
+  for (size_t i = 0; i < released; ++i)
+    platform_.notifier->post(protocol::kAnnotationChangeNotification);
 }
 
 size_t EkDServer::holdCount() {

@@ -53,10 +53,9 @@ struct EkDPlatform {
   static EkDPlatform system();
 };
 
-// The daemon's one server: owns the listener, the work queue on which every request runs,
-// and the list of holds. It is also the plug-in database, and that
-// database's delegate.
-class EkDServer : public EkDatabase, public EkDatabaseDelegate {
+// The daemon's one server: owns the listener, the work queue on which every request runs, the
+// plug-in database that belongs to that queue, and the list of holds.
+class EkDServer : public std::enable_shared_from_this<EkDServer> {
  public:
   // Answers nullptr when the server cannot be built (for instance, the service cannot be
   // listened on); the reason is logged.
@@ -94,7 +93,8 @@ class EkDServer : public EkDatabase, public EkDatabaseDelegate {
   // every answer is in, on a queue of its own. Returns at once.
   void terminatePlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns,
                         std::function<void()> reply);
-  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) override;
+  // The database's delegate: installed plug-ins are going away.
+  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns);
   // Prunes the service declarations once this host has exited: one watch per host, on its
   // pidfd. Without a pidfd they go at the next declaration or daemon start instead. Runs on
   // the work queue.
@@ -106,6 +106,8 @@ class EkDServer : public EkDatabase, public EkDatabaseDelegate {
   void setVerbose(uint32_t verbose) { verbose_ = verbose; }
   const std::optional<std::string>& databasePath() const { return databasePath_; }
 
+  // The plug-in database; used on mainQueue() only.
+  EkDatabase& database() const { return *database_; }
   const EkDPlatform& platform() const { return platform_; }
   const std::shared_ptr<vantor::Registry>& registry() const { return platform_.registry; }
   const std::shared_ptr<EkDUserPrefs>& userPrefs() const { return userPrefs_; }
@@ -114,9 +116,6 @@ class EkDServer : public EkDatabase, public EkDatabaseDelegate {
 
  private:
   EkDServer() = default;
-  std::shared_ptr<EkDServer> self() {
-    return std::static_pointer_cast<EkDServer>(EkDatabase::shared_from_this());
-  }
   void handleListenerEvent(const wyre::ListenerEvent& event);
   // Replaces the holds in force with what change makes of a copy of them. The released holds
   // end after the lock is left: a hold's last reference may be the old list's.
@@ -126,6 +125,7 @@ class EkDServer : public EkDatabase, public EkDatabaseDelegate {
   std::atomic<uint32_t> verbose_{0};
   std::optional<std::string> databasePath_;
   EkDPlatform platform_;
+  std::shared_ptr<EkDatabase> database_;
   std::shared_ptr<SerialQueue> wyreQueue_;
   std::shared_ptr<SerialQueue> mainQueue_;  // "service": every request runs here
   std::shared_ptr<wyre::Listener> service_;

@@ -45,8 +45,8 @@ bool EkDatabase::initWithStore(std::unique_ptr<EkDAnnotationStore> store,
   annotations_ = std::move(store);
   if (!annotations_) return false;
   owner_ = owner ? std::move(owner) : SerialQueue::make("EkDatabase");
-  // The registry holds observers weakly; the owner registers this database once it is shared
-  // (see EkDServer), since a base class cannot hand out its owner's reference.
+  // The registry holds observers weakly: whoever shares this database registers it (see
+  // EkDServer).
   return true;
 }
 
@@ -60,7 +60,7 @@ EkDPlugInContext EkDatabase::recordContext() {
   return context;
 }
 
-void EkDatabase::setDelegate(std::weak_ptr<EkDatabaseDelegate> delegate) {
+void EkDatabase::setDelegate(EkDatabaseDelegate delegate) {
   delegate_ = std::move(delegate);
 }
 
@@ -392,7 +392,7 @@ void EkDatabase::pluginsWillUninstall(const std::vector<vantor::PlugInProxyPtr>&
   } else {
     owner_->async(std::move(forget));
   }
-  if (auto delegate = delegate_.lock()) delegate->removedPlugIns(plugIns);
+  if (delegate_) delegate_(plugIns);
 }
 
 }  // namespace ek

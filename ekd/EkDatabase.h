@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <span>
@@ -25,13 +26,8 @@ namespace ek {
 
 using EkDPlugInRef = std::shared_ptr<EkDPlugIn>;
 
-// Told when installed plug-ins are about to go away.
-class EkDatabaseDelegate {
- public:
-  virtual ~EkDatabaseDelegate() = default;
-  // Called on the registry's notice thread.
-  virtual void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) = 0;
-};
+// Told when installed plug-ins are about to go away, on the registry's notice thread.
+using EkDatabaseDelegate = std::function<void(const std::vector<vantor::PlugInProxyPtr>& plugIns)>;
 
 // What the database needs from the platform.
 struct EkDatabasePlatform {
@@ -61,6 +57,7 @@ struct EkDatabasePlatform {
 class EkDatabase : public vantor::RegistryObserver,
                    public std::enable_shared_from_this<EkDatabase> {
  public:
+  EkDatabase() = default;
   ~EkDatabase() override;
 
   // Fails only when the annotation store cannot be opened. owner is the queue the database
@@ -122,7 +119,8 @@ class EkDatabase : public vantor::RegistryObserver,
   void pluginsWillUninstall(const std::vector<vantor::PlugInProxyPtr>& plugIns) override;
   void localeDidChange() override;
 
-  void setDelegate(std::weak_ptr<EkDatabaseDelegate> delegate);
+  // Set before the registry's notices may arrive.
+  void setDelegate(EkDatabaseDelegate delegate);
   uint32_t cacheLimit() const { return cacheLimit_.load(); }
   void setCacheLimit(uint32_t limit) { cacheLimit_ = limit; }
   size_t cacheCount() const;
@@ -142,16 +140,13 @@ class EkDatabase : public vantor::RegistryObserver,
   // "=1" and "1" give "1"; an empty value or one starting with an operator gives nothing.
   static std::optional<std::string> normalizeElection(const Value& value);
 
- protected:
-  EkDatabase() = default;
-
  private:
   // Whether a candidate's election is one of elections.
   bool electionFilter(const std::vector<std::string>& elections, const std::string& identifier,
                       const Dictionary& entitlements);
   EkDPlugInContext recordContext();
 
-  std::weak_ptr<EkDatabaseDelegate> delegate_;
+  EkDatabaseDelegate delegate_;
   std::atomic<uint32_t> cacheLimit_{1000000};
   EkDatabasePlatform platform_;
   std::unique_ptr<EkDAnnotationStore> annotations_;

@@ -22,10 +22,10 @@ namespace fs = std::filesystem;
 constexpr std::string_view kAutoElect = "com.corvane.developer.auto-elect-plugin";
 constexpr std::string_view kReplacePlugIn = "com.corvane.developer.replace-plugin";
 
-class TestDatabase : public EkDatabase, public EkDatabaseDelegate {
+// A database that is its own delegate.
+class TestDatabase : public EkDatabase {
  public:
-  TestDatabase() = default;
-  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) override {
+  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) {
     std::lock_guard lock(mutex);
     removed.push_back(plugIns);
   }
@@ -77,7 +77,7 @@ class DatabaseTest : public ::testing::Test {
     database_ = std::make_shared<TestDatabase>();
     ASSERT_TRUE(
         database_->initWithDatabase(annotationPath(), {registry_, nullptr, "/System", notifier_}));
-    database_->setDelegate(database_);
+    database_->setDelegate([this](const auto& plugIns) { database_->removedPlugIns(plugIns); });
     registry_->addObserver(database_);
   }
 

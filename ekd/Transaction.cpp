@@ -268,7 +268,7 @@ bool Transaction::processUuidList(const PlugInStep& step) {
       paths = value->array();
     }
   }
-  EkDServer& database = server();
+  EkDatabase& database = server().database();
   for (size_t i = 0; i < uuids->size(); ++i) {
     const Uuid* uuid = (*uuids)[i].uuid();
     if (!uuid) {

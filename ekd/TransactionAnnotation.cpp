@@ -40,7 +40,7 @@ void failStore(Transaction& transaction, const EkError& error) {
 
 // Whatever way the request ends, what it changed reaches the disk before the reply leaves; when
 // it cannot, the changes are undone and the reply says so instead.
-void commitBeforeReply(Transaction& transaction, EkDServer& database) {
+void commitBeforeReply(Transaction& transaction, EkDatabase& database) {
   transaction.beforeReply([&transaction, &database] {
     Result<void> committed = database.commitAnnotationChanges();
     if (committed.ok()) return;
@@ -93,7 +93,7 @@ void Transaction::annotatePlugIns() {
 
   const Value changeValue(change);
   auto election = change.find(kElection);
-  EkDServer& database = server();
+  EkDatabase& database = server().database();
   database.beginAnnotationChanges();
   commitBeforeReply(*this, database);
   bool walked = processUuidList([&](const std::shared_ptr<EkDPlugIn>& plugIn) {
@@ -128,7 +128,7 @@ void Transaction::bulkAnnotatePlugIns() {
     return;
   }
   log::ops().debug("bulk change requested for %u plug-ins", annotations->size());
-  EkDServer& database = server();
+  EkDatabase& database = server().database();
   database.beginAnnotationChanges();
   commitBeforeReply(*this, database);
   for (const auto& [key, value] : *annotations) {

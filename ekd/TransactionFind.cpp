@@ -12,14 +12,14 @@
 namespace ek {
 
 std::shared_ptr<EkDPlugIn> Transaction::findPlugInByUUID(const Uuid& uuid) {
-  return server().findPlugIn(uuid);
+  return server().database().findPlugIn(uuid);
 }
 
 std::shared_ptr<EkDPlugIn> Transaction::findPlugInByPathURL(const std::string& text) {
   // A URL, not a bare path: text that does not parse as one locates nothing.
   auto url = EkFileURL::parse(text);
   if (!url) return nullptr;
-  return server().findPlugInAtPath(url->string());
+  return server().database().findPlugInAtPath(url->string());
 }
 
 void Transaction::findPlugIn() {
@@ -39,14 +39,14 @@ void Transaction::findPlugIn() {
   log::ops().defaultLevel("plugin found %{public}@", *plugIn);
   // The kept encoded form, with what this request adds to it, as a match's reply carries it.
   EkDPlugIn::CurrentInfoRef current = plugIn->currentInfo();
-  auto form = server().formCache().formFor(plugIn, current->info);
+  auto form = server().database().formCache().formFor(plugIn, current->info);
   if (form->error) {
     log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(),
                      *form->error);
   }
   const EkDPlugIn* record = plugIn.get();
   EkDatabase::EncodedAnnotation annotation =
-      server().encodedAnnotationsForPlugIns({&record, 1}).front();
+      server().database().encodedAnnotationsForPlugIns({&record, 1}).front();
   Dictionary members;
   plugIn->augmentForm(members, *current);
   if (!EkDaemonClient::convertsToWyre(version())) {

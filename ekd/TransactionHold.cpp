@@ -28,11 +28,12 @@ struct PlugInList {
 }  // namespace
 
 void Transaction::lockDownPlugIns() {
-  EkDServer& database = server();
+  EkDServer& daemon = server();
+  EkDatabase& database = daemon.database();
   if (const Array* tokens = arrayForKey(protocol::kUuids)) {
     for (const Value& token : *tokens) {
       // Elements that are not UUIDs name no hold.
-      if (const Uuid* uuid = token.uuid()) database.unholdToken(*uuid);
+      if (const Uuid* uuid = token.uuid()) daemon.unholdToken(*uuid);
     }
     done();
     return;
@@ -78,9 +79,9 @@ void Transaction::lockDownPlugIns() {
     }
   }
 
-  auto hold = EkDPlugInHold::initWithPlugIns(plugIns, client_, database.platform().serviceManager);
+  auto hold = EkDPlugInHold::initWithPlugIns(plugIns, client_, daemon.platform().serviceManager);
   Uuid token = hold->uuid();
-  database.addHold(std::move(hold));
+  daemon.addHold(std::move(hold));
   reply_.insert_or_assign(std::string(protocol::kUuids), Value(token));
 
   if (flags & kHoldTerminate) {
@@ -90,7 +91,7 @@ void Transaction::lockDownPlugIns() {
       if (auto proxy = plugIn->getProxy()) proxies.push_back(std::move(proxy));
     }
     // The reply waits for every answer; the transaction lives until then.
-    database.terminatePlugIns(proxies, [self = shared_from_this(), token] {
+    daemon.terminatePlugIns(proxies, [self = shared_from_this(), token] {
       log::ops().info("forced termination complete; hold request granted uuid:%{public}@", token);
       self->done();
     });

@@ -118,8 +118,9 @@ void Transaction::matchPlugIns() {
     return;
   }
 
-  EkDServer& database = server();
-  std::optional<Value> exclusionsValue = database.userPrefs()->exclusions();
+  EkDServer& daemon = server();
+  EkDatabase& database = daemon.database();
+  std::optional<Value> exclusionsValue = daemon.userPrefs()->exclusions();
   Candidates candidates = database.findPlugIns(rules.value_or(Dictionary{})).value_or(Candidates{});
   EK_PROBE1(discover_raw, static_cast<uint64_t>(candidates.size()));
   if (log::ops().enabled(log::Level::Info)) {
@@ -154,7 +155,7 @@ void Transaction::matchPlugIns() {
   const Dictionary* matchRules = rules ? &*rules : nullptr;
   EkDFormCache& forms = database.formCache();
   // The holds as they stand now decide for every candidate.
-  const std::shared_ptr<const EkDPlugInHolds> holds = database.holds();
+  const std::shared_ptr<const EkDPlugInHolds> holds = daemon.holds();
   for (const auto& plugIn : candidates) {
     EkDPlugIn::CurrentInfoRef current = plugIn->currentInfo();
     if (!all) {

@@ -27,10 +27,9 @@ void Transaction::readyPlugIns() {
     log::ops().debug("pid %d provided %d environment entries", client_->pid(), environment->size());
   }
 
-  EkDServer& database = server();
   std::vector<std::shared_ptr<EkDPlugIn>> accepted;
   std::unordered_set<Uuid> seen;
-  const std::shared_ptr<const EkDPlugInHolds> holds = database.holds();
+  const std::shared_ptr<const EkDPlugInHolds> holds = server().holds();
   bool walked = processUuidList([&](const std::shared_ptr<EkDPlugIn>& plugIn) {
     std::string uuid = plugIn->uuid().string();
     std::string identifier = plugIn->identifier().value_or("(null)");

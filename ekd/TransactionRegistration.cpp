@@ -27,7 +27,7 @@ void Transaction::addPlugIns() {
       return PathStep::Stop;
     }
     EK_PROBE1(plugin_add, path.c_str());
-    if (server().addPlugIn(urlForPath(path))) {
+    if (server().database().addPlugIn(urlForPath(path))) {
       log::ops().defaultLevel("failed to register plug-in at %@", path);
       fail(protocol::kErrorRegistry, log::format("unable to register plug-in at %@", path));
       return PathStep::Stop;
@@ -47,7 +47,7 @@ void Transaction::removePlugIns() {
       fail(protocol::kErrorNotPermitted, "caller lacks entitlement for this operation");
       return PathStep::Stop;
     }
-    if (server().removePlugIn(urlForPath(path))) {
+    if (server().database().removePlugIn(urlForPath(path))) {
       fail(protocol::kErrorBadPath, log::format("no plugin at %@", path));
       return PathStep::Stop;
     }
