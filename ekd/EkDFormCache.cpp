@@ -64,65 +64,56 @@ void EkDFormCache::write(const EncodedForm& form, const Added& added, std::vecto
 
 std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::formFor(
     const std::shared_ptr<const EkDPlugIn>& plugIn) {
-  // Read before the lock: a changed registry makes the record fetch its info again.
+  // A changed registry makes the record fetch its info again.
   return formFor(plugIn, plugIn->bundleInfoDictionary());
 }
 
 std::shared_ptr<const EkDFormCache::EncodedForm> EkDFormCache::formFor(
     const std::shared_ptr<const EkDPlugIn>& plugIn, const DictionaryRef& info) {
   const Uuid uuid = plugIn->uuid();
-  {
-    std::lock_guard lock(mutex_);
-    auto it = slots_.find(uuid);
-    if (it != slots_.end()) {
-      Slot& slot = it->second;
-      if (!slot.info.expired() && slot.info.lock() == info && slot.record.lock() == plugIn) {
-        recent_.splice(recent_.begin(), recent_, slot.recent);
-        return slot.form;
-      }
-      dropLocked(it);
+  if (auto it = slots_.find(uuid); it != slots_.end()) {
+    Slot& slot = it->second;
+    if (!slot.info.expired() && slot.info.lock() == info && slot.record.lock() == plugIn) {
+      recent_.splice(recent_.begin(), recent_, slot.recent);
+      return slot.form;
     }
+    drop(it);
   }
 
   std::shared_ptr<const EncodedForm> form = encode(*plugIn);
   const size_t size = form->members.capacity();
   if (size > limit_) return form;
-  std::lock_guard lock(mutex_);
-  // Another thread may have kept one meanwhile; the newer one replaces it.
-  if (auto it = slots_.find(uuid); it != slots_.end()) dropLocked(it);
   // Now and then, rather than on every insert: a sweep visits every slot.
   if (++insertsSinceSweep_ >= 256) {
     insertsSinceSweep_ = 0;
-    dropExpiredLocked();
+    dropExpired();
   }
-  while (bytes_ + size > limit_ && !recent_.empty()) dropLocked(slots_.find(recent_.back()));
+  while (bytes_ + size > limit_ && !recent_.empty()) drop(slots_.find(recent_.back()));
   recent_.push_front(uuid);
   slots_.emplace(uuid, Slot{plugIn, std::move(info), form, recent_.begin()});
   bytes_ += size;
   return form;
 }
 
-void EkDFormCache::dropLocked(std::unordered_map<Uuid, Slot>::iterator slot) {
+void EkDFormCache::drop(std::unordered_map<Uuid, Slot>::iterator slot) {
   bytes_ -= slot->second.form->members.capacity();
   recent_.erase(slot->second.recent);
   slots_.erase(slot);
 }
 
-void EkDFormCache::dropExpiredLocked() {
+void EkDFormCache::dropExpired() {
   for (auto it = slots_.begin(); it != slots_.end();) {
     auto next = std::next(it);
-    if (it->second.record.expired() || it->second.info.expired()) dropLocked(it);
+    if (it->second.record.expired() || it->second.info.expired()) drop(it);
     it = next;
   }
 }
 
 size_t EkDFormCache::bytes() const {
-  std::lock_guard lock(mutex_);
   return bytes_;
 }
 
 size_t EkDFormCache::count() const {
-  std::lock_guard lock(mutex_);
   return slots_.size();
 }
 

@@ -4,7 +4,6 @@
 #include <cstdint>
 #include <list>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <span>
 #include <unordered_map>
@@ -25,7 +24,8 @@ namespace ek {
 // while the record is the same object and reads the same info dictionary, which it replaces
 // whenever the registry changes.
 //
-// At most byteLimit bytes of forms are kept; the least recently used go first. Thread-safe.
+// At most byteLimit bytes of forms are kept; the least recently used go first. Not thread-safe:
+// the database's, used where it runs (the work queue).
 class EkDFormCache {
  public:
   struct EncodedForm {
@@ -74,12 +74,11 @@ class EkDFormCache {
   };
 
   static std::shared_ptr<const EncodedForm> encode(const EkDPlugIn& plugIn);
-  void dropLocked(std::unordered_map<Uuid, Slot>::iterator slot);
+  void drop(std::unordered_map<Uuid, Slot>::iterator slot);
   // Drops the forms of records that are gone (uninstalled, or rebuilt).
-  void dropExpiredLocked();
+  void dropExpired();
 
   const size_t limit_;
-  mutable std::mutex mutex_;
   std::unordered_map<Uuid, Slot> slots_;
   std::list<Uuid> recent_;  // most recently used first
   size_t bytes_ = 0;

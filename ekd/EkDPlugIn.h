@@ -44,8 +44,8 @@ struct EkDPlugInContext {
   // $EKORA_SYSTEM_ROOT (else /System).
   std::string systemRoot;
   // The plug-in's stored annotation (the database's annotationForPlugIn), read by matching on
-  // "ZuUserElection". Absent means no annotations are known. Must not be called from the
-  // database queue.
+  // "ZuUserElection". Absent means no annotations are known. Runs where the
+  // database runs.
   std::function<std::optional<Dictionary>(const EkDPlugIn&)> annotations;
   // The type system that "?TY-CONFORMS:", "?TY-IS:" and activation rules consult; null means
   // types::TypeSystem::system().

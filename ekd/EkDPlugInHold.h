@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <memory>
+#include <unordered_set>
 #include <vector>
 
 #include "ekd/EkDPlugIn.h"
@@ -45,6 +46,16 @@ class EkDPlugInHold {
   std::weak_ptr<EkDWyreClient> client_;
   std::chrono::system_clock::time_point created_;
   std::shared_ptr<stard::ServiceManager> serviceManager_;
+};
+
+// The holds in force at one moment. The server replaces the whole list at every change, so a
+// request reads one list for all its candidates without entering a queue or taking a lock.
+struct EkDPlugInHolds {
+  std::vector<std::shared_ptr<EkDPlugInHold>> holds;
+  // Every UUID some hold blocks.
+  std::unordered_set<Uuid> blocked;
+
+  bool blocks(const EkDPlugIn& plugIn) const { return blocked.contains(plugIn.uuid()); }
 };
 
 }  // namespace ek

@@ -81,15 +81,17 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
       server->platform_.registry, server->platform_.extensions, {},
       server->platform_.notifier, server->platform_.types,      server->platform_.serviceManager,
       server->platform_.consent};
-  if (!server->initWithStore(store.get(), std::move(databasePlatform))) {
+  // Requests run on the thread that reads the sockets: a request then reaches its handler
+  // without waking another thread, and handlers run one at a time all the same. The database
+  // is theirs: its cache and annotations are touched on this queue only.
+  server->mainQueue_ = SerialQueue::make("service", wyre::ioContext());
+  server->database_ = std::make_shared<EkDatabase>();
+  if (!server->database_->initWithStore(store.get(), std::move(databasePlatform),
+                                        server->mainQueue_)) {
     return nullptr;
   }
   server->userPrefs_ = EkDUserPrefs::init(server->platform_.preferences);
   server->wyreQueue_ = SerialQueue::make("wyre");
-  // Requests run on the thread that reads the sockets: a request then reaches its handler
-  // without waking another thread, and handlers run one at a time all the same.
-  server->mainQueue_ = SerialQueue::make("service", wyre::ioContext());
-  server->syncQueue_ = SerialQueue::make("serverSync");
   server->heapTrim_ = EkDHeapTrim::make(wyre::ioContext(), kHeapTrimQuiet);
 
   auto listener = wyre::Listener::create(serviceName, server->wyreQueue_);
@@ -102,8 +104,10 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
     std::lock_guard lock(gServerMutex);
     gServer = server;
   }
-  server->setDelegate(std::static_pointer_cast<EkDatabaseDelegate>(server));
-  server->registry()->addObserver(std::static_pointer_cast<vantor::RegistryObserver>(server));
+  server->database_->setDelegate([weak = std::weak_ptr<EkDServer>(server)](const auto& plugIns) {
+    if (auto self = weak.lock()) self->removedPlugIns(plugIns);
+  });
+  server->registry()->addObserver(server->database_);
   // The listener holds the server weakly: the process-wide reference keeps it alive.
   std::weak_ptr<EkDServer> weak = server;
   server->service_->setEventHandler([weak](const wyre::ListenerEvent& event) {
@@ -173,120 +177,116 @@ void EkDServer::memoryChurned() {
 void EkDServer::stop() {
   service_->cancel();
   if (systemVolumeWatch_) systemVolumeWatch_->cancel();
-  std::vector<std::shared_ptr<EkDPlugInHold>> released;
-  syncQueue_->sync([&] {
-    for (const auto& hold : holds_) {
+  changeHolds([](std::vector<std::shared_ptr<EkDPlugInHold>>& holds) {
+    for (const auto& hold : holds) {
       log::ops().debug("releasing plug-in hold %{public}@ because server is stopping",
                        hold->uuid());
     }
-    released.swap(holds_);
-    notifier()->post(protocol::kAnnotationChangeNotification);
+    holds.clear();
   });
-  workspace()->checkpoint();
+  platform_.notifier->post(protocol::kAnnotationChangeNotification);
+  registry()->checkpoint();
+}
+
+void EkDServer::changeHolds(
+    const std::function<void(std::vector<std::shared_ptr<EkDPlugInHold>>&)>& change) {
+  std::shared_ptr<const EkDPlugInHolds> previous;
+  std::lock_guard lock(holdsWriter_);
+  previous = holds_.load();
+  auto next = std::make_shared<EkDPlugInHolds>();
+  next->holds = previous->holds;
+  change(next->holds);
+  for (const auto& hold : next->holds) {
+    for (const auto& plugIn : hold->blocked()) next->blocked.insert(plugIn->uuid());
+  }
+  holds_.store(std::move(next));
 }
 
 void EkDServer::watchHostExit(const AuditToken& host) {
   if (!host.pidfd || !host.pidfd->valid()) return;
-  syncQueue_->sync([&] {
-    if (hostWatches_.contains(host.pid)) return;
-    // Each watch keeps a descriptor open for as long as its host lives: bounded, so that hosts
-    // cannot run the daemon out of descriptors. Past the bound, declarations go at the next
-    // declaration instead.
-    if (hostWatches_.size() >= kMaxHostWatches) {
-      log::ops().info("not watching host %d for its exit: %zu hosts watched already", host.pid,
-                      hostWatches_.size());
-      return;
-    }
-    // A copy of the descriptor: the watch outlives the connection that brought the pidfd.
-    int fd = ::fcntl(host.pidfd->get(), F_DUPFD_CLOEXEC, 0);
-    if (fd < 0) {
-      log::ops().error("cannot watch host %d for its exit: %{errno}d", host.pid, errno);
-      return;
-    }
-    auto watch = std::make_shared<asio::posix::stream_descriptor>(wyre::ioContext(), fd);
-    hostWatches_.emplace(host.pid, watch);
-    // A pidfd becomes readable when its process has exited.
-    watch->async_wait(asio::posix::stream_descriptor::wait_read,
-                      [weak = weak_from_this(), pid = host.pid](const asio::error_code& error) {
-                        auto server = weak.lock();
-                        if (!server || error == asio::error::operation_aborted) return;
-                        server->syncQueue_->async([server, pid] {
-                          server->hostWatches_.erase(pid);
-                          log::ops().debug("host %d exited: pruning its service declarations", pid);
-                          server->platform_.serviceManager->pruneDeclarations();
-                        });
+  if (hostWatches_.contains(host.pid)) return;
+  // Each watch keeps a descriptor open for as long as its host lives: bounded, so that hosts
+  // cannot run the daemon out of descriptors. Past the bound, declarations go at the next
+  // declaration instead.
+  if (hostWatches_.size() >= kMaxHostWatches) {
+    log::ops().info("not watching host %d for its exit: %zu hosts watched already", host.pid,
+                    hostWatches_.size());
+    return;
+  }
+  // A copy of the descriptor: the watch outlives the connection that brought the pidfd.
+  int fd = ::fcntl(host.pidfd->get(), F_DUPFD_CLOEXEC, 0);
+  if (fd < 0) {
+    log::ops().error("cannot watch host %d for its exit: %{errno}d", host.pid, errno);
+    return;
+  }
+  auto watch = std::make_shared<asio::posix::stream_descriptor>(wyre::ioContext(), fd);
+  hostWatches_.emplace(host.pid, watch);
+  // A pidfd becomes readable when its process has exited.
+  watch->async_wait(asio::posix::stream_descriptor::wait_read,
+                    [weak = weak_from_this(), pid = host.pid](const asio::error_code& error) {
+                      auto server = weak.lock();
+                      if (!server || error == asio::error::operation_aborted) return;
+                      server->mainQueue_->async([server, pid] {
+                        server->hostWatches_.erase(pid);
+                        log::ops().debug("host %d exited: pruning its service declarations", pid);
+                        server->platform_.serviceManager->pruneDeclarations();
                       });
-  });
-}
-
-bool EkDServer::holdOnPlugIn(const EkDPlugIn& plugIn) {
-  bool held = false;
-  syncQueue_->sync([&] {
-    for (const auto& hold : holds_) {
-      if (hold->blocks(plugIn)) {
-        held = true;
-        return;
-      }
-    }
-  });
-  return held;
+                    });
 }
 
 void EkDServer::addHold(std::shared_ptr<EkDPlugInHold> hold) {
   // A hold request may pass its client's check just before the client dies and arrive here
   // after the client's holds were released: nobody would ever release it then. The client
-  // stops accepting work before it releases its holds, both ordered by this queue.
+  // stops accepting work before it releases its holds, and both changes of the list are
+  // ordered by holdsWriter_.
   bool added = false;
-  syncQueue_->sync([&] {
+  changeHolds([&](std::vector<std::shared_ptr<EkDPlugInHold>>& holds) {
     auto client = hold->client();
     if (client && !client->acceptWork()) {
       log::ops().debug("dropping plug-in hold %{public}@ of dead client pid %d", hold->uuid(),
                        client->pid());
       return;
     }
-    holds_.push_back(hold);
+    holds.push_back(hold);
     added = true;
   });
-  if (added) notifier()->post(protocol::kAnnotationChangeNotification);
+  if (added) platform_.notifier->post(protocol::kAnnotationChangeNotification);
 }
 
 void EkDServer::unholdToken(const Uuid& token) {
-  // Destroyed outside the queue: a hold's last reference may be the list's.
-  std::shared_ptr<EkDPlugInHold> released;
-  syncQueue_->sync([&] {
-    for (auto it = holds_.begin(); it != holds_.end(); ++it) {
-      if ((*it)->uuid() == token) {
-        log::ops().debug("releasing plug-in hold %{public}@ at client's request", token);
-        released = std::move(*it);
-        holds_.erase(it);
-        notifier()->post(protocol::kAnnotationChangeNotification);
-        return;
+  if (!holds()->holds.empty()) {
+    bool released = false;
+    changeHolds([&](std::vector<std::shared_ptr<EkDPlugInHold>>& holds) {
+      for (auto it = holds.begin(); it != holds.end(); ++it) {
+        if ((*it)->uuid() == token) {
+          log::ops().debug("releasing plug-in hold %{public}@ at client's request", token);
+          holds.erase(it);
+          released = true;
+          return;
+        }
       }
-    }
-  });
+    });
+    if (released) platform_.notifier->post(protocol::kAnnotationChangeNotification);
+  }
 }
 
 void EkDServer::unholdClient(const std::shared_ptr<EkDWyreClient>& client) {
-  std::vector<std::shared_ptr<EkDPlugInHold>> released;
-  syncQueue_->sync([&] {
-    for (auto it = holds_.begin(); it != holds_.end();) {
-      if ((*it)->placedBy(client)) {
-        log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", (*it)->uuid(),
-                         client->pid());
-        released.push_back(std::move(*it));
-        it = holds_.erase(it);
-        notifier()->post(protocol::kAnnotationChangeNotification);
-      } else {
-        ++it;
-      }
-    }
+  size_t released = 0;
+  changeHolds([&](std::vector<std::shared_ptr<EkDPlugInHold>>& holds) {
+    std::erase_if(holds, [&](const std::shared_ptr<EkDPlugInHold>& hold) {
+      if (!hold->placedBy(client)) return false;
+      log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", hold->uuid(),
+                       client->pid());
+      ++released;
+      return true;
+    });
   });
+  for (size_t i = 0; i < released; ++i)
+    platform_.notifier->post(protocol::kAnnotationChangeNotification);
 }
 
 size_t EkDServer::holdCount() {
-  size_t count = 0;
-  syncQueue_->sync([&] { count = holds_.size(); });
-  return count;
+  return holds()->holds.size();
 }
 
 namespace {

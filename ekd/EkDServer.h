@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <unordered_map>
@@ -13,6 +14,7 @@
 #include <asio/posix/stream_descriptor.hpp>
 
 #include "ekd/EkDHeapTrim.h"
+#include "ekd/EkDPlugInHold.h"
 #include "ekd/EkDatabase.h"
 #include "platform/codesign/CodeSigning.h"
 #include "platform/notify/Notifications.h"
@@ -26,7 +28,6 @@
 
 namespace ek {
 
-class EkDPlugInHold;
 class EkDSystemVolumeWatch;
 class EkDUserPrefs;
 class EkDWyreClient;
@@ -52,12 +53,9 @@ struct EkDPlatform {
   static EkDPlatform system();
 };
 
-// The daemon's one server: owns the listener, the work queue on which every request runs,
-// and the queue that guards the hold list. It is also the plug-in database, and that
-// database's delegate.
-class EkDServer : public EkDatabase,
-                  public EkDatabaseDelegate,
-                  public std::enable_shared_from_this<EkDServer> {
+// The daemon's one server: owns the listener, the work queue on which every request runs, the
+// plug-in database that belongs to that queue, and the list of holds.
+class EkDServer : public std::enable_shared_from_this<EkDServer> {
  public:
   // Answers nullptr when the server cannot be built (for instance, the service cannot be
   // listened on); the reason is logged.
@@ -83,9 +81,10 @@ class EkDServer : public EkDatabase,
   // Cancels the listener and releases every hold. Called just before the process exits.
   void stop();
 
-  // Holds. The list is confined to syncQueue(), which these enter synchronously: never call
-  // them from it.
-  bool holdOnPlugIn(const EkDPlugIn& plugIn);
+  // Holds. Readers take the list in force (holds()) and keep it for the whole request;
+  // changes replace the list whole. Any thread.
+  std::shared_ptr<const EkDPlugInHolds> holds() const { return holds_.load(); }
+  bool holdOnPlugIn(const EkDPlugIn& plugIn) const { return holds()->blocks(plugIn); }
   void addHold(std::shared_ptr<EkDPlugInHold> hold);
   void unholdToken(const Uuid& token);
   void unholdClient(const std::shared_ptr<EkDWyreClient>& client);
@@ -94,9 +93,11 @@ class EkDServer : public EkDatabase,
   // every answer is in, on a queue of its own. Returns at once.
   void terminatePlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns,
                         std::function<void()> reply);
-  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) override;
+  // The database's delegate: installed plug-ins are going away.
+  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns);
   // Prunes the service declarations once this host has exited: one watch per host, on its
-  // pidfd. Without a pidfd they go at the next declaration or daemon start instead.
+  // pidfd. Without a pidfd they go at the next declaration or daemon start instead. Runs on
+  // the work queue.
   void watchHostExit(const AuditToken& host);
 
   // When the server was built: the daemon's start, for its uptime.
@@ -105,28 +106,35 @@ class EkDServer : public EkDatabase,
   void setVerbose(uint32_t verbose) { verbose_ = verbose; }
   const std::optional<std::string>& databasePath() const { return databasePath_; }
 
+  // The plug-in database; used on mainQueue() only.
+  EkDatabase& database() const { return *database_; }
   const EkDPlatform& platform() const { return platform_; }
   const std::shared_ptr<vantor::Registry>& registry() const { return platform_.registry; }
   const std::shared_ptr<EkDUserPrefs>& userPrefs() const { return userPrefs_; }
   const std::shared_ptr<SerialQueue>& mainQueue() const { return mainQueue_; }
-  const std::shared_ptr<SerialQueue>& syncQueue() const { return syncQueue_; }
   const std::shared_ptr<wyre::Listener>& service() const { return service_; }
 
  private:
   EkDServer() = default;
   void handleListenerEvent(const wyre::ListenerEvent& event);
+  // Replaces the holds in force with what change makes of a copy of them. The released holds
+  // end after the lock is left: a hold's last reference may be the old list's.
+  void changeHolds(const std::function<void(std::vector<std::shared_ptr<EkDPlugInHold>>&)>& change);
 
   const std::chrono::steady_clock::time_point startTime_ = std::chrono::steady_clock::now();
   std::atomic<uint32_t> verbose_{0};
   std::optional<std::string> databasePath_;
   EkDPlatform platform_;
+  std::shared_ptr<EkDatabase> database_;
   std::shared_ptr<SerialQueue> wyreQueue_;
   std::shared_ptr<SerialQueue> mainQueue_;  // "service": every request runs here
-  std::shared_ptr<SerialQueue> syncQueue_;  // "serverSync": guards the hold list
   std::shared_ptr<wyre::Listener> service_;
-  std::vector<std::shared_ptr<EkDPlugInHold>> holds_;  // on syncQueue_
+  std::atomic<std::shared_ptr<const EkDPlugInHolds>> holds_{
+      std::make_shared<const EkDPlugInHolds>()};
+  // Serialises the changes of holds_: each reads the list in force and replaces it.
+  std::mutex holdsWriter_;
   std::unordered_map<pid_t, std::shared_ptr<asio::posix::stream_descriptor>>
-      hostWatches_;  // on syncQueue_
+      hostWatches_;  // on mainQueue_
   std::shared_ptr<EkDUserPrefs> userPrefs_;
   std::shared_ptr<EkDHeapTrim> heapTrim_;
   std::shared_ptr<EkDSystemVolumeWatch> systemVolumeWatch_;

@@ -111,7 +111,7 @@ class EkDServerTest : public ::testing::Test {
     if (version) proxy.info.emplace("QvBundleVersion", Value(*version));
     registry_->install(proxy);
     proxies_.push_back(registry_->plugInByUuid(proxy.uuid));
-    auto record = server_->findPlugIn(proxy.uuid);
+    auto record = server_->database().findPlugIn(proxy.uuid);
     EXPECT_NE(record, nullptr) << sink_->lines().back();
     return record;
   }

@@ -29,38 +29,24 @@ struct ProxyList {
   }
 };
 
-void requireOn(const SerialQueue& queue, const char* operation) {
-  if (!queue.isCurrent()) {
-    std::fprintf(stderr, "EkDatabase::%s called off the database queue\n", operation);
-    std::abort();
-  }
-}
-
-// Runs block synchronously on queue and answers its result.
-template <typename F>
-auto onQueue(SerialQueue& queue, F&& block) {
-  using R = decltype(block());
-  std::optional<R> result;
-  queue.sync([&] { result.emplace(block()); });
-  return std::move(*result);
-}
-
 }  // namespace
 
 EkDatabase::~EkDatabase() = default;
 
-bool EkDatabase::initWithDatabase(std::optional<std::string> path, EkDatabasePlatform platform) {
-  return initWithStore(EkDAnnotationStore::initWithDatabase(std::move(path)), std::move(platform));
+bool EkDatabase::initWithDatabase(std::optional<std::string> path, EkDatabasePlatform platform,
+                                  std::shared_ptr<SerialQueue> owner) {
+  return initWithStore(EkDAnnotationStore::initWithDatabase(std::move(path)), std::move(platform),
+                       std::move(owner));
 }
 
 bool EkDatabase::initWithStore(std::unique_ptr<EkDAnnotationStore> store,
-                               EkDatabasePlatform platform) {
+                               EkDatabasePlatform platform, std::shared_ptr<SerialQueue> owner) {
   platform_ = std::move(platform);
   annotations_ = std::move(store);
   if (!annotations_) return false;
-  sync_ = SerialQueue::make("EkDatabase");
-  // The registry holds observers weakly; the owner registers this database once it is shared
-  // (see EkDServer), since a base class cannot hand out its owner's reference.
+  owner_ = owner ? std::move(owner) : SerialQueue::make("EkDatabase");
+  // The registry holds observers weakly: whoever shares this database registers it (see
+  // EkDServer).
   return true;
 }
 
@@ -74,27 +60,24 @@ EkDPlugInContext EkDatabase::recordContext() {
   return context;
 }
 
-void EkDatabase::setDelegate(std::weak_ptr<EkDatabaseDelegate> delegate) {
+void EkDatabase::setDelegate(EkDatabaseDelegate delegate) {
   delegate_ = std::move(delegate);
 }
 
-size_t EkDatabase::cacheCount() {
-  return onQueue(*sync_, [&] { return cache_.size(); });
+size_t EkDatabase::cacheCount() const {
+  return cache_.size();
 }
 
 EkDPlugInRef EkDatabase::plugInForProxy(const vantor::PlugInProxy& proxy) {
-  return onQueue(*sync_, [&]() -> EkDPlugInRef {
-    auto it = cache_.find(proxy.uuid);
-    if (it != cache_.end()) {
-      if (it->second->isStillValid()) return it->second;
-      cache_.erase(it);
-    }
-    return createPlugInForProxy(proxy);
-  });
+  auto it = cache_.find(proxy.uuid);
+  if (it != cache_.end()) {
+    if (it->second->isStillValid()) return it->second;
+    cache_.erase(it);
+  }
+  return createPlugInForProxy(proxy);
 }
 
 EkDPlugInRef EkDatabase::createPlugInForProxy(const vantor::PlugInProxy& proxy) {
-  requireOn(*sync_, "createPlugInForProxy");
   log::ops().defaultLevel("createPlugInForProxy");
   auto plugIn = EkDPlugIn::createWithVRData(proxy, recordContext());
   if (!plugIn) return nullptr;
@@ -105,7 +88,6 @@ EkDPlugInRef EkDatabase::createPlugInForProxy(const vantor::PlugInProxy& proxy) 
 }
 
 void EkDatabase::purgeCachesToLimit(int64_t limit) {
-  requireOn(*sync_, "purgeCachesToLimit");
   // Compared unsigned: a negative limit never purges.
   if (static_cast<uint64_t>(cache_.size()) > static_cast<uint64_t>(limit)) {
     log::ops().info("purging cache for %d > %d", cache_.size(), limit);
@@ -116,7 +98,10 @@ void EkDatabase::purgeCachesToLimit(int64_t limit) {
 
 void EkDatabase::localeDidChange() {
   log::ops().defaultLevel("locale change detected; purging cache");
-  sync_->async([this] { purgeCachesToLimit(0); });
+  // The registry's thread: the cache is the owner's.
+  owner_->async([weak = weak_from_this()] {
+    if (auto self = weak.lock()) self->purgeCachesToLimit(0);
+  });
 }
 
 std::optional<std::string> EkDatabase::normalizeElection(const Value& value) {
@@ -157,13 +142,11 @@ bool EkDatabase::electionFilter(const std::vector<std::string>& elections,
   if (replaces != entitlements.end() && replaces->second.string()) {
     key = *replaces->second.string();
   }
-  std::optional<int64_t> election = onQueue(*sync_, [&]() -> std::optional<int64_t> {
-    auto annotation = annotations_->annotationForIdentifier(key);
-    if (!annotation) return std::nullopt;
+  std::optional<int64_t> election;
+  if (const Dictionary* annotation = annotations_->findAnnotation(key)) {
     auto field = annotation->find(kElectionKey);
-    if (field == annotation->end()) return std::nullopt;
-    return EkDPlugIn::electionNumber(field->second);
-  });
+    if (field != annotation->end()) election = EkDPlugIn::electionNumber(field->second);
+  }
   if (!election) {
     election = 0;
     auto autoElect = entitlements.find(protocol::kEntitlementAutoElect);
@@ -210,16 +193,7 @@ std::optional<std::vector<EkDPlugInRef>> EkDatabase::findPlugIns(const Dictionar
     }
   }
 
-  // The cached records of all candidates in one visit to the queue.
-  size_t cachedBefore = 0;
-  std::vector<EkDPlugInRef> records(uuids.size());
-  sync_->sync([&] {
-    cachedBefore = cache_.size();
-    for (size_t i = 0; i < uuids.size(); ++i) {
-      auto it = cache_.find(uuids[i]);
-      if (it != cache_.end() && it->second->isStillValid()) records[i] = it->second;
-    }
-  });
+  const size_t cachedBefore = cache_.size();
   size_t selected = 0;
   std::vector<EkDPlugInRef> result;
   result.reserve(uuids.size());
@@ -227,7 +201,11 @@ std::optional<std::vector<EkDPlugInRef>> EkDatabase::findPlugIns(const Dictionar
   for (size_t i = 0; i < uuids.size(); ++i) {
     const Uuid& uuid = uuids[i];
     if (!seen.insert(uuid).second) continue;
-    if (EkDPlugInRef cached = std::move(records[i])) {
+    EkDPlugInRef cached;
+    if (auto it = cache_.find(uuid); it != cache_.end() && it->second->isStillValid()) {
+      cached = it->second;
+    }
+    if (cached) {
       if (elections) {
         DictionaryRef entitlements = cached->entitlements();
         if (!electionFilter(*elections, cached->identifier().value_or(""),
@@ -269,20 +247,17 @@ std::optional<std::vector<EkDPlugInRef>> EkDatabase::findPlugIns(const Dictionar
 }
 
 EkDPlugInRef EkDatabase::findPlugIn(const Uuid& uuid) {
-  EkDPlugInRef plugIn = onQueue(*sync_, [&]() -> EkDPlugInRef {
-    auto it = cache_.find(uuid);
-    if (it != cache_.end()) {
-      if (it->second->isStillValid()) return it->second;
-      cache_.erase(it);
-    }
-    auto proxy = platform_.registry->plugInByUuid(uuid);
-    if (!proxy) {
-      log::ops().info("Vantor cannot find plug-in with UUID:%{public}@", uuid);
-      return nullptr;
-    }
-    return createPlugInForProxy(*proxy);
-  });
-  return plugIn;
+  auto it = cache_.find(uuid);
+  if (it != cache_.end()) {
+    if (it->second->isStillValid()) return it->second;
+    cache_.erase(it);
+  }
+  auto proxy = platform_.registry->plugInByUuid(uuid);
+  if (!proxy) {
+    log::ops().info("Vantor cannot find plug-in with UUID:%{public}@", uuid);
+    return nullptr;
+  }
+  return createPlugInForProxy(*proxy);
 }
 
 EkDPlugInRef EkDatabase::findPlugInAtPath(std::string_view url) {
@@ -323,7 +298,7 @@ std::optional<EkError> EkDatabase::removePlugIn(std::string_view url) {
 }
 
 std::optional<Dictionary> EkDatabase::annotationForPlugIn(const EkDPlugIn& plugIn) {
-  return onQueue(*sync_, [&] { return annotations_->annotationForPlugIn(plugIn); });
+  return annotations_->annotationForPlugIn(plugIn);
 }
 
 std::vector<EkDatabase::EncodedAnnotation> EkDatabase::encodedAnnotationsForPlugIns(
@@ -345,33 +320,30 @@ std::vector<EkDatabase::EncodedAnnotation> EkDatabase::encodedAnnotationsForPlug
     return EncodedAnnotation{std::move(copy), static_cast<uint32_t>(bytes.size())};
   };
   static const EncodedAnnotation kNone = kept(cbor::encode(Value(Dictionary{})));
-  sync_->sync([&] {
-    const uint64_t current = annotations_->generation();
-    for (size_t i = 0; i < plugIns.size(); ++i) {
-      EkDPlugIn::AnnotationNote note = plugIns[i]->annotationNote();
-      if (note.generation != current) {
-        const Dictionary* annotation = annotations_->findAnnotation(plugIns[i]->annotationKey());
-        note.generation = current;
-        note.encoded = annotation ? kept(cbor::encode(Value(*annotation))) : kNone;
-        plugIns[i]->setAnnotationNote(note);
-      }
-      encoded[i] = std::move(note.encoded);
+  for (size_t i = 0; i < plugIns.size(); ++i) {
+    EkDPlugIn::AnnotationNote note = plugIns[i]->annotationNote();
+    if (note.generation != generation) {
+      const Dictionary* annotation = annotations_->findAnnotation(plugIns[i]->annotationKey());
+      note.generation = generation;
+      note.encoded = annotation ? kept(cbor::encode(Value(*annotation))) : kNone;
+      plugIns[i]->setAnnotationNote(note);
     }
-  });
+    encoded[i] = std::move(note.encoded);
+  }
   return encoded;
 }
 
 Result<void> EkDatabase::setAnnotation(const std::optional<Dictionary>& annotation,
                                        const EkDPlugIn& plugIn) {
-  return onQueue(*sync_, [&] { return annotations_->setAnnotation(annotation, plugIn); });
+  return annotations_->setAnnotation(annotation, plugIn);
 }
 
 void EkDatabase::beginAnnotationChanges() {
-  sync_->sync([&] { annotations_->deferSaves(); });
+  annotations_->deferSaves();
 }
 
 Result<void> EkDatabase::commitAnnotationChanges() {
-  return onQueue(*sync_, [&] { return annotations_->saveDeferred(); });
+  return annotations_->saveDeferred();
 }
 
 void EkDatabase::notifyAnnotationChange() {
@@ -379,7 +351,6 @@ void EkDatabase::notifyAnnotationChange() {
 }
 
 void EkDatabase::autoElect(const EkDPlugIn& plugIn) {
-  requireOn(*sync_, "autoElect");
   Dictionary annotation = annotations_->annotationForPlugIn(plugIn).value_or(Dictionary{});
   auto it = annotation.find(kElectionKey);
   if (it != annotation.end()) {
@@ -403,15 +374,25 @@ void EkDatabase::pluginsDidInstall(const std::vector<vantor::PlugInProxyPtr>& pl
 }
 
 void EkDatabase::pluginsWillUninstall(const std::vector<vantor::PlugInProxyPtr>& plugIns) {
-  sync_->sync([&] {
-    for (const auto& proxy : plugIns) {
-      log::ops().defaultLevel("plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", proxy->identifier,
-                              proxy->identifier, proxy->bundleVersion.value_or("(null)"),
-                              proxy->uuid.string(), proxy->path);
-      cache_.erase(proxy->uuid);
-    }
-  });
-  if (auto delegate = delegate_.lock()) delegate->removedPlugIns(plugIns);
+  for (const auto& proxy : plugIns) {
+    log::ops().defaultLevel("plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", proxy->identifier,
+                            proxy->identifier, proxy->bundleVersion.value_or("(null)"),
+                            proxy->uuid.string(), proxy->path);
+  }
+  // The registry delivers on its own queue while the remover waits. A request that removed
+  // the plug-ins runs there itself and drops their records at once; any other remover's
+  // notice is queued behind the requests in flight, as if the removal had come a moment later.
+  auto forget = [weak = weak_from_this(), plugIns] {
+    auto self = weak.lock();
+    if (!self) return;
+    for (const auto& proxy : plugIns) self->cache_.erase(proxy->uuid);
+  };
+  if (owner_->isCurrent()) {
+    forget();
+  } else {
+    owner_->async(std::move(forget));
+  }
+  if (delegate_) delegate_(plugIns);
 }
 
 }  // namespace ek

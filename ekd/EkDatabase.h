@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <span>
@@ -25,13 +26,8 @@ namespace ek {
 
 using EkDPlugInRef = std::shared_ptr<EkDPlugIn>;
 
-// Told when installed plug-ins are about to go away.
-class EkDatabaseDelegate {
- public:
-  virtual ~EkDatabaseDelegate() = default;
-  // Called on the registry's notice thread, outside the database queue.
-  virtual void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) = 0;
-};
+// Told when installed plug-ins are about to go away, on the registry's notice thread.
+using EkDatabaseDelegate = std::function<void(const std::vector<vantor::PlugInProxyPtr>& plugIns)>;
 
 // What the database needs from the platform.
 struct EkDatabasePlatform {
@@ -54,25 +50,31 @@ struct EkDatabasePlatform {
 // The daemon's view of the installed plug-ins: records built from the registry's proxies,
 // cached by UUID, and the annotation store in front of which the cache sits.
 //
-// The queue "EkDatabase" (_sync) confines the cache and the annotation store. The synchronous
-// operations enter it and must not be called from it; findPlugIns runs on the caller's queue
-// and enters it per candidate.
-class EkDatabase : public vantor::RegistryObserver {
+// The cache and the annotation store belong to one queue, the owner's (the daemon's work
+// queue, on which every request runs): every operation runs there, enters no other queue and
+// waits for nobody. Only the registry's notices arrive elsewhere; they hand their work to the
+// owner's queue.
+class EkDatabase : public vantor::RegistryObserver,
+                   public std::enable_shared_from_this<EkDatabase> {
  public:
+  EkDatabase() = default;
   ~EkDatabase() override;
 
-  // Fails only when the annotation store cannot be opened.
-  bool initWithDatabase(std::optional<std::string> path, EkDatabasePlatform platform);
+  // Fails only when the annotation store cannot be opened. owner is the queue the database
+  // runs on; none makes a queue "EkDatabase" of its own.
+  bool initWithDatabase(std::optional<std::string> path, EkDatabasePlatform platform,
+                        std::shared_ptr<SerialQueue> owner = nullptr);
   // The same with the annotation store opened already (EkDAnnotationStore::initWithDatabase).
-  bool initWithStore(std::unique_ptr<EkDAnnotationStore> store, EkDatabasePlatform platform);
+  bool initWithStore(std::unique_ptr<EkDAnnotationStore> store, EkDatabasePlatform platform,
+                     std::shared_ptr<SerialQueue> owner = nullptr);
 
   // The cached record of the proxy's UUID, else a new one. nullptr when the proxy yields no
   // record (the next request tries again).
   EkDPlugInRef plugInForProxy(const vantor::PlugInProxy& proxy);
-  // Builds, auto-elects and caches a record. Runs on _sync only.
+  // Builds, auto-elects and caches a record.
   EkDPlugInRef createPlugInForProxy(const vantor::PlugInProxy& proxy);
   // Empties the whole cache when it holds more than limit records (compared unsigned, so a
-  // negative limit never purges). Runs on _sync only.
+  // negative limit never purges).
   void purgeCachesToLimit(int64_t limit);
 
   // Records of the plug-ins the registry selects for query, its "ZuUserElection" applied as
@@ -94,7 +96,7 @@ class EkDatabase : public vantor::RegistryObserver {
   // The annotation of each of plugIns as a reply carries it: a CBOR map, empty for none. All
   // of them are as the store held them at one moment, after every change made before the
   // call. Records keep what was read (EkDPlugIn::AnnotationNote), so while the store does not
-  // change, this neither enters the queue nor looks anything up.
+  // change, this looks nothing up.
   using EncodedAnnotation = EkDPlugIn::EncodedAnnotation;
   std::vector<EncodedAnnotation> encodedAnnotationsForPlugIns(
       std::span<const EkDPlugIn* const> plugIns);
@@ -105,30 +107,31 @@ class EkDatabase : public vantor::RegistryObserver {
   void notifyAnnotationChange();
   // Annotation changes from beginAnnotationChanges() until commitAnnotationChanges() reach
   // memory at once and the file in one durable write at the commit. When that write fails,
-  // every change since the beginning is undone and the error answered. Run on the work queue.
+  // every change since the beginning is undone and the error answered.
   void beginAnnotationChanges();
   Result<void> commitAnnotationChanges();
 
-  // Elects a plug-in that holds the auto-elect entitlement unless a choice exists. Runs on
-  // _sync only.
+  // Elects a plug-in that holds the auto-elect entitlement unless a choice exists.
   void autoElect(const EkDPlugIn& plugIn);
 
-  // Registry notices.
+  // Registry notices, on the registry's queue.
   void pluginsDidInstall(const std::vector<vantor::PlugInProxyPtr>& plugIns) override;
   void pluginsWillUninstall(const std::vector<vantor::PlugInProxyPtr>& plugIns) override;
   void localeDidChange() override;
 
-  void setDelegate(std::weak_ptr<EkDatabaseDelegate> delegate);
+  // Set before the registry's notices may arrive.
+  void setDelegate(EkDatabaseDelegate delegate);
   uint32_t cacheLimit() const { return cacheLimit_.load(); }
   void setCacheLimit(uint32_t limit) { cacheLimit_ = limit; }
-  size_t cacheCount();
+  size_t cacheCount() const;
   // Forms of the plug-ins that replies carry by the hundred ("match"), kept encoded.
   EkDFormCache& formCache() { return formCache_; }
 
   const std::shared_ptr<vantor::Registry>& workspace() const { return platform_.registry; }
   const std::shared_ptr<notify::Notifier>& notifier() const { return platform_.notifier; }
-  const std::shared_ptr<SerialQueue>& databaseQueue() const { return sync_; }
-  // The store itself, for tests and the daemon's own checks; touch it only on _sync.
+  // The owner's queue.
+  const std::shared_ptr<SerialQueue>& databaseQueue() const { return owner_; }
+  // The store itself, for tests and the daemon's own checks.
   EkDAnnotationStore& annotations() { return *annotations_; }
 
   // The election list of a query's "ZuUserElection": absent when there is none or a value
@@ -137,21 +140,18 @@ class EkDatabase : public vantor::RegistryObserver {
   // "=1" and "1" give "1"; an empty value or one starting with an operator gives nothing.
   static std::optional<std::string> normalizeElection(const Value& value);
 
- protected:
-  EkDatabase() = default;
-
  private:
   // Whether a candidate's election is one of elections.
   bool electionFilter(const std::vector<std::string>& elections, const std::string& identifier,
                       const Dictionary& entitlements);
   EkDPlugInContext recordContext();
 
-  std::weak_ptr<EkDatabaseDelegate> delegate_;
+  EkDatabaseDelegate delegate_;
   std::atomic<uint32_t> cacheLimit_{1000000};
   EkDatabasePlatform platform_;
-  std::unique_ptr<EkDAnnotationStore> annotations_;  // on _sync
-  std::shared_ptr<SerialQueue> sync_;
-  std::unordered_map<Uuid, EkDPlugInRef> cache_;  // on _sync
+  std::unique_ptr<EkDAnnotationStore> annotations_;
+  std::shared_ptr<SerialQueue> owner_;
+  std::unordered_map<Uuid, EkDPlugInRef> cache_;
   // About 2.6 KB a form: room for the 500 forms of a busy extension point and the plug-ins
   // found most recently. Finds pass every form they answer through it, so a larger cache
   // mostly holds forms nobody asks for again.

@@ -7,7 +7,6 @@
 #include <future>
 #include <memory>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "platform/cbor/Cbor.h"
@@ -23,10 +22,10 @@ namespace fs = std::filesystem;
 constexpr std::string_view kAutoElect = "com.corvane.developer.auto-elect-plugin";
 constexpr std::string_view kReplacePlugIn = "com.corvane.developer.replace-plugin";
 
-class TestDatabase : public EkDatabase, public EkDatabaseDelegate {
+// A database that is its own delegate.
+class TestDatabase : public EkDatabase {
  public:
-  TestDatabase() = default;
-  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) override {
+  void removedPlugIns(const std::vector<vantor::PlugInProxyPtr>& plugIns) {
     std::lock_guard lock(mutex);
     removed.push_back(plugIns);
   }
@@ -78,7 +77,7 @@ class DatabaseTest : public ::testing::Test {
     database_ = std::make_shared<TestDatabase>();
     ASSERT_TRUE(
         database_->initWithDatabase(annotationPath(), {registry_, nullptr, "/System", notifier_}));
-    database_->setDelegate(database_);
+    database_->setDelegate([this](const auto& plugIns) { database_->removedPlugIns(plugIns); });
     registry_->addObserver(database_);
   }
 
@@ -110,10 +109,12 @@ class DatabaseTest : public ::testing::Test {
     return proxy;
   }
 
+  // The registry's notices, and the work they hand to the database's queue.
   void drainRegistry() {
     std::promise<void> drained;
     registry_->queue()->async([&] { drained.set_value(); });
     drained.get_future().wait();
+    database_->databaseQueue()->sync([] {});
   }
 
   std::optional<int64_t> storedElection(const std::string& key) {
@@ -210,6 +211,7 @@ TEST_F(DatabaseTest, UninstallDropsTheCachedRecordAndTellsTheDelegateOnce) {
   drainRegistry();
   ASSERT_TRUE(registry_->uninstall(a.uuid));
   ASSERT_TRUE(registry_->uninstall(b.uuid));
+  drainRegistry();
   EXPECT_EQ(database_->cacheCount(), 0u);
   std::lock_guard lock(database_->mutex);
   ASSERT_EQ(database_->removed.size(), 2u);
@@ -471,46 +473,6 @@ TEST_F(DatabaseTest, EncodedAnnotationsFollowEveryChangeOfTheStore) {
   ASSERT_FALSE(single.ok());
   EXPECT_EQ(single.error().domain, kPosixErrorDomain);
   EXPECT_EQ(annotations(), (std::vector<Dictionary>{elected, elected, none}));
-}
-
-// One answer is one moment of the store: a writer numbering two plug-ins' annotations, first
-// then second, is never seen to have numbered the second further than the first.
-TEST_F(DatabaseTest, EncodedAnnotationsOfOneCallAreOneMomentOfTheStore) {
-  auto first = database_->findPlugIn(install("com.example.first").uuid);
-  auto second = database_->findPlugIn(install("com.example.second").uuid);
-  ASSERT_TRUE(first && second);
-  constexpr uint64_t kRounds = 300;
-  auto numbered = [](uint64_t n) { return Dictionary{{"n", Value(n)}}; };
-  auto numberOf = [](const Dictionary& annotation) -> uint64_t {
-    auto it = annotation.find("n");
-    return it == annotation.end() || !it->second.unsignedNumber() ? 0
-                                                                  : *it->second.unsignedNumber();
-  };
-  database_->beginAnnotationChanges();  // memory only: the rounds need not each reach the disk
-  std::atomic<bool> writing{true};
-  std::thread writer([&] {
-    for (uint64_t n = 1; n <= kRounds; ++n) {
-      EXPECT_TRUE(database_->setAnnotation(numbered(n), *first).ok());
-      EXPECT_TRUE(database_->setAnnotation(numbered(n), *second).ok());
-    }
-    writing = false;
-  });
-  const std::vector<const EkDPlugIn*> records = {first.get(), second.get()};
-  size_t reads = 0;
-  uint64_t torn = 0;
-  while (writing || reads == 0) {
-    auto encoded = database_->encodedAnnotationsForPlugIns(records);
-    const uint64_t firstNumber = numberOf(decodedAnnotation(encoded[0]));
-    const uint64_t secondNumber = numberOf(decodedAnnotation(encoded[1]));
-    if (secondNumber > firstNumber) ++torn;
-    ++reads;
-  }
-  writer.join();
-  EXPECT_TRUE(database_->commitAnnotationChanges().ok());
-  EXPECT_EQ(torn, 0u) << "of " << reads << " reads";
-  auto last = database_->encodedAnnotationsForPlugIns(records);
-  EXPECT_EQ(numberOf(decodedAnnotation(last[0])), kRounds);
-  EXPECT_EQ(numberOf(decodedAnnotation(last[1])), kRounds);
 }
 
 }  // namespace

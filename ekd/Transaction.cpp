@@ -1,11 +1,8 @@
 #include "ekd/Transaction.h"
 
 #include <cstdlib>
-#include <unordered_map>
-#include <unordered_set>
 #include <utility>
 
-#include "Ekora/EkFileURL.h"
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDWyreClient.h"
@@ -14,28 +11,6 @@
 #include "platform/trace/Probes.h"
 
 namespace ek {
-namespace {
-
-using Handler = void (Transaction::*)();
-
-const std::unordered_map<std::string_view, Handler>& requestTable() {
-  static const std::unordered_map<std::string_view, Handler> table{
-      {protocol::kAdd, &Transaction::addPlugIns},
-      {protocol::kRemove, &Transaction::removePlugIns},
-      {protocol::kBulk, &Transaction::bulkPlugIns},
-      {protocol::kMatch, &Transaction::matchPlugIns},
-      {protocol::kReady, &Transaction::readyPlugIns},
-      {protocol::kAccess, &Transaction::accessPlugIns},
-      {protocol::kAnnotate, &Transaction::annotatePlugIns},
-      {protocol::kBulkAnnotate, &Transaction::bulkAnnotatePlugIns},
-      {protocol::kLock, &Transaction::lockDownPlugIns},
-      {protocol::kFind, &Transaction::findPlugIn},
-      {protocol::kStatus, &Transaction::reportStatus},
-  };
-  return table;
-}
-
-}  // namespace
 
 std::shared_ptr<Transaction> Transaction::initWithRequest(
     wyre::Message request, std::shared_ptr<EkDWyreClient> client,
@@ -45,20 +20,16 @@ std::shared_ptr<Transaction> Transaction::initWithRequest(
       new Transaction(std::move(request), std::move(client), std::move(sender)));
 }
 
+Transaction::Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client,
+                         std::shared_ptr<const EkDClientProcess> sender)
+    : client_(std::move(client)), sender_(std::move(sender)), request_(std::move(request)) {}
+
 EkDServer& Transaction::server() const {
   return *client_->server();
 }
 
 std::shared_ptr<wyre::Connection> Transaction::connection() const {
   return client_->connection();
-}
-
-const Array* Transaction::arrayForKey(std::string_view key) const {
-  return request_.body.getArray(key);
-}
-
-const Dictionary* Transaction::dictionaryForKey(std::string_view key) const {
-  return request_.body.getDictionary(key);
 }
 
 void Transaction::dispatch() {
@@ -69,8 +40,8 @@ void Transaction::dispatch() {
   if (version_ != protocol::kCurrentVersion && version_ != protocol::kOldestVersion) {
     // Shown as %d shows it: the low 32 bits, signed.
     int32_t shown = static_cast<int32_t>(static_cast<uint32_t>(version_.load()));
-    fail(protocol::kErrorVersion,
-         log::format(protocol::kMsgUnsupportedVersion, shown, protocol::kCurrentVersion));
+    send(Reply::failure(protocol::kErrorVersion, log::format(protocol::kMsgUnsupportedVersion,
+                                                             shown, protocol::kCurrentVersion)));
     return;
   }
   if (!client_->acceptWork()) return;
@@ -80,39 +51,67 @@ void Transaction::dispatch() {
   EK_PROBE2(request, client_->pid(), type ? type->c_str() : "");
 
   if (!type) {
-    fail(protocol::kErrorInvalidRequest, protocol::kMsgMissingType);
+    send(Reply::failure(protocol::kErrorInvalidRequest, protocol::kMsgMissingType));
     return;
   }
-  auto it = requestTable().find(*type);
-  if (it == requestTable().end()) {
-    fail(protocol::kErrorInvalidRequest, protocol::kMsgUnrecognized);
+  const RequestHandler* handler = handlerFor(*type);
+  if (!handler) {
+    send(Reply::failure(protocol::kErrorInvalidRequest, protocol::kMsgUnrecognized));
     return;
   }
-  (this->*(it->second))();
+  decoded_.emplace(request_.body, version_.load(), *sender_, client_->pid(), client_);
+  if (handler->answer) {
+    send(handler->answer(*decoded_, server()));
+    return;
+  }
+  // The reply keeps the transaction, and with it the request, until it is sent.
+  handler->start(*decoded_, server(),
+                 [self = shared_from_this()](Reply reply) { self->send(std::move(reply)); });
 }
 
-void Transaction::prepareReply() {
+void Transaction::send(Reply reply) {
   if (replied_) {
     log::ops().error("transaction for client %d replied twice", client_->pid());
     std::abort();
   }
   replied_ = true;
-  if (beforeReply_) std::exchange(beforeReply_, nullptr)();
   // Lines logged for a request are out before its reply, unless other requests wait: then
   // they go out together a moment later, rather than one write each.
   if (!server().mainQueue()->hasWaiting()) log::flush();
-}
-
-void Transaction::done() {
-  prepareReply();
-  Value reply(std::move(reply_));
+  Dictionary& members = reply.members;
+  if (reply.error) {
+    // The code travels as a signed 32-bit value widened to 64 bits.
+    members[std::string(protocol::kErrorCode)] =
+        Value(static_cast<uint64_t>(static_cast<int64_t>(reply.error->code)));
+    members[std::string(protocol::kError)] = Value(std::move(reply.error->message));
+  }
+  if (!reply.writeEncoded) {
+    Value value(std::move(members));
+    if (EK_PROBE_ENABLED(request_output)) {
+      std::string text = value.description();
+      EK_PROBE2(request_output, client_->pid(), text.c_str());
+    }
+    if (!request_.wantsReply()) return;
+    std::vector<uint8_t> frame(wyre::kHeaderSize);
+    cbor::encode(value, frame);
+    sendFrame(std::move(frame));
+    return;
+  }
+  // One member goes straight into the frame, as its writer encodes it.
+  if (auto it = members.find(reply.encodedKey); it != members.end()) members.erase(it);
+  std::vector<uint8_t> frame(wyre::kHeaderSize);
+  cbor::encodeMapHead(members.size() + 1, frame);
+  for (const auto& [name, value] : members) {
+    cbor::encodeText(name, frame);
+    cbor::encode(value, frame);
+  }
+  cbor::encodeText(reply.encodedKey, frame);
+  reply.writeEncoded(frame);
   if (EK_PROBE_ENABLED(request_output)) {
-    std::string text = reply.description();
+    auto decoded = cbor::decode(std::span(frame).subspan(wyre::kHeaderSize));
+    std::string text = decoded ? decoded->description() : decoded.error().message;
     EK_PROBE2(request_output, client_->pid(), text.c_str());
   }
-  if (!request_.wantsReply()) return;
-  std::vector<uint8_t> frame(wyre::kHeaderSize);
-  cbor::encode(reply, frame);
   sendFrame(std::move(frame));
 }
 
@@ -133,164 +132,6 @@ void Transaction::sendFrame(std::vector<uint8_t> frame) {
     cbor::encode(error, frame);
   }
   connection->replyEncoded(request_, std::move(frame));
-}
-
-void Transaction::doneWithEncoded(
-    std::string_view key, const std::function<void(std::vector<uint8_t>& out)>& writeValue) {
-  prepareReply();
-  if (auto it = reply_.find(key); it != reply_.end()) reply_.erase(it);
-  std::vector<uint8_t> frame(wyre::kHeaderSize);
-  cbor::encodeMapHead(reply_.size() + 1, frame);
-  for (const auto& [name, value] : reply_) {
-    cbor::encodeText(name, frame);
-    cbor::encode(value, frame);
-  }
-  cbor::encodeText(key, frame);
-  writeValue(frame);
-  if (EK_PROBE_ENABLED(request_output)) {
-    auto reply = cbor::decode(std::span(frame).subspan(wyre::kHeaderSize));
-    std::string text = reply ? reply->description() : reply.error().message;
-    EK_PROBE2(request_output, client_->pid(), text.c_str());
-  }
-  sendFrame(std::move(frame));
-}
-
-void Transaction::fail(int32_t code, std::string_view message) {
-  // The code travels as a signed 32-bit value widened to 64 bits.
-  reply_[std::string(protocol::kErrorCode)] =
-      Value(static_cast<uint64_t>(static_cast<int64_t>(code)));
-  reply_[std::string(protocol::kError)] = Value(message);
-  done();
-}
-
-void Transaction::fail(int32_t code, const EkError& error) {
-  fail(error.isEkora() ? error.code : code, error.description());
-}
-
-struct Transaction::PathWalk {
-  const Array* paths = nullptr;
-  size_t next = 0;
-  // The texts already passed on, as sent and as resolved: a path sent many times costs one
-  // resolution and one step.
-  std::unordered_set<std::string> seen;
-  PathCallback callback;
-};
-
-const Array* Transaction::pathList() {
-  const Array* paths = arrayForKey(protocol::kPaths);
-  if (!paths) {
-    fail(protocol::kErrorInvalidRequest, protocol::kMsgInvalidFormat);
-    return nullptr;
-  }
-  if (paths->size() > protocol::kMaxListEntries) {
-    fail(protocol::kErrorInvalidRequest, log::format(protocol::kMsgTooManyEntries, protocol::kPaths,
-                                                     paths->size(), protocol::kMaxListEntries));
-    return nullptr;
-  }
-  return paths;
-}
-
-Transaction::PathStep Transaction::walkPath(PathWalk& walk, const Value& element) {
-  const std::string* path = element.string();
-  if (!path) {
-    fail(protocol::kErrorInvalidRequest, protocol::kMsgInvalidFormat);
-    return PathStep::Stop;
-  }
-  if (path->empty() || (*path)[0] != '/') {
-    fail(protocol::kErrorBadPath, log::format(protocol::kMsgAbsolutePathRequired, *path));
-    return PathStep::Stop;
-  }
-  if (!walk.seen.insert(*path).second) return PathStep::Continue;
-  if (path->find('\0') == std::string::npos) {
-    char* resolved = ::realpath(path->c_str(), nullptr);
-    if (resolved) {
-      std::string canonical(resolved);
-      std::free(resolved);
-      if (canonical != *path && !walk.seen.insert(canonical).second) return PathStep::Continue;
-      return walk.callback(canonical, true);
-    }
-  }
-  return walk.callback(*path, false);
-}
-
-bool Transaction::marshalPaths(const PathCallback& callback) {
-  PathWalk walk;
-  walk.paths = pathList();
-  if (!walk.paths) return false;
-  walk.callback = callback;
-  for (const Value& element : *walk.paths) {
-    if (walkPath(walk, element) == PathStep::Stop) return false;
-  }
-  return true;
-}
-
-void Transaction::processPaths(PathCallback callback) {
-  auto walk = std::make_shared<PathWalk>();
-  walk->paths = pathList();
-  if (!walk->paths) return;
-  walk->callback = std::move(callback);
-  continuePaths(std::move(walk));
-}
-
-void Transaction::continuePaths(std::shared_ptr<PathWalk> walk) {
-  if (!client_->acceptWork()) return;
-  const auto deadline = std::chrono::steady_clock::now() + kPathSliceBudget;
-  const Array& paths = *walk->paths;
-  while (walk->next < paths.size()) {
-    if (walkPath(*walk, paths[walk->next++]) == PathStep::Stop) return;
-    if (walk->next < paths.size() && std::chrono::steady_clock::now() >= deadline) {
-      server().mainQueue()->async(
-          [self = shared_from_this(), walk] { self->continuePaths(std::move(walk)); });
-      return;
-    }
-  }
-  done();
-}
-
-bool Transaction::processUuidList(const PlugInStep& step) {
-  const Array* uuids = arrayForKey(protocol::kUuids);
-  if (!uuids) {
-    fail(protocol::kErrorInvalidRequest, "invalid request format (uuid)");
-    return false;
-  }
-  if (uuids->size() > protocol::kMaxListEntries) {
-    fail(protocol::kErrorInvalidRequest, log::format(protocol::kMsgTooManyEntries, protocol::kUuids,
-                                                     uuids->size(), protocol::kMaxListEntries));
-    return false;
-  }
-  const Array* paths = nullptr;
-  if (const Value* value = request_.body.get(protocol::kPaths)) {
-    if (!value->array()) {
-      log::traffic().defaultLevel("Paths present but not an array (ignoring values)");
-    } else if (value->array()->size() != uuids->size()) {
-      log::traffic().defaultLevel("Paths present but has different count than UUIDs (ignoring)");
-    } else {
-      paths = value->array();
-    }
-  }
-  EkDServer& database = server();
-  for (size_t i = 0; i < uuids->size(); ++i) {
-    const Uuid* uuid = (*uuids)[i].uuid();
-    if (!uuid) {
-      fail(protocol::kErrorInvalidRequest, "invalid request (bad uuid array)");
-      return false;
-    }
-    auto plugIn = database.findPlugIn(*uuid);
-    if (!plugIn && paths) {
-      log::traffic().info("Failed to find plugin by %{uuid_t}.16P", *uuid);
-      if (const std::string* path = (*paths)[i].string()) {
-        log::traffic().info("Looking for plugin %{uuid_t}.16P by path %s", *uuid, *path);
-        if (auto url = EkFileURL::fromPath(*path))
-          plugIn = database.findPlugInAtPath(url->string());
-      }
-    }
-    if (!plugIn) {
-      fail(protocol::kErrorInvalidRequest, "no such plugin (uuid not found)");
-      return false;
-    }
-    if (!step(plugIn)) return false;
-  }
-  return true;
 }
 
 }  // namespace ek

@@ -6,7 +6,7 @@
 #include "ekd/EkDPlugIn.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDWyreClient.h"
-#include "ekd/Transaction.h"
+#include "ekd/Handlers.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/log/Log.h"
 
@@ -34,140 +34,125 @@ int32_t replyCode(const EkError& error) {
   return protocol::kErrorInvalidRequest;
 }
 
-void failStore(Transaction& transaction, const EkError& error) {
-  transaction.fail(replyCode(error), error.description());
+Reply failStore(const EkError& error) {
+  return Reply::failure(replyCode(error), error.description());
 }
 
-// Whatever way the request ends, what it changed reaches the disk before the reply leaves; when
-// it cannot, the changes are undone and the reply says so instead.
-void commitBeforeReply(Transaction& transaction, EkDServer& database) {
-  transaction.beforeReply([&transaction, &database] {
-    Result<void> committed = database.commitAnnotationChanges();
-    if (committed.ok()) return;
-    const int32_t code = replyCode(committed.error());
-    transaction.reply()[std::string(protocol::kErrorCode)] =
-        Value(static_cast<uint64_t>(static_cast<int64_t>(code)));
-    transaction.reply()[std::string(protocol::kError)] = Value(committed.error().description());
-  });
+// Whatever way the changes begun with beginAnnotationChanges end, they reach the disk before the
+// reply leaves; when they cannot, they are undone and the reply says so instead of outcome.
+// Posts the change once when it was made and kept.
+Reply committed(EkDatabase& database, Reply outcome) {
+  if (Result<void> saved = database.commitAnnotationChanges(); !saved.ok()) {
+    return failStore(saved.error());
+  }
+  if (!outcome.failed()) database.notifyAnnotationChange();
+  return outcome;
 }
 
 }  // namespace
 
-void Transaction::annotatePlugIns() {
-  const Dictionary* annotations = dictionaryForKey(protocol::kAnnotations);
+namespace handlers {
+
+Reply annotatePlugIns(const Request& request, EkDServer& daemon) {
+  const Dictionary* annotations = request.body.getDictionary(protocol::kAnnotations);
   if (!annotations) {
-    fail(protocol::kErrorInvalidRequest, "invalid request format (bad annotations dictionary)");
-    return;
+    return Reply::failure(protocol::kErrorInvalidRequest,
+                          "invalid request format (bad annotations dictionary)");
   }
   Dictionary change;
   if (auto it = annotations->find(kElection); it != annotations->end()) {
     std::optional<int64_t> election = EkDPlugIn::electionNumber(it->second);
     if (!election) {
-      fail(protocol::kErrorInvalidRequest, "invalid request format (annotation election)");
-      return;
+      return Reply::failure(protocol::kErrorInvalidRequest,
+                            "invalid request format (annotation election)");
     }
     if (std::optional<std::string> reason = unstorable(it->second)) {
-      fail(protocol::kErrorInvalidRequest,
-           fmt::format("invalid request format (annotation election): {}", *reason));
-      return;
+      return Reply::failure(
+          protocol::kErrorInvalidRequest,
+          fmt::format("invalid request format (annotation election): {}", *reason));
     }
     // Stored as the number it stands for, so every reader sees the same election.
     change.emplace(kElection, it->second.boolean() ? Value(*election) : it->second);
   }
   if (auto it = annotations->find(kExtension); it != annotations->end()) {
     if (!it->second.dictionary()) {
-      fail(protocol::kErrorInvalidRequest, "invalid request format (annotation extension)");
-      return;
+      return Reply::failure(protocol::kErrorInvalidRequest,
+                            "invalid request format (annotation extension)");
     }
     if (std::optional<std::string> reason = unstorable(it->second)) {
-      fail(protocol::kErrorInvalidRequest,
-           fmt::format("invalid request format (annotation extension): {}", *reason));
-      return;
+      return Reply::failure(
+          protocol::kErrorInvalidRequest,
+          fmt::format("invalid request format (annotation extension): {}", *reason));
     }
     change.emplace(kExtension, it->second);
   }
-  if (change.empty()) {
-    done();
-    return;
-  }
+  if (change.empty()) return Reply{};
 
   const Value changeValue(change);
   auto election = change.find(kElection);
-  EkDServer& database = server();
+  EkDatabase& database = daemon.database();
   database.beginAnnotationChanges();
-  commitBeforeReply(*this, database);
-  bool walked = processUuidList([&](const std::shared_ptr<EkDPlugIn>& plugIn) {
-    std::string uuid = plugIn->uuid().string();
-    std::string identifier = plugIn->identifier().value_or("(null)");
-    log::ops().debug("client %d plug-in %{public}@(%{public}@) annotation change: %@",
-                     client_->pid(), identifier, uuid, changeValue);
-    if (election != change.end()) {
-      log::ops().info("client %d plug-in %{public}@(%{public}@) election := %@", client_->pid(),
-                      identifier, uuid, election->second);
-    }
-    if (Result<void> set = database.setAnnotation(change, *plugIn); !set.ok()) {
-      failStore(*this, set.error());
-      return false;
-    }
-    return true;
-  });
-  if (!walked) return;
-  beforeReply(nullptr);
-  if (Result<void> committed = database.commitAnnotationChanges(); !committed.ok()) {
-    failStore(*this, committed.error());
-    return;
-  }
-  database.notifyAnnotationChange();
-  done();
+  Step failure =
+      forEachListedPlugIn(request, daemon, [&](const std::shared_ptr<EkDPlugIn>& plugIn) -> Step {
+        std::string uuid = plugIn->uuid().string();
+        std::string identifier = plugIn->identifier().value_or("(null)");
+        log::ops().debug("client %d plug-in %{public}@(%{public}@) annotation change: %@",
+                         request.pid, identifier, uuid, changeValue);
+        if (election != change.end()) {
+          log::ops().info("client %d plug-in %{public}@(%{public}@) election := %@", request.pid,
+                          identifier, uuid, election->second);
+        }
+        if (Result<void> set = database.setAnnotation(change, *plugIn); !set.ok()) {
+          return failStore(set.error());
+        }
+        return std::nullopt;
+      });
+  return committed(database, failure ? std::move(*failure) : Reply{});
 }
 
-void Transaction::bulkAnnotatePlugIns() {
-  const Dictionary* annotations = dictionaryForKey(protocol::kAnnotations);
-  if (!annotations) {
-    fail(protocol::kErrorInvalidRequest, "invalid request format (bad annotations dictionary)");
-    return;
-  }
-  log::ops().debug("bulk change requested for %u plug-ins", annotations->size());
-  EkDServer& database = server();
-  database.beginAnnotationChanges();
-  commitBeforeReply(*this, database);
-  for (const auto& [key, value] : *annotations) {
+namespace {
+
+// The changes of a bulk annotation, up to the first that fails.
+Step bulkAnnotate(const Request& request, EkDatabase& database, const Dictionary& annotations) {
+  for (const auto& [key, value] : annotations) {
     if (!value.dictionary()) {
-      fail(protocol::kErrorBadAnnotation, "annotations values must be dictionaries");
-      return;
+      return Reply::failure(protocol::kErrorBadAnnotation,
+                            "annotations values must be dictionaries");
     }
     if (std::optional<std::string> reason = unstorable(value)) {
-      fail(protocol::kErrorBadAnnotation,
-           fmt::format("annotations values must be storable: {}", *reason));
-      return;
+      return Reply::failure(protocol::kErrorBadAnnotation,
+                            fmt::format("annotations values must be storable: {}", *reason));
     }
     auto uuid = Uuid::parse(key);
-    if (!uuid) {
-      fail(protocol::kErrorBadAnnotation, "invalid plug-in UUID value");
-      return;
-    }
+    if (!uuid) return Reply::failure(protocol::kErrorBadAnnotation, "invalid plug-in UUID value");
     auto plugIn = database.findPlugIn(*uuid);
     if (!plugIn) {
-      fail(protocol::kErrorRegistry, "no plug-in with the requested uuid");
-      return;
+      return Reply::failure(protocol::kErrorRegistry, "no plug-in with the requested uuid");
     }
     log::ops().debug("client %d bulk plug-in %{public}@(%public}@) annotation change: %@",
-                     client_->pid(), plugIn->identifier().value_or("(null)"),
-                     plugIn->uuid().string(), value);
+                     request.pid, plugIn->identifier().value_or("(null)"), plugIn->uuid().string(),
+                     value);
     Result<void> set =
         database.setAnnotation(Dictionary{{std::string(kExtension), value}}, *plugIn);
-    if (!set.ok()) {
-      failStore(*this, set.error());
-      return;
-    }
+    if (!set.ok()) return failStore(set.error());
   }
-  beforeReply(nullptr);
-  if (Result<void> committed = database.commitAnnotationChanges(); !committed.ok()) {
-    failStore(*this, committed.error());
-    return;
-  }
-  database.notifyAnnotationChange();
-  done();
+  return std::nullopt;
 }
 
+}  // namespace
+
+Reply bulkAnnotatePlugIns(const Request& request, EkDServer& daemon) {
+  const Dictionary* annotations = request.body.getDictionary(protocol::kAnnotations);
+  if (!annotations) {
+    return Reply::failure(protocol::kErrorInvalidRequest,
+                          "invalid request format (bad annotations dictionary)");
+  }
+  log::ops().debug("bulk change requested for %u plug-ins", annotations->size());
+  EkDatabase& database = daemon.database();
+  database.beginAnnotationChanges();
+  Step failure = bulkAnnotate(request, database, *annotations);
+  return committed(database, failure ? std::move(*failure) : Reply{});
+}
+
+}  // namespace handlers
 }  // namespace ek

@@ -5,7 +5,7 @@
 #include "ekd/EkDPlugInHold.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDWyreClient.h"
-#include "ekd/Transaction.h"
+#include "ekd/Handlers.h"
 #include "platform/log/Log.h"
 
 namespace ek {
@@ -27,38 +27,40 @@ struct PlugInList {
 
 }  // namespace
 
-void Transaction::lockDownPlugIns() {
-  EkDServer& database = server();
-  if (const Array* tokens = arrayForKey(protocol::kUuids)) {
+namespace handlers {
+
+void lockDownPlugIns(const Request& request, EkDServer& daemon, Respond respond) {
+  EkDatabase& database = daemon.database();
+  if (const Array* tokens = request.body.getArray(protocol::kUuids)) {
     for (const Value& token : *tokens) {
       // Elements that are not UUIDs name no hold.
-      if (const Uuid* uuid = token.uuid()) database.unholdToken(*uuid);
+      if (const Uuid* uuid = token.uuid()) daemon.unholdToken(*uuid);
     }
-    done();
+    respond(Reply{});
     return;
   }
 
-  const uint64_t* flagsValue = request_.body.getUnsigned(protocol::kFlags);
+  const uint64_t* flagsValue = request.body.getUnsigned(protocol::kFlags);
   const uint64_t flags = flagsValue ? *flagsValue : 0;
   std::vector<std::shared_ptr<EkDPlugIn>> plugIns;
-  bool collected = marshalPaths([&](const std::string& path, bool resolved) {
-    if (!resolved) {
-      fail(protocol::kErrorBadPath, log::format("invalid path: %@", path));
-      return PathStep::Stop;
-    }
+  Step failure = forEachPath(request, [&](const std::string& path, bool resolved) -> Step {
+    if (!resolved)
+      return Reply::failure(protocol::kErrorBadPath, log::format("invalid path: %@", path));
     if (flags & kHoldPlugInPaths) {
       auto plugIn = database.findPlugInAtPath(path);
       if (!plugIn) {
-        fail(protocol::kErrorBadPath, log::format("no plug-in at path:%@", path));
-        return PathStep::Stop;
+        return Reply::failure(protocol::kErrorBadPath, log::format("no plug-in at path:%@", path));
       }
       plugIns.push_back(std::move(plugIn));
     } else if (auto within = database.plugInsWithinApplication(path)) {
       for (auto& plugIn : *within) plugIns.push_back(std::move(plugIn));
     }
-    return PathStep::Continue;
+    return std::nullopt;
   });
-  if (!collected) return;
+  if (failure) {
+    respond(std::move(*failure));
+    return;
+  }
   log::ops().info("processing hold request for plug-ins:%@", PlugInList{plugIns});
 
   if (flags & kHoldRefuseBusy) {
@@ -72,16 +74,20 @@ void Transaction::lockDownPlugIns() {
     }
     if (!busy.empty()) {
       log::ops().debug("hold refused. Busy plug-ins:%@", PlugInList{busy});
-      reply_.insert_or_assign(std::string(protocol::kConflicts), Value(std::move(conflicts)));
-      fail(protocol::kErrorBusy, "plug-ins are busy");
+      Reply refused = Reply::failure(protocol::kErrorBusy, "plug-ins are busy");
+      refused.members.insert_or_assign(std::string(protocol::kConflicts),
+                                       Value(std::move(conflicts)));
+      respond(std::move(refused));
       return;
     }
   }
 
-  auto hold = EkDPlugInHold::initWithPlugIns(plugIns, client_, database.platform().serviceManager);
+  auto hold =
+      EkDPlugInHold::initWithPlugIns(plugIns, request.client, daemon.platform().serviceManager);
   Uuid token = hold->uuid();
-  database.addHold(std::move(hold));
-  reply_.insert_or_assign(std::string(protocol::kUuids), Value(token));
+  daemon.addHold(std::move(hold));
+  Reply granted;
+  granted.members.insert_or_assign(std::string(protocol::kUuids), Value(token));
 
   if (flags & kHoldTerminate) {
     std::vector<vantor::PlugInProxyPtr> proxies;
@@ -90,14 +96,15 @@ void Transaction::lockDownPlugIns() {
       if (auto proxy = plugIn->getProxy()) proxies.push_back(std::move(proxy));
     }
     // The reply waits for every answer; the transaction lives until then.
-    database.terminatePlugIns(proxies, [self = shared_from_this(), token] {
+    daemon.terminatePlugIns(proxies, [respond = std::move(respond), granted, token] {
       log::ops().info("forced termination complete; hold request granted uuid:%{public}@", token);
-      self->done();
+      respond(granted);
     });
     return;
   }
   log::ops().info("hold request granted uuid:%{public}@", token);
-  done();
+  respond(std::move(granted));
 }
 
+}  // namespace handlers
 }  // namespace ek

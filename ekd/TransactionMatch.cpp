@@ -10,10 +10,11 @@
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDFormCache.h"
 #include "ekd/EkDPlugIn.h"
+#include "ekd/EkDPlugInHold.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDUserPrefs.h"
 #include "ekd/EkDWyreClient.h"
-#include "ekd/Transaction.h"
+#include "ekd/Handlers.h"
 #include "platform/cbor/Cbor.h"
 #include "platform/log/Log.h"
 #include "platform/process/Process.h"
@@ -100,25 +101,28 @@ struct CandidateList {
 
 }  // namespace
 
-void Transaction::matchPlugIns() {
+namespace handlers {
+
+Reply matchPlugIns(const Request& request, EkDServer& daemon) {
+  const EkDClientProcess& sender = request.sender;
   std::optional<Dictionary> rules;
-  if (const Value* value = request_.body.get(protocol::kRules)) {
+  if (const Value* value = request.body.get(protocol::kRules)) {
     if (!value->dictionary()) {
-      fail(protocol::kErrorInvalidRequest, "invalid request format (bad rules dictionary)");
-      return;
+      return Reply::failure(protocol::kErrorInvalidRequest,
+                            "invalid request format (bad rules dictionary)");
     }
     rules = *value->dictionary();
   }
-  const uint64_t* flagsValue = request_.body.getUnsigned(protocol::kFlags);
+  const uint64_t* flagsValue = request.body.getUnsigned(protocol::kFlags);
   const uint64_t flags = flagsValue ? *flagsValue : 0;
   const bool all = flags & protocol::kDiscoverAll;
-  if (all && (!sender().hasEntitlement(protocol::kEntitlementManager) || sender().isSandboxed())) {
-    fail(protocol::kErrorNotPermitted, "unauthorized discovery flag (EkDiscoverAll)");
-    return;
+  if (all && (!sender.hasEntitlement(protocol::kEntitlementManager) || sender.isSandboxed())) {
+    return Reply::failure(protocol::kErrorNotPermitted,
+                          "unauthorized discovery flag (EkDiscoverAll)");
   }
 
-  EkDServer& database = server();
-  std::optional<Value> exclusionsValue = database.userPrefs()->exclusions();
+  EkDatabase& database = daemon.database();
+  std::optional<Value> exclusionsValue = daemon.userPrefs()->exclusions();
   Candidates candidates = database.findPlugIns(rules.value_or(Dictionary{})).value_or(Candidates{});
   EK_PROBE1(discover_raw, static_cast<uint64_t>(candidates.size()));
   if (log::ops().enabled(log::Level::Info)) {
@@ -129,7 +133,7 @@ void Transaction::matchPlugIns() {
                       CandidateList{candidates});
     }
   }
-  preferBundleRelative(candidates, sender());
+  preferBundleRelative(candidates, sender);
 
   // The exclusions are walked as a list of rules; anything else in it excludes nothing.
   std::vector<const Dictionary*> exclusions;
@@ -141,7 +145,7 @@ void Transaction::matchPlugIns() {
     }
   }
   std::optional<std::string> pluginsPath;
-  if (const auto& bundle = sender().bundle()) pluginsPath = bundle->plugInsPath();
+  if (const auto& bundle = sender.bundle()) pluginsPath = bundle->plugInsPath();
 
   // Matches are shared with the override table: a replacing plug-in removed from the results
   // by a newer copy still marks the plug-ins it replaces. A removed match leaves an empty slot,
@@ -152,6 +156,8 @@ void Transaction::matchPlugIns() {
   std::unordered_map<std::string, MatchRef> overrides;
   const Dictionary* matchRules = rules ? &*rules : nullptr;
   EkDFormCache& forms = database.formCache();
+  // The holds as they stand now decide for every candidate.
+  const std::shared_ptr<const EkDPlugInHolds> holds = daemon.holds();
   for (const auto& plugIn : candidates) {
     EkDPlugIn::CurrentInfoRef current = plugIn->currentInfo();
     if (!all) {
@@ -163,13 +169,13 @@ void Transaction::matchPlugIns() {
         auto path = plugIn->path();
         if (!pluginsPath || !path || !path->starts_with(*pluginsPath)) continue;
       }
-      if (database.holdOnPlugIn(*plugIn)) continue;
+      if (holds->blocks(*plugIn)) continue;
     }
     if (!plugIn->match(matchRules, *current)) continue;
     bool excluded = false;
     for (const Dictionary* exclusion : exclusions) {
       if (plugIn->match(exclusion, *current)) {
-        log::ops().info("client %d plugin %{public}@ globally excluded", client_->pid(),
+        log::ops().info("client %d plugin %{public}@ globally excluded", request.pid,
                         plugIn->uuid());
         excluded = true;
         break;
@@ -177,8 +183,8 @@ void Transaction::matchPlugIns() {
     }
     if (excluded) continue;
     if (!all) {
-      if (auto reason = plugIn->allowForClient(sender(), *current)) {
-        log::ops().info("client %d cannot use plugin %{public}@: %{public}@", client_->pid(),
+      if (auto reason = plugIn->allowForClient(sender, *current)) {
+        log::ops().info("client %d cannot use plugin %{public}@: %{public}@", request.pid,
                         plugIn->uuid(), *reason);
         continue;
       }
@@ -277,11 +283,14 @@ void Transaction::matchPlugIns() {
     }
   }
   log::ops().debug("reply marshalled");
-  if (!EkDaemonClient::convertsToWyre(version())) {
-    done();
-    return;
-  }
-  doneWithEncoded(protocol::kMatches, [&results, &annotations](std::vector<uint8_t>& out) {
+  if (!EkDaemonClient::convertsToWyre(request.version)) return Reply{};
+  Reply reply;
+  reply.encodedKey = protocol::kMatches;
+  // Written once the handler has returned: the writer keeps what it writes.
+  auto kept = std::make_shared<std::pair<std::vector<MatchRef>, decltype(annotations)>>(
+      std::move(results), std::move(annotations));
+  reply.writeEncoded = [kept](std::vector<uint8_t>& out) {
+    const auto& [results, annotations] = *kept;
     size_t bound = 9;
     for (size_t i = 0; i < results.size(); ++i) {
       bound +=
@@ -295,7 +304,9 @@ void Transaction::matchPlugIns() {
     for (size_t i = 0; i < results.size() && out.size() <= limit; ++i) {
       EkDFormCache::write(*results[i]->form, {annotations[i].span(), results[i]->added}, out);
     }
-  });
+  };
+  return reply;
 }
 
+}  // namespace handlers
 }  // namespace ek

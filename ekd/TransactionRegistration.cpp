@@ -4,7 +4,7 @@
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDServer.h"
 #include "ekd/EkDWyreClient.h"
-#include "ekd/Transaction.h"
+#include "ekd/Handlers.h"
 #include "platform/log/Log.h"
 #include "platform/trace/Probes.h"
 
@@ -20,46 +20,51 @@ std::string urlForPath(const std::string& path) {
 
 }  // namespace
 
-void Transaction::addPlugIns() {
-  processPaths([this](const std::string& path, bool resolved) {
+namespace handlers {
+
+void addPlugIns(const Request& request, EkDServer& daemon, Respond respond) {
+  EkDatabase& database = daemon.database();
+  auto step = [&database](const std::string& path, bool resolved) -> Step {
     if (!resolved) {
-      fail(protocol::kErrorBadPath, log::format("invalid plugin path: %@", path));
-      return PathStep::Stop;
+      return Reply::failure(protocol::kErrorBadPath, log::format("invalid plugin path: %@", path));
     }
     EK_PROBE1(plugin_add, path.c_str());
-    if (server().addPlugIn(urlForPath(path))) {
+    if (database.addPlugIn(urlForPath(path))) {
       log::ops().defaultLevel("failed to register plug-in at %@", path);
-      fail(protocol::kErrorRegistry, log::format("unable to register plug-in at %@", path));
-      return PathStep::Stop;
+      return Reply::failure(protocol::kErrorRegistry,
+                            log::format("unable to register plug-in at %@", path));
     }
-    return PathStep::Continue;
-  });
+    return std::nullopt;
+  };
+  forEachPathInSlices(request, daemon, std::move(step), std::move(respond));
 }
 
-void Transaction::removePlugIns() {
-  processPaths([this](const std::string& path, bool resolved) {
+void removePlugIns(const Request& request, EkDServer& daemon, Respond respond) {
+  EkDatabase& database = daemon.database();
+  auto step = [&request, &database](const std::string& path, bool resolved) -> Step {
     EK_PROBE2(plugin_remove, path.c_str(), resolved);
-    if (!sender().hasEntitlement(protocol::kEntitlementManager)) {
+    if (!request.sender.hasEntitlement(protocol::kEntitlementManager)) {
       log::process().defaultLevel(
           "refused request from pid=%d to remove plug-in at %@ - client lacks required "
           "entitlement",
-          client_->pid(), path);
-      fail(protocol::kErrorNotPermitted, "caller lacks entitlement for this operation");
-      return PathStep::Stop;
+          request.pid, path);
+      return Reply::failure(protocol::kErrorNotPermitted,
+                            "caller lacks entitlement for this operation");
     }
-    if (server().removePlugIn(urlForPath(path))) {
-      fail(protocol::kErrorBadPath, log::format("no plugin at %@", path));
-      return PathStep::Stop;
+    if (database.removePlugIn(urlForPath(path))) {
+      return Reply::failure(protocol::kErrorBadPath, log::format("no plugin at %@", path));
     }
-    return PathStep::Continue;
-  });
+    return std::nullopt;
+  };
+  forEachPathInSlices(request, daemon, std::move(step), std::move(respond));
 }
 
-void Transaction::bulkPlugIns() {
-  const uint64_t* flags = request_.body.getUnsigned(protocol::kFlags);
+Reply bulkPlugIns(const Request& request, EkDServer&) {
+  const uint64_t* flags = request.body.getUnsigned(protocol::kFlags);
   uint64_t value = flags ? *flags : 0;
   log::ops().info("bulk options 0x%lx not supported", static_cast<uint32_t>(value));
-  done();
+  return Reply{};
 }
 
+}  // namespace handlers
 }  // namespace ek

@@ -6,28 +6,29 @@
 
 #include "Ekora/EkProtocol.h"
 #include "ekd/EkDServer.h"
-#include "ekd/Transaction.h"
+#include "ekd/Handlers.h"
 #include "platform/paths/Directories.h"
 
 #ifndef EKORA_VERSION
 #define EKORA_VERSION "unknown"
 #endif
 
-namespace ek {
+namespace ek::handlers {
 
-void Transaction::reportStatus() {
-  EkDServer& daemon = server();
+Reply reportStatus(const Request&, EkDServer& daemon) {
+  Reply reply;
+  Dictionary& members = reply.members;
   auto uptime = std::chrono::steady_clock::now() - daemon.startTime();
-  reply()["version"] = Value(EKORA_VERSION);
-  reply()["pid"] = Value(static_cast<uint64_t>(::getpid()));
-  reply()["uptime"] = Value(std::chrono::duration<double>(uptime).count());
-  reply()["socket"] = Value(daemon.service()->path());
-  reply()["state"] = Value(paths::stateDir());
-  reply()["system"] = Value(paths::systemRoot());
-  reply()["plugins"] = Value(static_cast<uint64_t>(daemon.registry()->queryUuids({}).size()));
-  reply()["connections"] = Value(static_cast<uint64_t>(daemon.service()->connectionCount()));
-  reply()["holds"] = Value(static_cast<uint64_t>(daemon.holdCount()));
-  done();
+  members["version"] = Value(EKORA_VERSION);
+  members["pid"] = Value(static_cast<uint64_t>(::getpid()));
+  members["uptime"] = Value(std::chrono::duration<double>(uptime).count());
+  members["socket"] = Value(daemon.service()->path());
+  members["state"] = Value(paths::stateDir());
+  members["system"] = Value(paths::systemRoot());
+  members["plugins"] = Value(static_cast<uint64_t>(daemon.registry()->queryUuids({}).size()));
+  members["connections"] = Value(static_cast<uint64_t>(daemon.service()->connectionCount()));
+  members["holds"] = Value(static_cast<uint64_t>(daemon.holdCount()));
+  return reply;
 }
 
-}  // namespace ek
+}  // namespace ek::handlers

@@ -198,7 +198,7 @@ int main(int argc, char* argv[]) {
     return 1;
   }
   server->setVerbose(verbose);
-  server->setCacheLimit(static_cast<uint32_t>(cacheLimit));
+  server->database().setCacheLimit(static_cast<uint32_t>(cacheLimit));
 
   termination.async_wait([server](const asio::error_code& ec, int) {
     if (ec) return;

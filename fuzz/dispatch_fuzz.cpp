@@ -424,7 +424,7 @@ void installPlugIns(Fixture& f) {
   f.registry->queue()->async([&] { drained.set_value(); });
   waitFor(drained.get_future());
   for (const PlugInSpec& spec : kPlugIns) {
-    auto plugIn = f.server->findPlugIn(*ek::Uuid::parse(spec.uuid));
+    auto plugIn = f.server->database().findPlugIn(*ek::Uuid::parse(spec.uuid));
     if (!plugIn) fail("a fixture plug-in yields no record");
     f.plugIns.push_back(std::move(plugIn));
   }
@@ -468,8 +468,8 @@ Fixture& fixture() {
       f->clients.push_back(connectClient(*f));
       f->sandboxed.push_back(spec.sandboxed);
     }
-    f->server->databaseQueue()->sync(
-        [&] { f->baselineAnnotations = f->server->annotations().annotations(); });
+    f->server->database().databaseQueue()->sync(
+        [&] { f->baselineAnnotations = f->server->database().annotations().annotations(); });
     return f;
   }();
   return *shared;
@@ -552,8 +552,8 @@ void checkReply(const ek::Value& request, const ek::Value& reply) {
 
 // Puts the stored annotations back as they were before the input.
 void restoreAnnotations(Fixture& f) {
-  f.server->databaseQueue()->sync([&] {
-    ek::EkDAnnotationStore& store = f.server->annotations();
+  f.server->database().databaseQueue()->sync([&] {
+    ek::EkDAnnotationStore& store = f.server->database().annotations();
     if (store.annotations() == f.baselineAnnotations) return;
     store.deferSaves();
     std::vector<std::string> keys;
