@@ -98,9 +98,10 @@ void Transaction::prepareReply() {
   }
   replied_ = true;
   if (beforeReply_) std::exchange(beforeReply_, nullptr)();
-  // Lines logged for a request are out before its reply, unless other requests wait: then
-  // they go out together a moment later, rather than one write each.
-  if (!server().mainQueue()->hasWaiting()) log::flush();
+  // Diagnostic lines logged for a request are out before its reply, unless other requests
+  // wait: then they go out together a moment later, rather than one write each. Default-level
+  // lines always wait for the next batch (log::bufferLines).
+  if (!server().mainQueue()->hasWaiting()) log::flushDiagnostics();
 }
 
 void Transaction::done() {
