@@ -20,9 +20,8 @@ Result<std::string> issueFileExtension(const EkFileURL& url, EkSandbox& sandbox)
   return token;
 }
 
-Result<std::string> issueBundleExtension(std::string_view bundlePath,
-                                         const std::optional<EkBundleIdentity>& identity,
-                                         std::string_view relative, EkSandbox& sandbox) {
+Result<void> checkRegisteredBundle(std::string_view bundlePath,
+                                   const std::optional<EkBundleIdentity>& identity) {
   const std::string bundle(bundlePath);
   if (!identity) {
     return EkError::posix(ESTALE,
@@ -35,14 +34,30 @@ Result<std::string> issueBundleExtension(std::string_view bundlePath,
     return S_ISDIR(status.st_mode) && static_cast<uint64_t>(status.st_dev) == identity->device &&
            static_cast<uint64_t>(status.st_ino) == identity->inode;
   };
-  struct stat named {};
+  // Named by its canonical path, the directory that lstat finds is the one stat would: one
+  // call then answers for both.
+  bool same = true;
+  if (bundle != identity->canonicalPath) {
+    struct stat named {};
+    if (::stat(bundle.c_str(), &named) != 0) return EkError::fromErrno(errno, bundle);
+    same = registered(named);
+  }
   struct stat canonical {};
-  if (::stat(bundle.c_str(), &named) != 0) return EkError::fromErrno(errno, bundle);
   if (::lstat(identity->canonicalPath.c_str(), &canonical) != 0) {
     return EkError::fromErrno(errno, identity->canonicalPath);
   }
-  if (!registered(named) || !registered(canonical)) {
+  same = same && registered(canonical);
+  if (!same) {
     return EkError::posix(ESTALE, fmt::format("{}: not the directory that was registered", bundle));
+  }
+  return {};
+}
+
+Result<std::string> issueBundleExtension(std::string_view bundlePath,
+                                         const std::optional<EkBundleIdentity>& identity,
+                                         std::string_view relative, EkSandbox& sandbox) {
+  if (Result<void> checked = checkRegisteredBundle(bundlePath, identity); !checked) {
+    return std::move(checked).error();
   }
   const std::string& root = identity->canonicalPath;
   std::string subject = root;

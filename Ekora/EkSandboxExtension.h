@@ -26,6 +26,11 @@ struct EkBundleIdentity {
   uint64_t inode = 0;
   std::string canonicalPath;
 };
+// Success while the directory at bundlePath is the one registered: a directory, not a link,
+// with the recorded device and inode, both as named and at the recorded canonical path (one
+// lstat when the two are the same path). ESTALE otherwise, and when nothing was recorded.
+Result<void> checkRegisteredBundle(std::string_view bundlePath,
+                                   const std::optional<EkBundleIdentity>& identity);
 // A read-only extension for the registered bundle at bundlePath (relative empty or ".") or
 // for relative inside it. Issued only while the directory at bundlePath is the one registered
 // (ESTALE otherwise, and when nothing was recorded), and only for a target whose canonical

@@ -7,6 +7,8 @@
 #include <atomic>
 #include <cerrno>
 #include <cmath>
+#include <cstdio>
+#include <cstring>
 #include <latch>
 #include <system_error>
 #include <thread>
@@ -175,6 +177,30 @@ struct Worker {
 
 }  // namespace
 
+std::optional<double> processCpuSeconds(int pid) {
+  FILE* file = std::fopen(fmt::format("/proc/{}/stat", pid).c_str(), "re");
+  if (!file) return std::nullopt;
+  char line[1024];
+  bool read = std::fgets(line, sizeof line, file) != nullptr;
+  std::fclose(file);
+  if (!read) return std::nullopt;
+  // The command name may hold spaces and parentheses: the fields start after the last ')'.
+  const char* fields = std::strrchr(line, ')');
+  if (!fields) return std::nullopt;
+  unsigned long long utime = 0, stime = 0;
+  // Fields 3.. after the name; utime and stime are fields 14 and 15.
+  if (std::sscanf(fields + 1, " %*c %*d %*d %*d %*d %*d %*u %*u %*u %*u %*u %llu %llu", &utime,
+                  &stime) != 2) {
+    return std::nullopt;
+  }
+  return static_cast<double>(utime + stime) / static_cast<double>(::sysconf(_SC_CLK_TCK));
+}
+
+std::optional<double> LoadResult::cpuMicrosPerRequest() const {
+  if (!cpuSeconds || requests == 0) return std::nullopt;
+  return *cpuSeconds * 1e6 / static_cast<double>(requests);
+}
+
 uint64_t percentile(const std::vector<uint64_t>& sorted, double fraction) {
   if (sorted.empty()) return 0;
   double rank = std::ceil(std::clamp(fraction, 0.0, 1.0) * static_cast<double>(sorted.size()));
@@ -205,6 +231,7 @@ LoadResult combine(const std::vector<LoadResult>& runs) {
     sum.errorReplies += run.errorReplies;
     sum.failures += run.failures;
     sum.seconds += run.seconds;
+    if (run.cpuSeconds) sum.cpuSeconds = sum.cpuSeconds.value_or(0) + *run.cpuSeconds;
     if (sum.firstError.empty()) sum.firstError = run.firstError;
     if (sum.firstFailure.empty()) sum.firstFailure = run.firstFailure;
     sum.latenciesNs.insert(sum.latenciesNs.end(), run.latenciesNs.begin(), run.latenciesNs.end());
@@ -271,9 +298,18 @@ Result<LoadResult> runLoad(const LoadOptions& options,
   start = Clock::now();
   go.store(true, std::memory_order_release);
   go.notify_all();
-  for (std::thread& thread : threads) thread.join();
-
+  std::optional<double> cpuBefore;
+  if (options.cpuOfPid) {
+    std::this_thread::sleep_until(start + warmup);
+    cpuBefore = processCpuSeconds(*options.cpuOfPid);
+  }
   LoadResult total;
+  for (std::thread& thread : threads) thread.join();
+  if (cpuBefore) {
+    std::optional<double> cpuAfter = processCpuSeconds(*options.cpuOfPid);
+    if (cpuAfter) total.cpuSeconds = *cpuAfter - *cpuBefore;
+  }
+
   Clock::time_point measureStart = start + warmup;
   Clock::time_point last = measureStart;
   for (Worker& worker : workers) {

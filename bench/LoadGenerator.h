@@ -33,6 +33,10 @@ struct LoadOptions {
   // How a connection waits for its reply (FrameReader::Wait): for readiness by default, as the
   // client library's event loop does; asleep in recv with this set.
   bool waitInRecv = false;
+  // A process whose CPU time (utime + stime, /proc/<pid>/stat) over the measured phase the
+  // result reports: the daemon's cost per request, which moves far less than latency does on a
+  // shared machine.
+  std::optional<int> cpuOfPid;
 };
 
 // Latency figures in microseconds.
@@ -54,6 +58,8 @@ struct LoadResult {
   uint64_t failures = 0;
   // Wall time of the measured phase, up to the last reply.
   double seconds = 0;
+  // CPU seconds options.cpuOfPid used over the measured phase, when asked and readable.
+  std::optional<double> cpuSeconds;
   // What went wrong first, for the report: the "error" text of the first error reply (or its
   // code when it has none), and the first failure's cause.
   std::string firstError;
@@ -62,6 +68,8 @@ struct LoadResult {
   std::vector<uint64_t> latenciesNs;
 
   double requestsPerSecond() const { return seconds > 0 ? requests / seconds : 0; }
+  // Microseconds of the measured process's CPU per request, when measured.
+  std::optional<double> cpuMicrosPerRequest() const;
   LatencySummary latency() const;
 };
 
@@ -78,6 +86,9 @@ Result<LoadResult> runLoad(const LoadOptions& options,
 
 // The request connection `connection` of `connections` sends first among `requests`.
 size_t firstRequestOf(unsigned connection, unsigned connections, size_t requests);
+
+// CPU seconds (utime + stime) process pid has used; nullopt when it cannot be read.
+std::optional<double> processCpuSeconds(int pid);
 
 // Sums several runs: their requests, errors, failures, times and latencies.
 LoadResult combine(const std::vector<LoadResult>& runs);

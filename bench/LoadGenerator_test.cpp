@@ -66,6 +66,15 @@ TEST(PercentileTest, NearestRankOfSortedValues) {
   }
 }
 
+TEST(ProcessCpuTest, ReadsOwnTimeAndRefusesAMissingProcess) {
+  volatile uint64_t spin = 0;
+  for (uint64_t i = 0; i < 50'000'000; ++i) spin = spin + i;
+  std::optional<double> own = processCpuSeconds(static_cast<int>(::getpid()));
+  ASSERT_TRUE(own.has_value());
+  EXPECT_GT(*own, 0.0);
+  EXPECT_FALSE(processCpuSeconds(1 << 30).has_value());
+}
+
 TEST(LoadResultTest, LatencySummaryIsInMicroseconds) {
   LoadResult result;
   for (uint64_t i = 1; i <= 100; ++i) result.latenciesNs.push_back(i * 1000);

@@ -6,17 +6,20 @@
 
 #include <CLI/CLI.hpp>
 #include <cstdio>
+#include <cstring>
 #include <fstream>
 #include <iostream>
 #include <memory>
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
+#include <system_error>
 #include <vector>
 
 #include "Ekora/EkProtocol.h"
 #include "bench/EchoServer.h"
 #include "bench/FrameIo.h"
+#include "bench/LeanEcho.h"
 #include "bench/LoadGenerator.h"
 #include "platform/cbor/Cbor.h"
 #include "platform/json/WireJson.h"
@@ -58,6 +61,8 @@ struct Options {
   bool encodeReply = false;
   bool decodeReplies = false;
   bool waitInRecv = false;
+  bool lean = false;
+  int daemonPid = 0;
   std::string request;
   std::string requestsFile;
 };
@@ -76,6 +81,8 @@ struct Requests {
 };
 
 struct Runs {
+  enum class Kind { Socket, Encode, Lean };
+  Kind kind = Kind::Socket;
   std::string label;
   std::string socket;
   std::vector<LoadResult> rounds;
@@ -100,6 +107,7 @@ nlohmann::ordered_json toJson(const LoadResult& run) {
                        {"p99", latency.p99},
                        {"max", latency.max},
                        {"mean", latency.mean}};
+  if (std::optional<double> cpu = run.cpuMicrosPerRequest()) out["cpu_us_per_request"] = *cpu;
   out["error_replies"] = run.errorReplies;
   out["failures"] = run.failures;
   if (!run.firstError.empty()) out["first_error"] = run.firstError;
@@ -109,10 +117,11 @@ nlohmann::ordered_json toJson(const LoadResult& run) {
 
 std::string row(const std::string& name, const LoadResult& run) {
   ek::bench::LatencySummary l = run.latency();
+  std::optional<double> cpu = run.cpuMicrosPerRequest();
   return fmt::format(
-      "{:<12} {:>10} {:>8.2f} {:>10.0f} {:>9.1f} {:>9.1f} {:>9.1f} {:>9.1f} {:>7} {:>8}\n", name,
-      run.requests, run.seconds, run.requestsPerSecond(), l.p50, l.p90, l.p99, l.max,
-      run.errorReplies, run.failures);
+      "{:<12} {:>10} {:>8.2f} {:>10.0f} {:>9.1f} {:>9.1f} {:>9.1f} {:>9.1f} {:>9} {:>7} {:>8}\n",
+      name, run.requests, run.seconds, run.requestsPerSecond(), l.p50, l.p90, l.p99, l.max,
+      cpu ? fmt::format("{:.1f}", *cpu) : std::string("-"), run.errorReplies, run.failures);
 }
 
 void printReadable(const Options& options, const Requests& requests, const std::vector<Runs>& all) {
@@ -125,8 +134,9 @@ void printReadable(const Options& options, const Requests& requests, const std::
       options.connections, options.connections == 1 ? "" : "s", bound, options.warmup,
       options.rounds, options.rounds == 1 ? "" : "s", requests.describe(options));
   for (const Runs& runs : all) fmt::print("{:<12} {}\n", runs.label, runs.socket);
-  fmt::print("{:<12} {:>10} {:>8} {:>10} {:>9} {:>9} {:>9} {:>9} {:>7} {:>8}\n", "run", "requests",
-             "seconds", "req/s", "p50", "p90", "p99", "max", "errors", "failures");
+  fmt::print("{:<12} {:>10} {:>8} {:>10} {:>9} {:>9} {:>9} {:>9} {:>9} {:>7} {:>8}\n", "run",
+             "requests", "seconds", "req/s", "p50", "p90", "p99", "max", "cpu/req", "errors",
+             "failures");
   for (size_t round = 0; round < options.rounds; ++round) {
     for (const Runs& runs : all) {
       fmt::print("{}", row(fmt::format("{} #{}", runs.label, round + 1), runs.rounds[round]));
@@ -137,12 +147,14 @@ void printReadable(const Options& options, const Requests& requests, const std::
       fmt::print("{}", row(runs.label + " all", ek::bench::combine(runs.rounds)));
     }
   }
-  if (all.size() == 2) {
-    LoadResult daemon = ek::bench::combine(all[0].rounds);
-    LoadResult echo = ek::bench::combine(all[1].rounds);
-    fmt::print("daemon / {}: p50 {:.2f}x, req/s {:.2f}x\n", all[1].label,
-               ratio(daemon.latency().p50, echo.latency().p50),
-               ratio(daemon.requestsPerSecond(), echo.requestsPerSecond()));
+  for (size_t a = 0; a < all.size(); ++a) {
+    for (size_t b = a + 1; b < all.size(); ++b) {
+      LoadResult x = ek::bench::combine(all[a].rounds);
+      LoadResult y = ek::bench::combine(all[b].rounds);
+      fmt::print("{} / {}: p50 {:.2f}x, req/s {:.2f}x\n", all[a].label, all[b].label,
+                 ratio(x.latency().p50, y.latency().p50),
+                 ratio(x.requestsPerSecond(), y.requestsPerSecond()));
+    }
   }
   for (const Runs& runs : all) {
     LoadResult sum = ek::bench::combine(runs.rounds);
@@ -176,13 +188,17 @@ void printJson(const Options& options, const Requests& requests, const std::vect
     entry["runs"] = std::move(rounds);
     out[runs.label] = std::move(entry);
   }
-  if (all.size() == 2) {
-    LoadResult daemon = ek::bench::combine(all[0].rounds);
-    LoadResult echo = ek::bench::combine(all[1].rounds);
-    out["ratios"] = {
-        {"p50", ratio(daemon.latency().p50, echo.latency().p50)},
-        {"requests_per_second", ratio(daemon.requestsPerSecond(), echo.requestsPerSecond())}};
+  nlohmann::ordered_json ratios;
+  for (size_t a = 0; a < all.size(); ++a) {
+    for (size_t b = a + 1; b < all.size(); ++b) {
+      LoadResult x = ek::bench::combine(all[a].rounds);
+      LoadResult y = ek::bench::combine(all[b].rounds);
+      ratios[all[a].label + "/" + all[b].label] = {
+          {"p50", ratio(x.latency().p50, y.latency().p50)},
+          {"requests_per_second", ratio(x.requestsPerSecond(), y.requestsPerSecond())}};
+    }
   }
+  if (!ratios.empty()) out["ratios"] = std::move(ratios);
   std::cout << out.dump() << "\n";
 }
 
@@ -310,6 +326,25 @@ LoadResult timeEncoding(const ek::Value& reply, const Options& options) {
   return result;
 }
 
+// The floor: the blocking C client against the blocking C server, the same body.
+LoadResult runLean(const char* path, const std::vector<uint8_t>& body, const Options& options) {
+  LoadResult result;
+  lean_echo_result lean;
+  if (lean_echo_run(path, options.connections, options.warmup, options.duration, body.data(),
+                    body.size(), &lean) != 0) {
+    result.failures = 1;
+    result.firstFailure = std::error_code(errno, std::generic_category()).message();
+    return result;
+  }
+  result.requests = lean.requests;
+  result.failures = lean.failures;
+  if (lean.failures) result.firstFailure = "a connection broke";
+  result.seconds = lean.seconds;
+  result.latenciesNs.assign(lean.latencies_ns, lean.latencies_ns + lean.requests);
+  lean_echo_result_free(&lean);
+  return result;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -348,6 +383,13 @@ int main(int argc, char** argv) {
   app.add_flag("--wait-in-recv", options.waitInRecv,
                "let each connection wait for its reply asleep in recv instead of waiting for "
                "readiness as the client library's event loop does");
+  app.add_flag("--lean", options.lean,
+               "also measure the floor: a blocking C client against a blocking C echo server, "
+               "in the same alternating rounds (duration-bounded)");
+  app.add_option("--daemon-pid", options.daemonPid,
+                 "report this process's CPU time per request (utime + stime) beside the "
+                 "daemon's figures")
+      ->check(CLI::Range(1, 1 << 30));
   app.add_flag("--json", options.json, "print one JSON object");
   auto* requestsFile = app.add_option(
       "--requests", options.requestsFile,
@@ -362,7 +404,7 @@ int main(int argc, char** argv) {
     return code == 0 ? kSuccess : kUsage;
   }
   if (options.count && duration->count() == 0) options.duration = kCountTimeLimitSeconds;
-  if (options.rounds == 0) options.rounds = options.baseline ? 2 : 1;
+  if (options.rounds == 0) options.rounds = options.baseline || options.lean ? 2 : 1;
 
   Requests requests;
   if (!options.requestsFile.empty()) {
@@ -396,7 +438,7 @@ int main(int argc, char** argv) {
                        : !options.service.empty()
                            ? ek::paths::servicePath(options.service)
                            : ek::paths::servicePath(ek::protocol::kServiceName);
-    all.push_back({"daemon", path, {}});
+    all.push_back({Runs::Kind::Socket, "daemon", path, {}});
   }
   std::unique_ptr<ek::bench::EchoServer> echo;
   if (options.baseline || options.echoSelfTest) {
@@ -406,7 +448,17 @@ int main(int argc, char** argv) {
       return kSetupFailed;
     }
     echo = std::move(started).value();
-    all.push_back({"echo", echo->socketPath(), {}});
+    all.push_back({Runs::Kind::Socket, "echo", echo->socketPath(), {}});
+  }
+  std::unique_ptr<lean_echo_server, void (*)(lean_echo_server*)> lean(nullptr,
+                                                                      lean_echo_server_stop);
+  if (options.lean) {
+    lean.reset(lean_echo_server_start());
+    if (!lean) {
+      std::fprintf(stderr, "ekbench: lean echo server: %s\n", std::strerror(errno));
+      return kSetupFailed;
+    }
+    all.push_back({Runs::Kind::Lean, "lean", lean_echo_server_path(lean.get()), {}});
   }
 
   std::optional<ek::Value> reply;
@@ -417,7 +469,8 @@ int main(int argc, char** argv) {
       return kSetupFailed;
     }
     reply = std::move(fetched).value();
-    all.push_back({"encode",
+    all.push_back({Runs::Kind::Encode,
+                   "encode",
                    fmt::format("the reply to the first request, {} bytes of CBOR",
                                ek::cbor::encode(*reply).size()),
                    {}});
@@ -426,8 +479,12 @@ int main(int argc, char** argv) {
   // Alternating the targets spreads the machine's drift over both of them.
   for (unsigned round = 0; round < options.rounds; ++round) {
     for (Runs& runs : all) {
-      if (reply && &runs == &all.back()) {
+      if (runs.kind == Runs::Kind::Encode) {
         runs.rounds.push_back(timeEncoding(*reply, options));
+        continue;
+      }
+      if (runs.kind == Runs::Kind::Lean) {
+        runs.rounds.push_back(runLean(runs.socket.c_str(), requests.bodies[0], options));
         continue;
       }
       LoadOptions load;
@@ -438,6 +495,7 @@ int main(int argc, char** argv) {
       if (options.count) load.count = options.count;
       load.decodeReplies = options.decodeReplies;
       load.waitInRecv = options.waitInRecv;
+      if (options.daemonPid && runs.label == "daemon") load.cpuOfPid = options.daemonPid;
       load.replyTimeout = std::chrono::milliseconds(
           std::max<int64_t>(1, static_cast<int64_t>(options.timeout * 1000)));
       ek::Result<LoadResult> result =

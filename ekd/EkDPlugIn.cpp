@@ -384,7 +384,7 @@ void EkDPlugIn::augmentForm(Dictionary& form, const CurrentInfo& current) const 
   const std::string* service =
       current.bundleIdentifier ? current.bundleIdentifier->string() : nullptr;
   Result<std::string> token =
-      issueServiceExtension(service ? std::string_view(*service) : std::string_view(), sandbox());
+      serviceExtension(service ? std::string_view(*service) : std::string_view(), current);
   if (token) {
     form.insert_or_assign(std::string(pk::form::kServiceExtension), std::move(token).value());
   } else {
@@ -418,9 +418,9 @@ std::optional<Dictionary> EkDPlugIn::issueResourceExtensions(const Value& paths,
     // write, and a "../..", an absolute path or a link out of the bundle, or a bundle
     // directory swapped for a link, must not hand a host the rest of the disk.
     const bool itself = *relative == kBundleItself;
-    Result<std::string> token = ek::issueBundleExtension(
-        bundlePath, current.bundle, itself ? std::string_view() : std::string_view(*relative),
-        sandbox());
+    Result<std::string> token =
+        itself ? bundleItselfExtension(bundlePath, current)
+               : ek::issueBundleExtension(bundlePath, current.bundle, *relative, sandbox());
     if (!token) {
       const std::string targetPath = itself ? bundlePath : paths::join(bundlePath, *relative);
       log::ops().info(kLogResourceExtensionFailed, targetPath, bundlePath,
@@ -430,6 +430,33 @@ std::optional<Dictionary> EkDPlugIn::issueResourceExtensions(const Value& paths,
     result.insert_or_assign(*relative, std::move(token).value());
   }
   return result;
+}
+
+Result<std::string> EkDPlugIn::bundleItselfExtension(const std::string& bundlePath,
+                                                     const CurrentInfo& current) const {
+  // Checked on every use: the token names a path, and is given out only while the directory
+  // there is the one registered.
+  if (Result<void> checked = checkRegisteredBundle(bundlePath, current.bundle); !checked) {
+    return std::move(checked).error();
+  }
+  std::lock_guard lock(current.tokens->mutex);
+  if (current.tokens->bundle.empty()) {
+    Result<std::string> token = ek::issueBundleExtension(bundlePath, current.bundle, {}, sandbox());
+    if (!token) return token;
+    current.tokens->bundle = std::move(token).value();
+  }
+  return current.tokens->bundle;
+}
+
+Result<std::string> EkDPlugIn::serviceExtension(std::string_view service,
+                                                const CurrentInfo& current) const {
+  std::lock_guard lock(current.tokens->mutex);
+  if (current.tokens->service.empty()) {
+    Result<std::string> token = issueServiceExtension(service, sandbox());
+    if (!token) return token;
+    current.tokens->service = std::move(token).value();
+  }
+  return current.tokens->service;
 }
 
 Result<std::string> EkDPlugIn::issueBundleExtension() const {

@@ -96,6 +96,16 @@ class EkDPlugIn : public EkPlugInCore {
     const Value* hostEntitlement = nullptr;   // pluginKey "ZuExtensionHostEntitlement"
     // The bundle directory as registered; rights to the bundle need it to be still in place.
     std::optional<EkBundleIdentity> bundle;
+    // Tokens issued while this info is current and handed out again instead of issued anew
+    // for every form: the bundle's own read extension, given only after the directory is
+    // checked again each time, and the service extension. A change of the record (a new
+    // info) starts without them.
+    struct Tokens {
+      std::mutex mutex;
+      std::string bundle;   // guarded by mutex; empty until issued
+      std::string service;  // guarded by mutex; empty until issued
+    };
+    std::shared_ptr<Tokens> tokens = std::make_shared<Tokens>();
 
     const Value* plugInValue(std::string_view key) const;
     const Value* attribute(std::string_view key) const;
@@ -218,6 +228,11 @@ class EkDPlugIn : public EkPlugInCore {
 
   bool initWithVRData(const vantor::PlugInProxy& proxy);
   EkSandbox& sandbox() const;
+  // The read extension for the bundle itself, or the service extension, from current's
+  // tokens or issued and kept there.
+  Result<std::string> bundleItselfExtension(const std::string& bundlePath,
+                                            const CurrentInfo& current) const;
+  Result<std::string> serviceExtension(std::string_view service, const CurrentInfo& current) const;
   CurrentInfoRef makeCurrentInfo(DictionaryRef info, const vantor::PlugInProxy* proxy) const;
   // infoKey without sharing ownership, for lookups against one CurrentInfo.
   const Value* infoValue(const CurrentInfo& current, std::string_view key) const;

@@ -59,7 +59,7 @@ void Transaction::dispatch() {
     send(Reply::failure(protocol::kErrorInvalidRequest, protocol::kMsgUnrecognized));
     return;
   }
-  decoded_.emplace(request_.body, version_.load(), *sender_, client_->pid(), client_);
+  decoded_.emplace(Request{request_.body, version_.load(), *sender_, client_->pid(), client_});
   if (handler->answer) {
     send(handler->answer(*decoded_, server()));
     return;
@@ -75,9 +75,10 @@ void Transaction::send(Reply reply) {
     std::abort();
   }
   replied_ = true;
-  // Lines logged for a request are out before its reply, unless other requests wait: then
-  // they go out together a moment later, rather than one write each.
-  if (!server().mainQueue()->hasWaiting()) log::flush();
+  // Diagnostic lines logged for a request are out before its reply, unless other requests
+  // wait: then they go out together a moment later, rather than one write each. Default-level
+  // lines always wait for the next batch (log::bufferLines).
+  if (!server().mainQueue()->hasWaiting()) log::flushDiagnostics();
   Dictionary& members = reply.members;
   if (reply.error) {
     // The code travels as a signed 32-bit value widened to 64 bits.

@@ -130,8 +130,9 @@ int main(int argc, char* argv[]) {
   // thread, and with an arena per thread the memory each frees stays apart from the others':
   // the footprint then creeps up for long after start instead of levelling off.
   mallopt(M_ARENA_MAX, 1);
-  // Under load, many requests' lines share one write; a reply still follows its lines when
-  // no other request waits (see Transaction::prepareReply).
+  // Many lines share one write: the default-level lines that requests log cost them no system
+  // call; a reply still follows its diagnostic (info, debug) lines when no other request waits
+  // (see Transaction::prepareReply).
   log::bufferLines(std::chrono::milliseconds(10));
   flushLogOnCrash();
   log::ops().info("ekd is launching");

@@ -211,7 +211,7 @@ TEST_F(FindRequests, UnknownUuidIsNotFound) {
 TEST_F(FindRequests, RequestWithNeitherKeyIsNotFound) {
   addExamples();
   expectNotFound(ask(request("find")));
-  EXPECT_NE(daemon_.log().find("plugin not found"), std::string::npos);
+  EXPECT_TRUE(daemon_.logShows("plugin not found"));
 }
 
 TEST_F(FindRequests, BarePathIsNotAUrl) {
@@ -326,9 +326,7 @@ TEST_F(FindRequests, AddOfADirectoryThatIsNoBundleIsRefusedByTheRegistry) {
   Value reply = ask(pathsRequest("add", {Value(empty.string())}));
   EXPECT_EQ(replyErrorCode(reply), 2) << reply.description();
   EXPECT_EQ(replyError(reply), "unable to register plug-in at " + empty.string());
-  EXPECT_NE(daemon_.log().find("failed to register plug-in at " + empty.string()),
-            std::string::npos)
-      << daemon_.log();
+  EXPECT_TRUE(daemon_.logShows("failed to register plug-in at " + empty.string())) << daemon_.log();
 }
 
 TEST_F(FindRequests, AddResolvesThePathBeforeRegistering) {
@@ -383,10 +381,9 @@ TEST_F(FindRequests, RemoveWithoutTheEntitlementIsRefusedAndRemovesNothing) {
   Value reply = ask(pathsRequest("remove", {Value(viewer())}));
   EXPECT_EQ(replyErrorCode(reply), 11);
   EXPECT_EQ(replyError(reply), "caller lacks entitlement for this operation");
-  EXPECT_NE(daemon_.log().find("refused request from pid=" + std::to_string(getpid()) +
+  EXPECT_TRUE(daemon_.logShows("refused request from pid=" + std::to_string(getpid()) +
                                " to remove plug-in at " + viewer() +
-                               " - client lacks required entitlement"),
-            std::string::npos)
+                               " - client lacks required entitlement"))
       << daemon_.log();
   expectFound(findByUrl(thumbs()), kThumbsId, thumbs());
 }

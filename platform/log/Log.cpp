@@ -222,9 +222,11 @@ class LineBuffer {
     std::atexit([] { LineBuffer::shared().flush(); });
   }
 
-  void add(const std::string& line, bool now) {
+  void add(const std::string& line, Level level) {
+    const bool now = level == Level::Error;
     std::lock_guard lock(mutex_);
     pending_ += line;
+    if (level == Level::Info || level == Level::Debug) diagnostic_ = true;
     lastLine_ = std::chrono::steady_clock::now();
     if (now || pending_.size() >= kMaxPending) {
       writeLocked();
@@ -237,6 +239,11 @@ class LineBuffer {
   void flush() {
     std::lock_guard lock(mutex_);
     writeLocked();
+  }
+
+  void flushDiagnostics() {
+    std::lock_guard lock(mutex_);
+    if (diagnostic_) writeLocked();
   }
 
   void flushFromSignal() {
@@ -252,6 +259,7 @@ class LineBuffer {
 
   // Written under mutex_, so that batches never overtake one another.
   void writeLocked() {
+    diagnostic_ = false;
     if (pending_.empty()) return;
     writeAll(STDERR_FILENO, pending_);
     pending_.clear();
@@ -279,6 +287,7 @@ class LineBuffer {
   bool sleeping_ = false;
   std::chrono::steady_clock::time_point lastLine_;
   std::string pending_;
+  bool diagnostic_ = false;  // an info or debug line is among pending_
 };
 
 class StandardErrorSink : public Sink {
@@ -288,7 +297,7 @@ class StandardErrorSink : public Sink {
                                   program_invocation_short_name, processId());
     LineBuffer& buffer = LineBuffer::shared();
     if (buffer.enabled()) {
-      buffer.add(line, record.level == Level::Error);
+      buffer.add(line, record.level);
     } else {
       writeAll(STDERR_FILENO, line);
     }
@@ -697,6 +706,10 @@ void bufferLines(std::chrono::milliseconds delay) {
 
 void flush() {
   if (auto sink = Registry::shared().sink()) sink->flush();
+}
+
+void flushDiagnostics() {
+  if (LineBuffer::shared().enabled()) LineBuffer::shared().flushDiagnostics();
 }
 
 void flushFromSignal() {

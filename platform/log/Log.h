@@ -111,6 +111,11 @@ void setSink(std::shared_ptr<Sink> sink);
 void bufferLines(std::chrono::milliseconds delay);
 // Writes every line that waits. Thread-safe.
 void flush();
+// Writes the waiting lines when one of them is an info or debug line (logged only while
+// someone diagnoses): a server calls it before each reply, so that those lines come before the
+// reply, while the default-level lines that every request logs wait for the next batch and
+// cost the request no system call. Thread-safe.
+void flushDiagnostics();
 // flush() for a handler of a fatal signal: gives the waiting lines up rather than wait for a
 // thread that the signal may have stopped while it held them.
 void flushFromSignal();

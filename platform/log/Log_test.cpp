@@ -489,8 +489,14 @@ TEST_F(StderrLogTest, BufferedLinesWaitUntilAnErrorAFlushOrExit) {
     }
     process().defaultLevel("third");
     if (!arrived(pipe).empty()) return 3;
-    flush();
-    if (arrived(pipe).find("]: third\n") == std::string::npos) return 4;
+    // Before a reply only info and debug lines are written.
+    flushDiagnostics();
+    if (!arrived(pipe).empty()) return 6;
+    configure("info");
+    ops().info("diagnosis");
+    flushDiagnostics();
+    if (!inOrder(arrived(pipe), {"]: third\n", "ops: diagnosis\n"})) return 4;
+    configure("default");
     // A backlog is written without waiting for anything.
     for (int i = 0; i < 80; ++i) ops().defaultLevel("%d %s", i, std::string(1000, 'x'));
     std::string backlog = arrived(pipe);

@@ -90,7 +90,11 @@ void stopIoAtExit() {
 
 asio::io_context& ioContext() {
   // Never destroyed: sockets may still be served while the process exits.
-  static asio::io_context* context = new asio::io_context(2);
+  // Two threads run it, but with the hint of one the thread that took readiness events runs
+  // their handlers itself instead of waking the other to wait on epoll meanwhile: that wake-up
+  // and task switch cost each request more than the overlap saves, since the daemon's requests
+  // run one at a time on its work queue anyway. Posted work still wakes an idle thread.
+  static asio::io_context* context = new asio::io_context(1);
   static auto* work = [] {
     auto* guard =
         new asio::executor_work_guard<asio::io_context::executor_type>(context->get_executor());
