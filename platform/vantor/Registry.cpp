@@ -54,6 +54,10 @@ std::vector<Uuid> Registry::queryUuids(const Dictionary& rules) {
   return uuids;
 }
 
+size_t Registry::plugInCount() {
+  return queryUuids({}).size();
+}
+
 bool Registry::applicationIsPlaceholder(std::string_view path) {
   ApplicationProxyPtr application = applicationByPath(path);
   return application && application->isPlaceholder;

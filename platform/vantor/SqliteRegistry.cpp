@@ -42,7 +42,9 @@ constexpr int kSchemaVersion = 4;
 // Bounds on what one bundle may make the registry read.
 constexpr size_t kMaxPlugInsPerApplication = 4096;
 constexpr size_t kMaxLanguagesPerBundle = 512;
-constexpr size_t kMaxSystemBundles = 65536;
+// The system volume is written by root only: this bounds the scan's memory (names and a
+// chunk at a time), not what a client may ask for.
+constexpr size_t kMaxSystemBundles = 1000000;
 // Negative: KiB. The daemon keeps its own records of the plug-ins it was asked about, so a
 // plug-in's pages are read about once: enough for the tree's inner pages, and the rest is left
 // to the kernel's page cache rather than kept twice. With 10,000 plug-ins a 32 MB cache held
@@ -353,8 +355,9 @@ struct SqliteRegistry::Statements {
   sqlite3_stmt* sdkOf = nullptr;
   sqlite3_stmt* setSources = nullptr;
   sqlite3_stmt* forgetSources = nullptr;
-  sqlite3_stmt* allSources = nullptr;
+  sqlite3_stmt* sourcesBetween = nullptr;
   sqlite3_stmt* allPlugInPaths = nullptr;
+  sqlite3_stmt* countPlugIns = nullptr;
 
   std::vector<sqlite3_stmt**> all() {
     return {&begin,
@@ -382,8 +385,9 @@ struct SqliteRegistry::Statements {
             &upsertSdk,
             &sdkOf,
             &setSources,
-            &allSources,
+            &sourcesBetween,
             &allPlugInPaths,
+            &countPlugIns,
             &forgetSources};
   }
   ~Statements() {
@@ -875,10 +879,11 @@ Result<void> SqliteRegistry::prepareSchema() {
        "INSERT OR REPLACE INTO plugin_sources(path, container, sources) VALUES(?1, ?2, ?3)"},
       {&s.forgetSources, "DELETE FROM plugin_sources WHERE path = ?1"},
       // Joined: a record is only good for a plug-in still registered at its path.
-      {&s.allSources,
+      {&s.sourcesBetween,
        "SELECT s.path, s.container, s.sources FROM plugin_sources s "
-       "JOIN plugins p ON p.path = s.path"},
+       "JOIN plugins p ON p.path = s.path WHERE s.path BETWEEN ?1 AND ?2"},
       {&s.allPlugInPaths, "SELECT path FROM plugins ORDER BY path"},
+      {&s.countPlugIns, "SELECT count(*) FROM plugins"},
       {&s.deletePlugIn, "DELETE FROM plugins WHERE uuid = ?1"},
       {&s.insertPoint, "INSERT OR IGNORE INTO plugin_points(point, uuid) VALUES(?1, ?2)"},
       {&s.deletePoints, "DELETE FROM plugin_points WHERE uuid = ?1"},
@@ -1287,8 +1292,10 @@ Result<void> SqliteRegistry::applyPlan(Plan& plan) {
       if (find.step() == SQLITE_ROW) installed.push_back(readPlugInLocked(find.get()));
     }
   }
-  for (const PlugInProxyPtr& plugIn : installed) {
-    log::vr().info("registered %s", plugIn->description());
+  if (log::vr().enabled(log::Level::Info)) {
+    for (const PlugInProxyPtr& plugIn : installed) {
+      log::vr().info("registered %s", plugIn->description());
+    }
   }
   deliverInstall(std::move(installed));
   return {};
@@ -1383,6 +1390,11 @@ namespace {
 // every so many bundles.
 constexpr size_t kMaxCheckThreads = 4;
 constexpr size_t kBundlesPerCheckThread = 512;
+// The scan checks records a chunk of bundles at a time, and registers bundles a batch per
+// transaction: one commit (one sync of the log to disk) a batch rather than a bundle, while
+// lookups from other threads wait for one batch at most.
+constexpr size_t kScanChunk = 4096;
+constexpr size_t kScanBatch = 256;
 
 // A data container outlives registrations, but someone may have removed it.
 void ensureContainer(const std::string& container, const std::string& bundle) {
@@ -1395,139 +1407,184 @@ void ensureContainer(const std::string& container, const std::string& bundle) {
 
 }  // namespace
 
-void SqliteRegistry::reconcile() {
-  std::lock_guard change(changeMutex_);
+Registry::SystemVolumeScan SqliteRegistry::reconcile() {
   BundleReader reader{options_};
-  std::string dir = paths::join(options_.systemRoot, "Library/PlugIns");
-
-  // What each plug-in was last read from: a bundle whose sources all stat as recorded reads
-  // the same as it did, so it is left alone without opening a file.
-  struct Recorded {
-    std::optional<std::string> container;
-    std::vector<uint8_t> sources;
-  };
-  std::unordered_map<std::string, Recorded> recorded;
-  {
-    std::lock_guard db(dbMutex_);
-    Use list(statements_->allSources);
-    while (list.step() == SQLITE_ROW) {
-      sqlite3_stmt* row = list.get();
-      auto path = columnText(row, 0);
-      if (!path) continue;
-      const auto* bytes = static_cast<const uint8_t*>(sqlite3_column_blob(row, 2));
-      int size = sqlite3_column_bytes(row, 2);
-      recorded.emplace(std::move(*path),
-                       Recorded{columnText(row, 1), std::vector<uint8_t>(bytes, bytes + size)});
-    }
-  }
+  const std::string dir = paths::join(options_.systemRoot, "Library/PlugIns");
   bool truncated = false;
-  std::vector<std::string> names = subdirectories(dir, "", kMaxSystemBundles, truncated);
+  const std::vector<std::string> names = subdirectories(dir, "", kMaxSystemBundles, truncated);
+  auto pathOf = [&](size_t i) { return paths::join(dir, names[i]); };
+  SystemVolumeScan scan;
+  scan.bundles = names.size();
 
-  // Which records still hold. Checking them only reads the records and stats files, and with
-  // many system bundles it is most of a start, so it is shared among a few threads.
-  std::vector<char> holds(names.size(), 0);
-  const std::string context = reader.sourcesContext();
-  auto check = [&](size_t begin, size_t end) {
-    BundleSources::Checker checker(context);
-    for (size_t i = begin; i < end; ++i) {
-      const std::string path = paths::join(dir, names[i]);
-      auto known = recorded.find(path);
-      if (known == recorded.end() || !checker.unchanged(known->second.sources)) continue;
-      if (known->second.container) ensureContainer(*known->second.container, path);
-      holds[i] = 1;
-    }
-  };
-  const size_t threads = std::clamp<size_t>(
-      std::min<size_t>(std::thread::hardware_concurrency(), names.size() / kBundlesPerCheckThread),
-      1, kMaxCheckThreads);
-  {
-    std::vector<std::thread> helpers;
-    const size_t share = (names.size() + threads - 1) / threads;
-    for (size_t t = 1; t < threads; ++t) {
-      const size_t begin = std::min(names.size(), t * share);
-      const size_t end = std::min(names.size(), (t + 1) * share);
-      try {
-        helpers.emplace_back(check, begin, end);
-      } catch (const std::system_error&) {
-        check(begin, end);  // no thread to be had: this one does that share too
+  // Bundles read again and found registered as they read: only their new records of sources
+  // are kept, so that the next scan need not read them.
+  Plan fresh;
+  // Bundles to register, a transaction each batch.
+  Plan batch;
+  auto registerBatch = [&] {
+    if (batch.plugIns.empty()) return;
+    std::lock_guard change(changeMutex_);
+    if (!applyPlan(batch).ok()) {
+      // One bundle that cannot be registered (its container cannot be made, say) keeps none
+      // of the others out.
+      for (PlugInPlan& plugIn : batch.plugIns) {
+        Plan one;
+        one.plugIns.push_back(std::move(plugIn));
+        if (auto applied = applyPlan(one); !applied.ok()) {
+          log::vr().error("not registering system plug-in %s: %s", one.plugIns[0].path,
+                          applied.error().message);
+        }
       }
     }
-    check(0, std::min(names.size(), share));
-    for (std::thread& helper : helpers) helper.join();
-  }
+    batch = {};
+  };
+  auto recordFresh = [&] {
+    if (fresh.plugIns.empty()) return;
+    std::lock_guard change(changeMutex_);
+    recordSources(fresh);
+    fresh = {};
+  };
 
-  // Unchanged bundles read again: their new records, written together at the end.
-  Plan fresh;
-  std::unordered_set<std::string> present;
-  present.reserve(names.size());
-  size_t untouched = 0;
-  for (size_t i = 0; i < names.size(); ++i) {
-    std::string path = paths::join(dir, names[i]);
-    present.insert(path);
-    if (holds[i]) {
-      ++untouched;
-      continue;
-    }
-    auto plugIn = reader.readPlugIn(path);
-    if (!plugIn.ok()) {
-      log::vr().error("not registering system plug-in %s: %s", path, plugIn.error().message);
-      continue;
-    }
-    // A bundle registered exactly as it reads now is left alone: re-registering it would cost
-    // a commit, a knowledge change and notices. Its new record of sources is kept, so that
-    // the next scan need not read it.
-    bool unchanged = false;
+  // A chunk of bundles at a time, so that what the scan holds stays bounded however many
+  // bundles there are.
+  const std::string context = reader.sourcesContext();
+  for (size_t first = 0; first < names.size(); first += kScanChunk) {
+    const size_t end = std::min(names.size(), first + kScanChunk);
+    // What each plug-in of the chunk was last read from: a bundle whose sources all stat as
+    // recorded reads the same as it did, so it is left alone without opening a file. Paths
+    // sort as the names do, so the chunk's records are one range of the table.
+    struct Recorded {
+      std::optional<std::string> container;
+      std::vector<uint8_t> sources;
+    };
+    std::unordered_map<std::string, Recorded> recorded;
     {
       std::lock_guard db(dbMutex_);
-      Use find(statements_->plugInByPath);
-      find.text(1, plugIn->path);
-      if (find.step() == SQLITE_ROW) {
-        sqlite3_stmt* row = find.get();
-        unchanged =
-            columnText(row, 2) == plugIn->identifier && columnText(row, 4) == plugIn->version &&
-            columnText(row, 5) == plugIn->appPath && columnText(row, 6) == plugIn->point &&
-            columnText(row, 11) == plugIn->container && columnDictionary(row, 7) == plugIn->info &&
-            columnDictionary(row, 8) == plugIn->sdk &&
-            columnDictionary(row, 9) == plugIn->entitlements &&
-            columnDictionary(row, 12) == plugIn->strings &&
-            columnIdentity(row, 13) == plugIn->identity;
+      Use list(statements_->sourcesBetween);
+      list.text(1, pathOf(first)).text(2, pathOf(end - 1));
+      while (list.step() == SQLITE_ROW) {
+        sqlite3_stmt* row = list.get();
+        auto path = columnText(row, 0);
+        if (!path) continue;
+        const auto* bytes = static_cast<const uint8_t*>(sqlite3_column_blob(row, 2));
+        int size = sqlite3_column_bytes(row, 2);
+        recorded.emplace(std::move(*path),
+                         Recorded{columnText(row, 1), std::vector<uint8_t>(bytes, bytes + size)});
       }
     }
-    if (unchanged) {
-      if (plugIn->container) ensureContainer(*plugIn->container, path);
-      if (plugIn->sources) fresh.plugIns.push_back(std::move(plugIn).value());
-      continue;
+
+    // Which records still hold. Checking them only reads the records and stats files, and
+    // with many system bundles it is most of a scan, so it is shared among a few threads.
+    std::vector<char> holds(end - first, 0);
+    auto check = [&](size_t begin, size_t stop) {
+      BundleSources::Checker checker(context);
+      for (size_t i = begin; i < stop; ++i) {
+        const std::string path = pathOf(first + i);
+        auto known = recorded.find(path);
+        if (known == recorded.end() || !checker.unchanged(known->second.sources)) continue;
+        if (known->second.container) ensureContainer(*known->second.container, path);
+        holds[i] = 1;
+      }
+    };
+    const size_t count = end - first;
+    const size_t threads = std::clamp<size_t>(
+        std::min<size_t>(std::thread::hardware_concurrency(), count / kBundlesPerCheckThread), 1,
+        kMaxCheckThreads);
+    {
+      std::vector<std::thread> helpers;
+      const size_t share = (count + threads - 1) / threads;
+      for (size_t t = 1; t < threads; ++t) {
+        const size_t begin = std::min(count, t * share);
+        const size_t stop = std::min(count, (t + 1) * share);
+        try {
+          helpers.emplace_back(check, begin, stop);
+        } catch (const std::system_error&) {
+          check(begin, stop);  // no thread to be had: this one does that share too
+        }
+      }
+      check(0, std::min(count, share));
+      for (std::thread& helper : helpers) helper.join();
     }
-    Plan plan;
-    plan.plugIns.push_back(std::move(plugIn).value());
-    if (auto applied = applyPlan(plan); !applied.ok()) {
-      log::vr().error("not registering system plug-in %s: %s", path, applied.error().message);
+
+    for (size_t i = 0; i < count; ++i) {
+      if (holds[i]) {
+        ++scan.unchanged;
+        continue;
+      }
+      const std::string path = pathOf(first + i);
+      ++scan.read;
+      auto plugIn = reader.readPlugIn(path);
+      if (!plugIn.ok()) {
+        log::vr().error("not registering system plug-in %s: %s", path, plugIn.error().message);
+        continue;
+      }
+      // A bundle registered exactly as it reads now is left alone: re-registering it would
+      // cost a commit, a knowledge change and notices.
+      bool unchanged = false;
+      {
+        std::lock_guard db(dbMutex_);
+        Use find(statements_->plugInByPath);
+        find.text(1, plugIn->path);
+        if (find.step() == SQLITE_ROW) {
+          sqlite3_stmt* row = find.get();
+          unchanged =
+              columnText(row, 2) == plugIn->identifier && columnText(row, 4) == plugIn->version &&
+              columnText(row, 5) == plugIn->appPath && columnText(row, 6) == plugIn->point &&
+              columnText(row, 11) == plugIn->container &&
+              columnDictionary(row, 7) == plugIn->info && columnDictionary(row, 8) == plugIn->sdk &&
+              columnDictionary(row, 9) == plugIn->entitlements &&
+              columnDictionary(row, 12) == plugIn->strings &&
+              columnIdentity(row, 13) == plugIn->identity;
+        }
+      }
+      if (unchanged) {
+        if (plugIn->container) ensureContainer(*plugIn->container, path);
+        if (plugIn->sources) fresh.plugIns.push_back(std::move(plugIn).value());
+        if (fresh.plugIns.size() == kScanBatch) recordFresh();
+        continue;
+      }
+      batch.plugIns.push_back(std::move(plugIn).value());
+      if (batch.plugIns.size() == kScanBatch) registerBatch();
     }
   }
-  if (truncated) log::vr().error("%s: too many bundles; the rest ignored", dir);
+  registerBatch();
+  recordFresh();
+  if (truncated) {
+    log::vr().error("%s: more than %zu bundles; the rest ignored", dir, kMaxSystemBundles);
+  }
   log::vr().info("%zu system bundles: %zu unchanged since they were last read, %zu read",
-                 names.size(), untouched, names.size() - untouched);
-  if (!fresh.plugIns.empty()) recordSources(fresh);
+                 scan.bundles, scan.unchanged, scan.read);
 
-  std::vector<std::string> gone;
+  // Registered plug-ins and applications whose bundles are gone. Names are sorted, so a
+  // system bundle's presence is a binary search.
+  std::vector<std::string> registered;
   {
     std::lock_guard db(dbMutex_);
     Use list(statements_->allPlugInPaths);
     while (list.step() == SQLITE_ROW) {
-      auto path = columnText(list.get(), 0);
-      if (path && !present.contains(*path) && isGone(*path)) gone.push_back(*path);
+      if (auto path = columnText(list.get(), 0)) registered.push_back(std::move(*path));
     }
     Use apps(statements_->allApps);
     while (apps.step() == SQLITE_ROW) {
-      if (auto path = columnText(apps.get(), 0); path && isGone(*path)) gone.push_back(*path);
+      if (auto path = columnText(apps.get(), 0)) registered.push_back(std::move(*path));
     }
   }
-  for (const std::string& path : gone) {
+  const std::string prefix = dir + "/";
+  auto present = [&](const std::string& path) {
+    if (!path.starts_with(prefix)) return false;
+    std::string_view name = std::string_view(path).substr(prefix.size());
+    return std::binary_search(names.begin(), names.end(), name,
+                              [](std::string_view a, std::string_view b) { return a < b; });
+  };
+  for (const std::string& path : registered) {
+    if (present(path) || !isGone(path)) continue;
+    std::lock_guard change(changeMutex_);
     if (auto removed = unregisterLocked(path);
         !removed.ok() && removed.error().code != kNotRegistered) {
       log::vr().error("could not unregister vanished bundle %s: %s", path, removed.error().message);
     }
   }
+  return scan;
 }
 
 // ---------------------------------------------------------------------------------------------
@@ -1731,6 +1788,12 @@ std::vector<Uuid> SqliteRegistry::uuidsLocked(const Dictionary& rules) {
     uuidLists_.lists.emplace(std::move(listKey), uuids);
   }
   return uuids;
+}
+
+size_t SqliteRegistry::plugInCount() {
+  std::lock_guard db(dbMutex_);
+  Use count(statements_->countPlugIns);
+  return count.step() == SQLITE_ROW ? static_cast<size_t>(sqlite3_column_int64(count.get(), 0)) : 0;
 }
 
 std::optional<Dictionary> SqliteRegistry::extensionPointSdk(std::string_view identifier) {
