@@ -24,7 +24,8 @@ void Transaction::reportStatus() {
   reply()["socket"] = Value(daemon.service()->path());
   reply()["state"] = Value(paths::stateDir());
   reply()["system"] = Value(paths::systemRoot());
-  reply()["plugins"] = Value(static_cast<uint64_t>(daemon.registry()->queryUuids({}).size()));
+  reply()["plugins"] = Value(static_cast<uint64_t>(daemon.registry()->plugInCount()));
+  reply()["scanning"] = Value(daemon.scanning());
   reply()["connections"] = Value(static_cast<uint64_t>(daemon.service()->connectionCount()));
   reply()["holds"] = Value(static_cast<uint64_t>(daemon.holdCount()));
   done();
