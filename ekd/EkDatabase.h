@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <list>
 #include <memory>
 #include <optional>
 #include <span>
@@ -52,7 +53,10 @@ struct EkDatabasePlatform {
 };
 
 // The daemon's view of the installed plug-ins: records built from the registry's proxies,
-// cached by UUID, and the annotation store in front of which the cache sits.
+// cached by UUID, and the annotation store in front of which the cache sits. The cache keeps
+// the records used most recently, up to its capacity: with a hundred thousand plug-ins, a
+// record for each would take hundreds of megabytes, and building one again costs about as
+// much as a find.
 //
 // The queue "EkDatabase" (_sync) confines the cache and the annotation store. The synchronous
 // operations enter it and must not be called from it; findPlugIns runs on the caller's queue
@@ -121,6 +125,9 @@ class EkDatabase : public vantor::RegistryObserver {
   void setDelegate(std::weak_ptr<EkDatabaseDelegate> delegate);
   uint32_t cacheLimit() const { return cacheLimit_.load(); }
   void setCacheLimit(uint32_t limit) { cacheLimit_ = limit; }
+  // Records kept at most; the least recently used one goes to make room.
+  static constexpr size_t kDefaultCacheCapacity = 4096;
+  void setCacheCapacity(size_t capacity);
   size_t cacheCount();
   // Forms of the plug-ins that replies carry by the hundred ("match"), kept encoded.
   EkDFormCache& formCache() { return formCache_; }
@@ -151,7 +158,25 @@ class EkDatabase : public vantor::RegistryObserver {
   EkDatabasePlatform platform_;
   std::unique_ptr<EkDAnnotationStore> annotations_;  // on _sync
   std::shared_ptr<SerialQueue> sync_;
-  std::unordered_map<Uuid, EkDPlugInRef> cache_;  // on _sync
+  // Records by UUID, most recently used first. On _sync.
+  class RecordCache {
+   public:
+    // The record of uuid, now the most recently used; nullptr when none is cached.
+    EkDPlugInRef find(const Uuid& uuid);
+    // Replaces the record of its UUID; the least recently used ones go beyond capacity.
+    void insert(EkDPlugInRef record);
+    void erase(const Uuid& uuid);
+    void clear();
+    size_t size() const { return index_.size(); }
+    void setCapacity(size_t capacity);
+
+   private:
+    void evict();
+    size_t capacity_ = kDefaultCacheCapacity;
+    std::list<EkDPlugInRef> order_;
+    std::unordered_map<Uuid, std::list<EkDPlugInRef>::iterator> index_;
+  };
+  RecordCache cache_;
   // About 2.6 KB a form: room for the 500 forms of a busy extension point and the plug-ins
   // found most recently. Finds pass every form they answer through it, so a larger cache
   // mostly holds forms nobody asks for again.
