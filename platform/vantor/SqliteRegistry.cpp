@@ -1,5 +1,6 @@
 #include "platform/vantor/SqliteRegistry.h"
 
+#include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <fmt/format.h>
@@ -17,6 +18,7 @@
 #include <cstring>
 #include <ctime>
 #include <filesystem>
+#include <future>
 #include <map>
 #include <set>
 #include <system_error>
@@ -50,6 +52,10 @@ constexpr size_t kMaxSystemBundles = 1000000;
 // to the kernel's page cache rather than kept twice. With 10,000 plug-ins a 32 MB cache held
 // 11 MB more once each had been looked up, for lookups of uncached records about 15 µs faster.
 constexpr int kCacheSizeKiB = 2 * 1024;
+constexpr int kCheckpointPages = 1000;  // SQLite's default
+// While the start-up scan registers many bundles (see reconcile).
+constexpr int kScanCacheSizeKiB = 16 * 1024;
+constexpr int kScanCheckpointPages = 16384;
 
 // What each plug-in was read from (BundleSources), apart from the plug-ins' rows so that the
 // start-up scan reads only this.
@@ -162,27 +168,48 @@ bool isGone(const std::string& path) {
   return errno == ENOENT || errno == ENOTDIR;
 }
 
-// Sorted names of the directory's entries that are directories, at most limit of them.
-std::vector<std::string> subdirectories(const std::string& dir, std::string_view suffix,
-                                        size_t limit, bool& truncated) {
+// Sorted names of the entries of the directory open as directoryFd (O_PATH will do) that are
+// directories, at most limit of them. Read with getdents: every bundle's directory is listed
+// for its strings tables, and the system volume's holds up to a million bundles.
+std::vector<std::string> subdirectoriesAt(int directoryFd, std::string_view suffix, size_t limit,
+                                          bool& truncated) {
   std::vector<std::string> names;
   truncated = false;
-  std::error_code ec;
-  for (fs::directory_iterator it(dir, ec), end; !ec && it != end; it.increment(ec)) {
-    std::string name = it->path().filename().string();
-    if (name.empty() || name.front() == '.') continue;
-    if (!suffix.empty() && !endsWith(name, suffix)) continue;
-    // The entry's type from the directory itself where it has one (a symlink is followed).
-    std::error_code typeError;
-    if (!it->is_directory(typeError)) continue;
-    if (names.size() == limit) {
-      truncated = true;
-      break;
+  UniqueFd listing(::openat(directoryFd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!listing.valid()) return names;
+  alignas(struct dirent64) char buffer[16384];
+  ssize_t got = 0;
+  while (!truncated && (got = ::getdents64(listing.get(), buffer, sizeof buffer)) > 0) {
+    for (ssize_t offset = 0; offset < got;) {
+      const auto* entry = reinterpret_cast<const struct dirent64*>(buffer + offset);
+      offset += entry->d_reclen;
+      std::string_view name = entry->d_name;
+      if (name.empty() || name.front() == '.') continue;
+      if (!suffix.empty() && !endsWith(name, suffix)) continue;
+      // The entry's type from the directory itself where it has one (a symlink is followed).
+      bool directory = entry->d_type == DT_DIR;
+      if (entry->d_type == DT_UNKNOWN || entry->d_type == DT_LNK) {
+        struct stat st {};
+        directory = ::fstatat(listing.get(), entry->d_name, &st, 0) == 0 && S_ISDIR(st.st_mode);
+      }
+      if (!directory) continue;
+      if (names.size() == limit) {
+        truncated = true;
+        break;
+      }
+      names.emplace_back(name);
     }
-    names.push_back(std::move(name));
   }
   std::sort(names.begin(), names.end());
   return names;
+}
+
+std::vector<std::string> subdirectories(const std::string& dir, std::string_view suffix,
+                                        size_t limit, bool& truncated) {
+  truncated = false;
+  UniqueFd directory(::open(dir.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!directory.valid()) return {};
+  return subdirectoriesAt(directory.get(), suffix, limit, truncated);
 }
 
 // A bundle's Info.dmap, read beneath its directory; with identity, the directory it was read
@@ -227,8 +254,10 @@ Dictionary readInfoStrings(const std::string& bundle, BundleSources* sources = n
                            int directoryFd = -1) {
   Dictionary tables;
   bool truncated = false;
-  for (const std::string& dir :
-       subdirectories(bundle, ".lproj", kMaxLanguagesPerBundle, truncated)) {
+  const std::vector<std::string> languages =
+      directoryFd >= 0 ? subdirectoriesAt(directoryFd, ".lproj", kMaxLanguagesPerBundle, truncated)
+                       : subdirectories(bundle, ".lproj", kMaxLanguagesPerBundle, truncated);
+  for (const std::string& dir : languages) {
     const std::string relative = paths::join(dir, "InfoDmap.strings");
     std::string file = paths::join(bundle, relative);
     if (sources) {
@@ -323,6 +352,7 @@ struct PlugInPlan {
 struct SqliteRegistry::Plan {
   std::vector<AppPlan> apps;
   std::vector<PlugInPlan> plugIns;
+  bool containersMade = false;  // the plug-ins' data containers exist already
   // An application being (re-)registered: its registered plug-ins missing from plugIns go.
   std::optional<std::string> replacesPlugInsOf;
 };
@@ -910,11 +940,11 @@ Result<void> SqliteRegistry::prepareSchema() {
     Use get(s.getMeta);
     get.text(1, "knowledge");
     if (get.step() == SQLITE_ROW && sqlite3_column_bytes(get.get(), 0) == 16) {
-      knowledge_ = columnUuid(get.get(), 0);
+      setKnowledge(columnUuid(get.get(), 0));
       return {};
     }
   }
-  knowledge_ = Uuid::random();
+  setKnowledge(Uuid::random());
   Use set(s.setMeta);
   set.text(1, "knowledge").uuid(2, knowledge_);
   if (set.step() != SQLITE_DONE) {
@@ -930,6 +960,14 @@ namespace {
 
 struct BundleReader {
   const SqliteRegistry::Options& options;
+  // The SDK dictionaries read so far, by extension point, with the stamp their file had: a
+  // scan reads thousands of bundles of a few extension points.
+  struct KnownSdk {
+    FileStamp stamp;
+    Dictionary sdk;
+  };
+  std::unordered_map<std::string, KnownSdk> sdks = {};
+  std::string context = {};
 
   Result<AppPlan> readApplication(const std::string& path) {
     Dictionary info = EK_TRY(readInfo(path));
@@ -955,6 +993,18 @@ struct BundleReader {
     const std::string directory = paths::join(options.systemRoot, "Library/ExtensionPoints");
     std::string file = paths::join(directory, point + ".dmap");
     if (sources) sources->noteShared(file);
+    // Kept only once its file has been left alone for a while: a file changed twice within one
+    // tick of the file system's clock would keep its stamp.
+    struct stat status {};
+    std::optional<FileStamp> stamp;
+    if (::stat(file.c_str(), &status) == 0 && S_ISREG(status.st_mode) &&
+        ::time(nullptr) - std::max(status.st_mtim.tv_sec, status.st_ctim.tv_sec) >
+            std::max<int64_t>(options.settleSeconds, 1)) {
+      stamp = FileStamp::of(status);
+      if (auto known = sdks.find(point); known != sdks.end() && known->second.stamp == *stamp) {
+        return known->second.sdk;
+      }
+    }
     auto value = dmap::readFileBeneath(directory, point + ".dmap");
     if (!value.ok()) {
       if (value.error().isPosix(ENOENT)) {
@@ -968,14 +1018,19 @@ struct BundleReader {
       log::vr().error("SDK dictionary %s does not hold a dictionary", file);
       return std::nullopt;
     }
+    if (stamp) sdks.insert_or_assign(point, KnownSdk{*stamp, *value->dictionary()});
     return std::move(*value->dictionary());
   }
 
   // What reading a bundle depends on besides its files.
-  std::string sourcesContext() const {
+  const std::string& sourcesContext() {
     // The last field names the way bundles are read: records made by an older one say
     // nothing of what this one would read.
-    return fmt::format("{}\n{}\n{}\nbeneath-1", options.stateDir, options.systemRoot, ::geteuid());
+    if (context.empty()) {
+      context =
+          fmt::format("{}\n{}\n{}\nbeneath-1", options.stateDir, options.systemRoot, ::geteuid());
+    }
+    return context;
   }
 
   Result<PlugInPlan> readPlugIn(const std::string& path) {
@@ -1041,8 +1096,11 @@ struct BundleReader {
     }
     plan.strings = readInfoStrings(path, &sources, directory.get());
     // The entitlements were read by path: a bundle swapped for a link meanwhile could have
-    // given them from elsewhere.
-    if (bundleIdentityOf(path) != plan.identity) {
+    // given them from elsewhere. The path must still name the directory read.
+    struct stat named {};
+    if (!plan.identity || ::stat(path.c_str(), &named) != 0 ||
+        static_cast<uint64_t>(named.st_dev) != plan.identity->device ||
+        static_cast<uint64_t>(named.st_ino) != plan.identity->inode) {
       return makeError(kMalformedBundle,
                        fmt::format("{}: the directory changed while it was read", path));
     }
@@ -1119,7 +1177,7 @@ Result<void> SqliteRegistry::commitWithNewKnowledge() {
     if (meta.step() != SQLITE_DONE) return rollback("changing the knowledge UUID");
   }
   if (Use(s.commit).step() != SQLITE_DONE) return rollback("committing a change");
-  knowledge_ = knowledge;
+  setKnowledge(knowledge);
   noteChange();
   return {};
 }
@@ -1172,13 +1230,21 @@ void SqliteRegistry::checkpoint() {
   }
 }
 
+namespace {
+
+Result<void> makeContainer(const PlugInPlan& plugIn) {
+  if (!plugIn.container) return {};
+  EK_TRY(paths::ensureDirectory(*plugIn.container));
+  return paths::ensureDirectory(paths::join(*plugIn.container, "tmp"));
+}
+
+}  // namespace
+
 Result<void> SqliteRegistry::applyPlan(Plan& plan) {
   // Containers first: they outlive registrations anyway, and a failure here leaves the
   // registry untouched.
-  for (const PlugInPlan& plugIn : plan.plugIns) {
-    if (!plugIn.container) continue;
-    EK_TRY(paths::ensureDirectory(*plugIn.container));
-    EK_TRY(paths::ensureDirectory(paths::join(*plugIn.container, "tmp")));
+  if (!plan.containersMade) {
+    for (const PlugInPlan& plugIn : plan.plugIns) EK_TRY(makeContainer(plugIn));
   }
 
   std::vector<Uuid> uuids;
@@ -1394,7 +1460,7 @@ constexpr size_t kBundlesPerCheckThread = 512;
 // transaction: one commit (one sync of the log to disk) a batch rather than a bundle, while
 // lookups from other threads wait for one batch at most.
 constexpr size_t kScanChunk = 4096;
-constexpr size_t kScanBatch = 256;
+constexpr size_t kScanBatch = 512;
 
 // A data container outlives registrations, but someone may have removed it.
 void ensureContainer(const std::string& container, const std::string& bundle) {
@@ -1416,27 +1482,70 @@ Registry::SystemVolumeScan SqliteRegistry::reconcile() {
   SystemVolumeScan scan;
   scan.bundles = names.size();
 
+  // Registering thousands of bundles inserts into indexes keyed by random UUIDs: with the
+  // usual cache their pages were read back for nearly every bundle, and the log was moved into
+  // the file at nearly every commit. For a large scan both are larger, then back.
+  const bool large = names.size() > kScanBatch;
+  auto tune = [&](int cacheKiB, int checkpointPages) {
+    std::lock_guard db(dbMutex_);
+    execute(db_, fmt::format("PRAGMA cache_size=-{}", cacheKiB).c_str());
+    execute(db_, fmt::format("PRAGMA wal_autocheckpoint={}", checkpointPages).c_str());
+  };
+  if (large) tune(kScanCacheSizeKiB, kScanCheckpointPages);
+
   // Bundles read again and found registered as they read: only their new records of sources
   // are kept, so that the next scan need not read them.
   Plan fresh;
-  // Bundles to register, a transaction each batch.
+  // Bundles to register, a transaction each batch. A batch's data containers are made on a
+  // helper thread while this one reads the next batch: two new directories per plug-in were a
+  // third of a first registration.
   Plan batch;
-  auto registerBatch = [&] {
-    if (batch.plugIns.empty()) return;
-    std::lock_guard change(changeMutex_);
-    if (!applyPlan(batch).ok()) {
-      // One bundle that cannot be registered (its container cannot be made, say) keeps none
-      // of the others out.
-      for (PlugInPlan& plugIn : batch.plugIns) {
-        Plan one;
-        one.plugIns.push_back(std::move(plugIn));
-        if (auto applied = applyPlan(one); !applied.ok()) {
-          log::vr().error("not registering system plug-in %s: %s", one.plugIns[0].path,
-                          applied.error().message);
-        }
+  Plan prepared;  // the batch whose containers are being made
+  std::future<std::vector<Result<void>>> making;
+  auto makeContainers = [](const Plan* plan) {
+    std::vector<Result<void>> made;
+    made.reserve(plan->plugIns.size());
+    for (const PlugInPlan& plugIn : plan->plugIns) made.push_back(makeContainer(plugIn));
+    return made;
+  };
+  auto registerPrepared = [&] {
+    if (!making.valid()) return;
+    std::vector<Result<void>> made = making.get();
+    Plan ready;
+    ready.containersMade = true;
+    for (size_t i = 0; i < prepared.plugIns.size(); ++i) {
+      if (made[i].ok()) {
+        ready.plugIns.push_back(std::move(prepared.plugIns[i]));
+      } else {
+        log::vr().error("not registering system plug-in %s: %s", prepared.plugIns[i].path,
+                        made[i].error().message);
       }
     }
+    prepared = {};
+    if (ready.plugIns.empty()) return;
+    std::lock_guard change(changeMutex_);
+    if (applyPlan(ready).ok()) return;
+    // One bundle that cannot be registered keeps none of the others out.
+    for (PlugInPlan& plugIn : ready.plugIns) {
+      Plan one;
+      one.containersMade = true;
+      one.plugIns.push_back(std::move(plugIn));
+      if (auto applied = applyPlan(one); !applied.ok()) {
+        log::vr().error("not registering system plug-in %s: %s", one.plugIns[0].path,
+                        applied.error().message);
+      }
+    }
+  };
+  auto registerBatch = [&] {
+    registerPrepared();
+    if (batch.plugIns.empty()) return;
+    prepared = std::move(batch);
     batch = {};
+    try {
+      making = std::async(std::launch::async, makeContainers, &prepared);
+    } catch (const std::system_error&) {
+      making = std::async(std::launch::deferred, makeContainers, &prepared);  // no thread
+    }
   };
   auto recordFresh = [&] {
     if (fresh.plugIns.empty()) return;
@@ -1548,7 +1657,9 @@ Registry::SystemVolumeScan SqliteRegistry::reconcile() {
     }
   }
   registerBatch();
+  registerPrepared();
   recordFresh();
+  if (large) tune(kCacheSizeKiB, kCheckpointPages);
   if (truncated) {
     log::vr().error("%s: more than %zu bundles; the rest ignored", dir, kMaxSystemBundles);
   }
@@ -1828,8 +1939,13 @@ Dictionary SqliteRegistry::localizedStrings(const Uuid& plugIn, std::string_view
 }
 
 Uuid SqliteRegistry::knowledgeUuid() {
-  std::lock_guard db(dbMutex_);
+  std::lock_guard lock(knowledgeMutex_);
   return knowledge_;
+}
+
+void SqliteRegistry::setKnowledge(const Uuid& knowledge) {
+  std::lock_guard lock(knowledgeMutex_);
+  knowledge_ = knowledge;
 }
 
 void SqliteRegistry::clearCaches() {

@@ -145,7 +145,11 @@ class SqliteRegistry : public Registry, public std::enable_shared_from_this<Sqli
   std::mutex dbMutex_;
   sqlite3* db_ = nullptr;
   std::unique_ptr<Statements> statements_;
-  Uuid knowledge_;  // REQUIRES dbMutex_
+  // Changed under dbMutex_ and knowledgeMutex_, read under either: records ask for it on
+  // every use and must not wait for a transaction of the start-up scan.
+  Uuid knowledge_;
+  std::mutex knowledgeMutex_;
+  void setKnowledge(const Uuid& knowledge);
   // uuidsLocked's answers for knowledge, by the index keys they read. REQUIRES dbMutex_.
   struct UuidLists {
     Uuid knowledge;
