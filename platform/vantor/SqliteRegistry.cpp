@@ -1461,8 +1461,6 @@ constexpr size_t kBundlesPerCheckThread = 512;
 // lookups from other threads wait for one batch at most.
 constexpr size_t kScanChunk = 4096;
 constexpr size_t kScanBatch = 512;
-// Fewer bundles than this to read are read on one thread.
-constexpr size_t kMinSharedRead = 64;
 
 // A data container outlives registrations, but someone may have removed it.
 void ensureContainer(const std::string& container, const std::string& bundle) {
@@ -1477,7 +1475,6 @@ void ensureContainer(const std::string& container, const std::string& bundle) {
 
 Registry::SystemVolumeScan SqliteRegistry::reconcile() {
   BundleReader reader{options_};
-  BundleReader helper{options_};
   const std::string dir = paths::join(options_.systemRoot, "Library/PlugIns");
   bool truncated = false;
   const std::vector<std::string> names = subdirectories(dir, "", kMaxSystemBundles, truncated);
@@ -1618,41 +1615,14 @@ Registry::SystemVolumeScan SqliteRegistry::reconcile() {
       for (std::thread& helper : helpers) helper.join();
     }
 
-    // The bundles to read, a batch at a time, half of each on a helper thread: reading the
-    // files is half of what this thread does otherwise.
-    std::vector<size_t> reading;
     for (size_t i = 0; i < count; ++i) {
       if (holds[i]) {
         ++scan.unchanged;
-      } else {
-        reading.push_back(first + i);
+        continue;
       }
-    }
-    scan.read += reading.size();
-    std::vector<std::optional<Result<PlugInPlan>>> read;
-    for (size_t next = 0; next < reading.size(); ++next) {
-      const size_t slot = next % kScanBatch;
-      if (slot == 0) {
-        const size_t size = std::min(kScanBatch, reading.size() - next);
-        read.assign(size, std::nullopt);
-        auto readShare = [&](BundleReader* with, size_t begin, size_t stop) {
-          for (size_t k = begin; k < stop; ++k)
-            read[k] = with->readPlugIn(pathOf(reading[next + k]));
-        };
-        const size_t half = size >= kMinSharedRead ? size / 2 : size;
-        std::future<void> helping;
-        if (half < size) {
-          try {
-            helping = std::async(std::launch::async, readShare, &helper, half, size);
-          } catch (const std::system_error&) {
-            readShare(&helper, half, size);  // no thread to be had
-          }
-        }
-        readShare(&reader, 0, half);
-        if (helping.valid()) helping.get();
-      }
-      const std::string path = pathOf(reading[next]);
-      Result<PlugInPlan> plugIn = std::move(*read[slot]);
+      const std::string path = pathOf(first + i);
+      ++scan.read;
+      auto plugIn = reader.readPlugIn(path);
       if (!plugIn.ok()) {
         log::vr().error("not registering system plug-in %s: %s", path, plugIn.error().message);
         continue;
