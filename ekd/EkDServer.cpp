@@ -50,23 +50,22 @@ std::shared_ptr<EkDServer> EkDServer::initForService(const std::string& serviceN
   server->databasePath_ = std::move(database);
   server->platform_ = std::move(platform);
   // The annotation file and the registry know nothing of each other: the one is read while
-  // the other opens and checks the system plug-ins (or, with no thread to be had, when the
-  // store is asked for).
+  // the other opens (or, with no thread to be had, when the store is asked for).
   std::future<std::unique_ptr<EkDAnnotationStore>> store = std::async(
       std::launch::async | std::launch::deferred,
       [path = server->databasePath_] { return EkDAnnotationStore::initWithDatabase(path); });
   if (!server->platform_.registry) {
     vantor::SqliteRegistry::Options options;
     options.codeSigning = server->platform_.codeSigning;
+    // Reading a large system volume takes seconds: it is done once the server serves.
+    options.scanOnOpen = false;
     auto registry = vantor::SqliteRegistry::open(std::move(options));
     if (!registry) {
       log::vr().error("unable to open the registry: %{public}@", registry.error());
       return nullptr;
     }
     server->platform_.registry = std::move(registry).value();
-    // The start-up scan reads every registered plug-in once; give that heap back rather than
-    // keep it for the daemon's life.
-    ::malloc_trim(0);
+    server->scanAtStart_ = true;
   }
   if (!server->platform_.serviceManager) {
     server->platform_.serviceManager = std::make_shared<stard::FileServiceManager>();
@@ -143,20 +142,47 @@ void EkDServer::run() {
   // Bundles added to or removed from the system volume while the daemon runs are registered
   // or unregistered without a restart. The settle time lets a package manager finish first.
   const std::string plugIns = paths::join(paths::systemRoot(), "Library/PlugIns");
-  auto watch = EkDSystemVolumeWatch::make(wyre::ioContext(), plugIns, kSystemVolumeSettle,
-                                          [weak = weak_from_this()] {
-                                            auto self = weak.lock();
-                                            if (!self) return;
-                                            log::vr().info("rescanning the system volume");
-                                            self->registry()->rescanSystemVolume();
-                                          });
+  auto scan = [weak = weak_from_this()] {
+    if (auto self = weak.lock()) self->scanSystemVolume();
+  };
+  auto watch = EkDSystemVolumeWatch::make(wyre::ioContext(), plugIns, kSystemVolumeSettle, scan);
   if (watch) {
     systemVolumeWatch_ = std::move(watch).value();
   } else {
     log::vr().error("cannot watch %s: %{public}@; system plug-ins are read at start only", plugIns,
                     watch.error());
   }
+  // Set before the first request can ask: the scan is due from the moment the server serves.
+  if (scanAtStart_) scanning_ = true;
   service_->resume();
+  if (!scanAtStart_) return;
+  // On the queue of the watch's rescans, so that a change seen meanwhile is read after it.
+  if (systemVolumeWatch_) {
+    systemVolumeWatch_->rescanNow();
+  } else {
+    scanQueue_ = SerialQueue::make("system-volume");
+    scanQueue_->async(std::move(scan));
+  }
+}
+
+void EkDServer::scanSystemVolume() {
+  const bool startUp = scanAtStart_ && !scannedOnce_.load();
+  if (!startUp) log::vr().info("rescanning the system volume");
+  scanning_ = true;
+  const auto began = std::chrono::steady_clock::now();
+  const vantor::Registry::SystemVolumeScan scan = registry()->rescanSystemVolume();
+  const auto elapsed = std::chrono::duration_cast<std::chrono::milliseconds>(
+      std::chrono::steady_clock::now() - began);
+  const size_t registered = registry()->plugInCount();
+  scannedOnce_ = true;
+  scanning_ = false;
+  log::ops().log(startUp ? log::Level::Default : log::Level::Info,
+                 "system volume read in %llu ms: %zu bundles, %zu read, %zu unchanged; %zu "
+                 "plug-ins registered",
+                 static_cast<unsigned long long>(elapsed.count()), scan.bundles, scan.read,
+                 scan.unchanged, registered);
+  // A scan reads every bundle it registers: give that heap back once the daemon is quiet.
+  heapTrim_->activity();
 }
 
 void EkDServer::rescanSystemVolume() {

@@ -37,7 +37,7 @@ struct EkDPlatform {
   std::shared_ptr<CodeSigning> codeSigning;
   std::shared_ptr<SandboxCheck> sandbox;
   // The application registry; when none is given the server opens the one in the state
-  // directory, which also registers the system plug-ins.
+  // directory and registers the system plug-ins once it serves (see run).
   std::shared_ptr<vantor::Registry> registry;
   std::shared_ptr<stard::ServiceManager> serviceManager;
   std::shared_ptr<notify::Notifier> notifier;
@@ -66,8 +66,13 @@ class EkDServer : public std::enable_shared_from_this<EkDServer> {
   // The process-wide server.
   static std::shared_ptr<EkDServer> server();
 
-  // Starts accepting connections. The caller then runs the main run loop.
+  // Starts accepting connections, then registers the system volume in the background when the
+  // server opened the registry: requests are answered meanwhile and see the plug-ins
+  // registered so far. The caller then runs the main run loop.
   void run();
+  // Whether the system volume is being read (the start-up scan until it completes, or a
+  // rescan).
+  bool scanning() const { return scanning_.load(); }
   // Registers and unregisters system plug-ins as the system volume now holds them (SIGHUP),
   // a moment later and off the request threads. Any thread.
   void rescanSystemVolume();
@@ -120,6 +125,8 @@ class EkDServer : public std::enable_shared_from_this<EkDServer> {
   // Replaces the holds in force with what change makes of a copy of them. The released holds
   // end after the lock is left: a hold's last reference may be the old list's.
   void changeHolds(const std::function<void(std::vector<std::shared_ptr<EkDPlugInHold>>&)>& change);
+  // Runs on the system volume's queue, one scan at a time.
+  void scanSystemVolume();
 
   const std::chrono::steady_clock::time_point startTime_ = std::chrono::steady_clock::now();
   std::atomic<uint32_t> verbose_{0};
@@ -138,6 +145,11 @@ class EkDServer : public std::enable_shared_from_this<EkDServer> {
   std::shared_ptr<EkDUserPrefs> userPrefs_;
   std::shared_ptr<EkDHeapTrim> heapTrim_;
   std::shared_ptr<EkDSystemVolumeWatch> systemVolumeWatch_;
+  // Where the start-up scan runs when the system volume cannot be watched.
+  std::shared_ptr<SerialQueue> scanQueue_;
+  bool scanAtStart_ = false;  // the server opened the registry, without its scan
+  std::atomic<bool> scanning_{false};
+  std::atomic<bool> scannedOnce_{false};
 };
 
 }  // namespace ek

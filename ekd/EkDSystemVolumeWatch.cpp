@@ -77,12 +77,16 @@ void EkDSystemVolumeWatch::settleThenRescan() {
   timer_.async_wait([weak = weak_from_this()](const asio::error_code& error) {
     auto self = weak.lock();
     if (!self || error) return;
-    if (self->queued_.exchange(true)) return;
-    self->queue_->async([self] {
-      // Cleared first: a change from here on is not covered by this rescan.
-      self->queued_ = false;
-      self->rescan_();
-    });
+    self->rescanNow();
+  });
+}
+
+void EkDSystemVolumeWatch::rescanNow() {
+  if (queued_.exchange(true)) return;
+  queue_->async([self = shared_from_this()] {
+    // Cleared first: a change from here on is not covered by this rescan.
+    self->queued_ = false;
+    self->rescan_();
   });
 }
 

@@ -37,6 +37,8 @@ class EkDSystemVolumeWatch : public std::enable_shared_from_this<EkDSystemVolume
 
   // A rescan after the settle time, as for a change (SIGHUP asks for one). Any thread.
   void requestRescan();
+  // A rescan at once (the start-up scan), unless one is queued already. Any thread.
+  void rescanNow();
   // Stops watching; a rescan already running finishes. Any thread.
   void cancel();
 

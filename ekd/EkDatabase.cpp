@@ -1,5 +1,6 @@
 #include "ekd/EkDatabase.h"
 
+#include <algorithm>
 #include <cctype>
 #include <cstdio>
 #include <cstdlib>
@@ -68,11 +69,53 @@ size_t EkDatabase::cacheCount() const {
   return cache_.size();
 }
 
+void EkDatabase::setCacheCapacity(size_t capacity) {
+  cache_.setCapacity(capacity);
+}
+
+EkDPlugInRef EkDatabase::RecordCache::find(const Uuid& uuid) {
+  auto it = index_.find(uuid);
+  if (it == index_.end()) return nullptr;
+  order_.splice(order_.begin(), order_, it->second);
+  return *it->second;
+}
+
+void EkDatabase::RecordCache::insert(EkDPlugInRef record) {
+  const Uuid uuid = record->uuid();
+  erase(uuid);
+  order_.push_front(std::move(record));
+  index_.emplace(uuid, order_.begin());
+  evict();
+}
+
+void EkDatabase::RecordCache::erase(const Uuid& uuid) {
+  auto it = index_.find(uuid);
+  if (it == index_.end()) return;
+  order_.erase(it->second);
+  index_.erase(it);
+}
+
+void EkDatabase::RecordCache::clear() {
+  index_.clear();
+  order_.clear();
+}
+
+void EkDatabase::RecordCache::setCapacity(size_t capacity) {
+  capacity_ = std::max<size_t>(capacity, 1);
+  evict();
+}
+
+void EkDatabase::RecordCache::evict() {
+  while (index_.size() > capacity_) {
+    index_.erase(order_.back()->uuid());
+    order_.pop_back();
+  }
+}
+
 EkDPlugInRef EkDatabase::plugInForProxy(const vantor::PlugInProxy& proxy) {
-  auto it = cache_.find(proxy.uuid);
-  if (it != cache_.end()) {
-    if (it->second->isStillValid()) return it->second;
-    cache_.erase(it);
+  if (EkDPlugInRef cached = cache_.find(proxy.uuid)) {
+    if (cached->isStillValid()) return cached;
+    cache_.erase(proxy.uuid);
   }
   return createPlugInForProxy(proxy);
 }
@@ -83,7 +126,7 @@ EkDPlugInRef EkDatabase::createPlugInForProxy(const vantor::PlugInProxy& proxy) 
   if (!plugIn) return nullptr;
   if (plugIn->hasEntitlement(protocol::kEntitlementAutoElect)) autoElect(*plugIn);
   purgeCachesToLimit(cacheLimit_.load());
-  cache_[plugIn->uuid()] = plugIn;
+  cache_.insert(plugIn);
   return plugIn;
 }
 
@@ -202,8 +245,8 @@ std::optional<std::vector<EkDPlugInRef>> EkDatabase::findPlugIns(const Dictionar
     const Uuid& uuid = uuids[i];
     if (!seen.insert(uuid).second) continue;
     EkDPlugInRef cached;
-    if (auto it = cache_.find(uuid); it != cache_.end() && it->second->isStillValid()) {
-      cached = it->second;
+    if (EkDPlugInRef found = cache_.find(uuid); found && found->isStillValid()) {
+      cached = std::move(found);
     }
     if (cached) {
       if (elections) {
@@ -247,10 +290,9 @@ std::optional<std::vector<EkDPlugInRef>> EkDatabase::findPlugIns(const Dictionar
 }
 
 EkDPlugInRef EkDatabase::findPlugIn(const Uuid& uuid) {
-  auto it = cache_.find(uuid);
-  if (it != cache_.end()) {
-    if (it->second->isStillValid()) return it->second;
-    cache_.erase(it);
+  if (EkDPlugInRef cached = cache_.find(uuid)) {
+    if (cached->isStillValid()) return cached;
+    cache_.erase(uuid);
   }
   auto proxy = platform_.registry->plugInByUuid(uuid);
   if (!proxy) {

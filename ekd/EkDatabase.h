@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cstdint>
 #include <functional>
+#include <list>
 #include <memory>
 #include <optional>
 #include <span>
@@ -48,7 +49,10 @@ struct EkDatabasePlatform {
 };
 
 // The daemon's view of the installed plug-ins: records built from the registry's proxies,
-// cached by UUID, and the annotation store in front of which the cache sits.
+// cached by UUID, and the annotation store in front of which the cache sits. The cache keeps
+// the records used most recently, up to its capacity: with a hundred thousand plug-ins, a
+// record for each would take hundreds of megabytes, and building one again costs about as
+// much as a find.
 //
 // The cache and the annotation store belong to one queue, the owner's (the daemon's work
 // queue, on which every request runs): every operation runs there, enters no other queue and
@@ -123,6 +127,9 @@ class EkDatabase : public vantor::RegistryObserver,
   void setDelegate(EkDatabaseDelegate delegate);
   uint32_t cacheLimit() const { return cacheLimit_.load(); }
   void setCacheLimit(uint32_t limit) { cacheLimit_ = limit; }
+  // Records kept at most; the least recently used one goes to make room.
+  static constexpr size_t kDefaultCacheCapacity = 4096;
+  void setCacheCapacity(size_t capacity);
   size_t cacheCount() const;
   // Forms of the plug-ins that replies carry by the hundred ("match"), kept encoded.
   EkDFormCache& formCache() { return formCache_; }
@@ -151,7 +158,25 @@ class EkDatabase : public vantor::RegistryObserver,
   EkDatabasePlatform platform_;
   std::unique_ptr<EkDAnnotationStore> annotations_;
   std::shared_ptr<SerialQueue> owner_;
-  std::unordered_map<Uuid, EkDPlugInRef> cache_;
+  // Records by UUID, most recently used first.
+  class RecordCache {
+   public:
+    // The record of uuid, now the most recently used; nullptr when none is cached.
+    EkDPlugInRef find(const Uuid& uuid);
+    // Replaces the record of its UUID; the least recently used ones go beyond capacity.
+    void insert(EkDPlugInRef record);
+    void erase(const Uuid& uuid);
+    void clear();
+    size_t size() const { return index_.size(); }
+    void setCapacity(size_t capacity);
+
+   private:
+    void evict();
+    size_t capacity_ = kDefaultCacheCapacity;
+    std::list<EkDPlugInRef> order_;
+    std::unordered_map<Uuid, std::list<EkDPlugInRef>::iterator> index_;
+  };
+  RecordCache cache_;
   // About 2.6 KB a form: room for the 500 forms of a busy extension point and the plug-ins
   // found most recently. Finds pass every form they answer through it, so a larger cache
   // mostly holds forms nobody asks for again.

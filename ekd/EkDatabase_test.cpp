@@ -193,6 +193,20 @@ TEST_F(DatabaseTest, CacheLimitZeroKeepsOnlyTheNewestRecord) {
   EXPECT_EQ(database_->cacheCount(), 1u);
 }
 
+TEST_F(DatabaseTest, FullCacheEvictsTheLeastRecentlyUsedRecord) {
+  database_->setCacheCapacity(2);
+  auto a = install("com.example.a");
+  auto b = install("com.example.b");
+  auto keptA = database_->findPlugIn(a.uuid);
+  database_->findPlugIn(b.uuid);
+  EXPECT_EQ(database_->findPlugInAtPath(a.path), keptA);  // a is now the more recent
+  database_->findPlugIn(install("com.example.c").uuid);
+  EXPECT_EQ(database_->cacheCount(), 2u);
+  EXPECT_EQ(database_->findPlugIn(a.uuid), keptA);
+  EXPECT_NE(database_->findPlugIn(b.uuid), nullptr);  // built again
+  EXPECT_EQ(sink_->count("createPlugInForProxy"), 4u);
+}
+
 TEST_F(DatabaseTest, LocaleChangeEmptiesTheCacheOnce) {
   for (int i = 0; i < 10; ++i)
     database_->findPlugIn(install("com.example.l" + std::to_string(i)).uuid);

@@ -25,7 +25,8 @@ Reply reportStatus(const Request&, EkDServer& daemon) {
   members["socket"] = Value(daemon.service()->path());
   members["state"] = Value(paths::stateDir());
   members["system"] = Value(paths::systemRoot());
-  members["plugins"] = Value(static_cast<uint64_t>(daemon.registry()->queryUuids({}).size()));
+  members["plugins"] = Value(static_cast<uint64_t>(daemon.registry()->plugInCount()));
+  members["scanning"] = Value(daemon.scanning());
   members["connections"] = Value(static_cast<uint64_t>(daemon.service()->connectionCount()));
   members["holds"] = Value(static_cast<uint64_t>(daemon.holdCount()));
   return reply;

@@ -224,13 +224,16 @@ int main(int argc, char* argv[]) {
   reload.async_wait(onReload);
 
   // The socket listens already (clients wait in its backlog): the line comes out before any
-  // answer does.
+  // answer does. The plug-ins are those registered when the daemon last ran; the system
+  // volume is read once the daemon serves, and a second line says when that is done.
   auto elapsed = std::chrono::duration_cast<std::chrono::milliseconds>(
       std::chrono::steady_clock::now() - startTime);
   log::ops().defaultLevel(
-      "ekd %s listening on %s%s, %llu plug-ins registered, started in %llu ms", EKORA_VERSION,
-      server->service()->path(), server->service()->activated() ? " (socket-activated)" : "",
-      static_cast<unsigned long long>(server->registry()->queryUuids({}).size()),
+      "ekd %s listening on %s%s, %llu plug-ins registered, started in %llu ms; reading the "
+      "system volume",
+      EKORA_VERSION, server->service()->path(),
+      server->service()->activated() ? " (socket-activated)" : "",
+      static_cast<unsigned long long>(server->registry()->plugInCount()),
       static_cast<unsigned long long>(elapsed.count()));
   log::flush();
   server->run();

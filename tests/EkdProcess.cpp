@@ -140,6 +140,25 @@ bool EkdProcess::logShows(std::string_view text) const {
 }
 
 bool EkdProcess::start() {
+  if (!startServing()) return false;
+  const Value status(Dictionary{{"request", Value("status")}, {"version", Value(uint64_t{3})}});
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+  while (std::chrono::steady_clock::now() < deadline) {
+    auto reply = ask(status, std::chrono::seconds(5));
+    const Value* scanning = reply ? reply->get("scanning") : nullptr;
+    if (scanning && scanning->boolean() && !*scanning->boolean()) return true;
+    int code;
+    if (waitpid(pid_, &code, WNOHANG) == pid_) {
+      exitStatus_ = decodeStatus(code);
+      pid_ = -1;
+      return false;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return false;
+}
+
+bool EkdProcess::startServing() {
   std::string logPath = (root_.path() / "ekd.log").string();
   pid_ = fork();
   if (pid_ == 0) {

@@ -43,8 +43,11 @@ class EkdProcess {
   explicit EkdProcess(std::vector<std::string> extraArgs = {});
   ~EkdProcess();
 
-  // Starts ekd and waits until its socket answers; false (with the log) when it did not.
+  // Starts ekd and waits until it answers and has registered the system volume; false (with
+  // the log) when it did not.
   bool start();
+  // The same, returning as soon as the socket accepts: the system volume may still be read.
+  bool startServing();
   // Sends SIGTERM and answers the exit status (128 + signal when killed by one).
   int terminate();
   void kill9();

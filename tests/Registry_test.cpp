@@ -90,6 +90,56 @@ TEST(DaemonRegistry, SystemVolumeIsFollowedWhileRunning) {
   EXPECT_EQ(daemon.terminate(), 0);
 }
 
+// The system volume is registered once the daemon serves: requests meanwhile see the
+// bundles registered so far, and every one is found once the scan is done.
+TEST(DaemonRegistry, AnswersWhileTheSystemVolumeIsRegistered) {
+  constexpr uint64_t kBundles = 3000;
+  EkdProcess daemon;
+  daemon.setEnvironment("EKORA_LOG", "default");
+  fs::path plugIns = daemon.root().path() / "System/Library/PlugIns";
+  std::vector<std::string> bundles;
+  for (uint64_t i = 0; i < kBundles; ++i) {
+    bundles.push_back((plugIns / ("P" + std::to_string(10000 + i) + ".bundle")).string());
+    fs::create_directories(bundles.back());
+    std::ofstream(bundles.back() + "/Info.dmap")
+        << "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<dmap version=\"1.0\">\n<dict>\n"
+        << "<key>QvBundleIdentifier</key><string>com.example.p" << i << "</string>\n"
+        << "<key>ZuExtension</key><dict><key>ZuExtensionAttributes</key><dict></dict>"
+        << "<key>ZuExtensionPointIdentifier</key><string>com.example.scale</string>"
+        << "<key>ZuExtensionProtocol</key><string>Scale</string></dict>\n</dict>\n</dmap>\n";
+  }
+  ASSERT_TRUE(daemon.startServing()) << daemon.log();
+  auto first = daemon.ask(request("status"));
+  ASSERT_TRUE(first);
+  // The start line is written as the daemon begins to serve, before the scan begins.
+  EXPECT_TRUE(daemon.logShows("0 plug-ins registered"));
+  ASSERT_NE(first->get("scanning"), nullptr);
+  EXPECT_TRUE(*first->get("scanning")->boolean()) << first->description();
+  EXPECT_LT(*first->getUnsigned("plugins"), kBundles);
+
+  std::optional<Value> status;
+  for (int i = 0; i < 3000; ++i) {
+    status = daemon.ask(request("status"));
+    if (!status || !*status->get("scanning")->boolean()) break;
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  ASSERT_TRUE(status && !*status->get("scanning")->boolean());
+  EXPECT_EQ(*status->getUnsigned("plugins"), kBundles);
+  EXPECT_TRUE(daemon.logShows("3000 bundles, 3000 read, 0 unchanged; 3000 plug-ins registered"));
+  RawClient client(daemon.socketPath());
+  uint64_t found = 0;
+  for (uint64_t i = 0; i < kBundles; ++i) {
+    ASSERT_TRUE(
+        client.sendMessage(request("find", {{"paths", Value("file://" + bundles[i])}}), i + 1));
+    auto reply = client.readFrame();
+    ASSERT_TRUE(reply);
+    const Value* form = reply->body.get("matches");
+    found += form && form->getString("path") && *form->getString("path") == bundles[i];
+  }
+  EXPECT_EQ(found, kBundles);
+  EXPECT_EQ(daemon.terminate(), 0);
+}
+
 TEST(DaemonRegistry, CorruptRegistryIsSetAsideAndRebuilt) {
   EkdProcess daemon;
   installExampleSystem(daemon);

@@ -99,6 +99,12 @@ run_case() {
     sleep 0.1
   done
   [[ -n $reply ]] || fail "ekctl (no options) got no reply on $socket: $(cat "$scratch/ekctl.err")"
+  # The system volume is registered once the daemon serves.
+  for ((attempt = 0; attempt < 200; attempt++)); do
+    "${as_user[@]}" "$scratch/ekctl" status -o json | grep -q '"scanning": false' && break
+    sleep 0.1
+  done
+  reply=$("${as_user[@]}" timeout 15 "$scratch/ekctl" --json match)
   [[ $reply == *com.corvane.spellcheck* ]] ||
     fail "the user's ekd did not register the system plug-in: $reply"
   [[ $(stat -c %u "$socket") == "$uid" ]] || fail "$socket is not owned by uid $uid"

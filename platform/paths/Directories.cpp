@@ -79,6 +79,13 @@ std::string join(std::string_view a, std::string_view b) {
 
 Result<void> ensureDirectory(const std::string& path, mode_t mode) {
   if (path.empty()) return EkError::posix(ENOENT, "creating a directory: empty path");
+  // Mostly the parent exists: one call then, rather than one per component (a registration
+  // makes two directories per plug-in, a first start hundreds of thousands).
+  if (mkdir(path.c_str(), mode) == 0) return {};
+  if (errno == EEXIST) {
+    struct stat st {};
+    if (stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return {};
+  }
   // Walk down from the root so that every missing parent is made in order; an existing
   // directory (ours or made concurrently by someone else) is fine at every step.
   size_t position = 0;

@@ -5,6 +5,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <climits>
+#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -52,6 +54,10 @@ std::vector<Uuid> Registry::queryUuids(const Dictionary& rules) {
   std::vector<Uuid> uuids;
   for (const PlugInProxyPtr& proxy : query(rules, nullptr)) uuids.push_back(proxy->uuid);
   return uuids;
+}
+
+size_t Registry::plugInCount() {
+  return queryUuids({}).size();
 }
 
 bool Registry::applicationIsPlaceholder(std::string_view path) {
@@ -144,16 +150,29 @@ std::string extensionPointIndexKey(std::string_view value) {
 std::optional<BundleIdentity> bundleIdentityOf(int directoryFd, const std::string& path) {
   struct stat opened {};
   if (::fstat(directoryFd, &opened) != 0 || !S_ISDIR(opened.st_mode)) return std::nullopt;
-  char* resolved = ::realpath(path.c_str(), nullptr);
-  if (resolved == nullptr) return std::nullopt;
-  BundleIdentity identity{static_cast<uint64_t>(opened.st_dev),
-                          static_cast<uint64_t>(opened.st_ino), resolved};
-  ::free(resolved);
-  struct stat named {};
-  if (::stat(identity.canonicalPath.c_str(), &named) != 0 || named.st_dev != opened.st_dev ||
-      named.st_ino != opened.st_ino) {
-    return std::nullopt;
+  auto names = [&](const char* candidate) {
+    struct stat named {};
+    return ::stat(candidate, &named) == 0 && named.st_dev == opened.st_dev &&
+           named.st_ino == opened.st_ino;
+  };
+  BundleIdentity identity{
+      static_cast<uint64_t>(opened.st_dev), static_cast<uint64_t>(opened.st_ino), {}};
+  // The kernel names the open directory in one call where realpath reads every component
+  // (registering a large system volume did little else); path must still name it.
+  char link[64];
+  char target[PATH_MAX];
+  std::snprintf(link, sizeof link, "/proc/self/fd/%d", directoryFd);
+  ssize_t length = ::readlink(link, target, sizeof target);
+  if (length > 0 && length < static_cast<ssize_t>(sizeof target) && target[0] == '/') {
+    identity.canonicalPath.assign(target, static_cast<size_t>(length));
+    if (!names(path.c_str())) return std::nullopt;
+  } else {
+    char* resolved = ::realpath(path.c_str(), nullptr);
+    if (resolved == nullptr) return std::nullopt;
+    identity.canonicalPath = resolved;
+    ::free(resolved);
   }
+  if (identity.canonicalPath != path && !names(identity.canonicalPath.c_str())) return std::nullopt;
   return identity;
 }
 

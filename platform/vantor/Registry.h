@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -144,6 +145,8 @@ class Registry {
   // The UUIDs of the plug-ins query would pass to its filter, in the order it would, without
   // reading their records: a caller holding current records for them needs nothing more.
   virtual std::vector<Uuid> queryUuids(const Dictionary& rules);
+  // How many plug-ins are registered.
+  virtual size_t plugInCount();
   // Whether the application at a path is known and only a placeholder.
   virtual bool applicationIsPlaceholder(std::string_view path);
 
@@ -161,9 +164,16 @@ class Registry {
   // Moves everything the registry's log holds into its main file and gives free space back,
   // so that the file alone is the registry; the daemon asks for it when it stops.
   virtual void checkpoint() {}
+  // What a scan of the system volume found.
+  struct SystemVolumeScan {
+    size_t bundles = 0;    // bundle directories seen
+    size_t unchanged = 0;  // left alone: none of their files changed since they were read
+    size_t read = 0;       // read again (registered, or found registered as they read)
+  };
   // Brings the system volume's plug-ins up to date with the bundles there now, as at start.
-  // Takes as long as reading what changed; does nothing by default.
-  virtual void rescanSystemVolume() {}
+  // Takes as long as reading what changed; does nothing by default. Lookups and changes from
+  // other threads go on meanwhile and see the bundles registered so far.
+  virtual SystemVolumeScan rescanSystemVolume() { return {}; }
 
   // Observers are held weakly; one that is gone is dropped.
   virtual void addObserver(std::weak_ptr<RegistryObserver> observer) = 0;

@@ -1,5 +1,6 @@
 #include "platform/vantor/SqliteRegistry.h"
 
+#include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <fmt/format.h>
@@ -17,6 +18,7 @@
 #include <cstring>
 #include <ctime>
 #include <filesystem>
+#include <future>
 #include <map>
 #include <set>
 #include <system_error>
@@ -42,12 +44,18 @@ constexpr int kSchemaVersion = 4;
 // Bounds on what one bundle may make the registry read.
 constexpr size_t kMaxPlugInsPerApplication = 4096;
 constexpr size_t kMaxLanguagesPerBundle = 512;
-constexpr size_t kMaxSystemBundles = 65536;
+// The system volume is written by root only: this bounds the scan's memory (names and a
+// chunk at a time), not what a client may ask for.
+constexpr size_t kMaxSystemBundles = 1000000;
 // Negative: KiB. The daemon keeps its own records of the plug-ins it was asked about, so a
 // plug-in's pages are read about once: enough for the tree's inner pages, and the rest is left
 // to the kernel's page cache rather than kept twice. With 10,000 plug-ins a 32 MB cache held
 // 11 MB more once each had been looked up, for lookups of uncached records about 15 µs faster.
 constexpr int kCacheSizeKiB = 2 * 1024;
+constexpr int kCheckpointPages = 1000;  // SQLite's default
+// While the start-up scan registers many bundles (see reconcile).
+constexpr int kScanCacheSizeKiB = 16 * 1024;
+constexpr int kScanCheckpointPages = 16384;
 
 // What each plug-in was read from (BundleSources), apart from the plug-ins' rows so that the
 // start-up scan reads only this.
@@ -160,27 +168,48 @@ bool isGone(const std::string& path) {
   return errno == ENOENT || errno == ENOTDIR;
 }
 
-// Sorted names of the directory's entries that are directories, at most limit of them.
-std::vector<std::string> subdirectories(const std::string& dir, std::string_view suffix,
-                                        size_t limit, bool& truncated) {
+// Sorted names of the entries of the directory open as directoryFd (O_PATH will do) that are
+// directories, at most limit of them. Read with getdents: every bundle's directory is listed
+// for its strings tables, and the system volume's holds up to a million bundles.
+std::vector<std::string> subdirectoriesAt(int directoryFd, std::string_view suffix, size_t limit,
+                                          bool& truncated) {
   std::vector<std::string> names;
   truncated = false;
-  std::error_code ec;
-  for (fs::directory_iterator it(dir, ec), end; !ec && it != end; it.increment(ec)) {
-    std::string name = it->path().filename().string();
-    if (name.empty() || name.front() == '.') continue;
-    if (!suffix.empty() && !endsWith(name, suffix)) continue;
-    // The entry's type from the directory itself where it has one (a symlink is followed).
-    std::error_code typeError;
-    if (!it->is_directory(typeError)) continue;
-    if (names.size() == limit) {
-      truncated = true;
-      break;
+  UniqueFd listing(::openat(directoryFd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!listing.valid()) return names;
+  alignas(struct dirent64) char buffer[16384];
+  ssize_t got = 0;
+  while (!truncated && (got = ::getdents64(listing.get(), buffer, sizeof buffer)) > 0) {
+    for (ssize_t offset = 0; offset < got;) {
+      const auto* entry = reinterpret_cast<const struct dirent64*>(buffer + offset);
+      offset += entry->d_reclen;
+      std::string_view name = entry->d_name;
+      if (name.empty() || name.front() == '.') continue;
+      if (!suffix.empty() && !endsWith(name, suffix)) continue;
+      // The entry's type from the directory itself where it has one (a symlink is followed).
+      bool directory = entry->d_type == DT_DIR;
+      if (entry->d_type == DT_UNKNOWN || entry->d_type == DT_LNK) {
+        struct stat st {};
+        directory = ::fstatat(listing.get(), entry->d_name, &st, 0) == 0 && S_ISDIR(st.st_mode);
+      }
+      if (!directory) continue;
+      if (names.size() == limit) {
+        truncated = true;
+        break;
+      }
+      names.emplace_back(name);
     }
-    names.push_back(std::move(name));
   }
   std::sort(names.begin(), names.end());
   return names;
+}
+
+std::vector<std::string> subdirectories(const std::string& dir, std::string_view suffix,
+                                        size_t limit, bool& truncated) {
+  truncated = false;
+  UniqueFd directory(::open(dir.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!directory.valid()) return {};
+  return subdirectoriesAt(directory.get(), suffix, limit, truncated);
 }
 
 // A bundle's Info.dmap, read beneath its directory; with identity, the directory it was read
@@ -225,8 +254,10 @@ Dictionary readInfoStrings(const std::string& bundle, BundleSources* sources = n
                            int directoryFd = -1) {
   Dictionary tables;
   bool truncated = false;
-  for (const std::string& dir :
-       subdirectories(bundle, ".lproj", kMaxLanguagesPerBundle, truncated)) {
+  const std::vector<std::string> languages =
+      directoryFd >= 0 ? subdirectoriesAt(directoryFd, ".lproj", kMaxLanguagesPerBundle, truncated)
+                       : subdirectories(bundle, ".lproj", kMaxLanguagesPerBundle, truncated);
+  for (const std::string& dir : languages) {
     const std::string relative = paths::join(dir, "InfoDmap.strings");
     std::string file = paths::join(bundle, relative);
     if (sources) {
@@ -321,6 +352,7 @@ struct PlugInPlan {
 struct SqliteRegistry::Plan {
   std::vector<AppPlan> apps;
   std::vector<PlugInPlan> plugIns;
+  bool containersMade = false;  // the plug-ins' data containers exist already
   // An application being (re-)registered: its registered plug-ins missing from plugIns go.
   std::optional<std::string> replacesPlugInsOf;
 };
@@ -353,8 +385,9 @@ struct SqliteRegistry::Statements {
   sqlite3_stmt* sdkOf = nullptr;
   sqlite3_stmt* setSources = nullptr;
   sqlite3_stmt* forgetSources = nullptr;
-  sqlite3_stmt* allSources = nullptr;
+  sqlite3_stmt* sourcesBetween = nullptr;
   sqlite3_stmt* allPlugInPaths = nullptr;
+  sqlite3_stmt* countPlugIns = nullptr;
 
   std::vector<sqlite3_stmt**> all() {
     return {&begin,
@@ -382,8 +415,9 @@ struct SqliteRegistry::Statements {
             &upsertSdk,
             &sdkOf,
             &setSources,
-            &allSources,
+            &sourcesBetween,
             &allPlugInPaths,
+            &countPlugIns,
             &forgetSources};
   }
   ~Statements() {
@@ -875,10 +909,11 @@ Result<void> SqliteRegistry::prepareSchema() {
        "INSERT OR REPLACE INTO plugin_sources(path, container, sources) VALUES(?1, ?2, ?3)"},
       {&s.forgetSources, "DELETE FROM plugin_sources WHERE path = ?1"},
       // Joined: a record is only good for a plug-in still registered at its path.
-      {&s.allSources,
+      {&s.sourcesBetween,
        "SELECT s.path, s.container, s.sources FROM plugin_sources s "
-       "JOIN plugins p ON p.path = s.path"},
+       "JOIN plugins p ON p.path = s.path WHERE s.path BETWEEN ?1 AND ?2"},
       {&s.allPlugInPaths, "SELECT path FROM plugins ORDER BY path"},
+      {&s.countPlugIns, "SELECT count(*) FROM plugins"},
       {&s.deletePlugIn, "DELETE FROM plugins WHERE uuid = ?1"},
       {&s.insertPoint, "INSERT OR IGNORE INTO plugin_points(point, uuid) VALUES(?1, ?2)"},
       {&s.deletePoints, "DELETE FROM plugin_points WHERE uuid = ?1"},
@@ -905,11 +940,11 @@ Result<void> SqliteRegistry::prepareSchema() {
     Use get(s.getMeta);
     get.text(1, "knowledge");
     if (get.step() == SQLITE_ROW && sqlite3_column_bytes(get.get(), 0) == 16) {
-      knowledge_ = columnUuid(get.get(), 0);
+      setKnowledge(columnUuid(get.get(), 0));
       return {};
     }
   }
-  knowledge_ = Uuid::random();
+  setKnowledge(Uuid::random());
   Use set(s.setMeta);
   set.text(1, "knowledge").uuid(2, knowledge_);
   if (set.step() != SQLITE_DONE) {
@@ -925,6 +960,14 @@ namespace {
 
 struct BundleReader {
   const SqliteRegistry::Options& options;
+  // The SDK dictionaries read so far, by extension point, with the stamp their file had: a
+  // scan reads thousands of bundles of a few extension points.
+  struct KnownSdk {
+    FileStamp stamp;
+    Dictionary sdk;
+  };
+  std::unordered_map<std::string, KnownSdk> sdks = {};
+  std::string context = {};
 
   Result<AppPlan> readApplication(const std::string& path) {
     Dictionary info = EK_TRY(readInfo(path));
@@ -950,6 +993,18 @@ struct BundleReader {
     const std::string directory = paths::join(options.systemRoot, "Library/ExtensionPoints");
     std::string file = paths::join(directory, point + ".dmap");
     if (sources) sources->noteShared(file);
+    // Kept only once its file has been left alone for a while: a file changed twice within one
+    // tick of the file system's clock would keep its stamp.
+    struct stat status {};
+    std::optional<FileStamp> stamp;
+    if (::stat(file.c_str(), &status) == 0 && S_ISREG(status.st_mode) &&
+        ::time(nullptr) - std::max(status.st_mtim.tv_sec, status.st_ctim.tv_sec) >
+            std::max<int64_t>(options.settleSeconds, 1)) {
+      stamp = FileStamp::of(status);
+      if (auto known = sdks.find(point); known != sdks.end() && known->second.stamp == *stamp) {
+        return known->second.sdk;
+      }
+    }
     auto value = dmap::readFileBeneath(directory, point + ".dmap");
     if (!value.ok()) {
       if (value.error().isPosix(ENOENT)) {
@@ -963,14 +1018,19 @@ struct BundleReader {
       log::vr().error("SDK dictionary %s does not hold a dictionary", file);
       return std::nullopt;
     }
+    if (stamp) sdks.insert_or_assign(point, KnownSdk{*stamp, *value->dictionary()});
     return std::move(*value->dictionary());
   }
 
   // What reading a bundle depends on besides its files.
-  std::string sourcesContext() const {
+  const std::string& sourcesContext() {
     // The last field names the way bundles are read: records made by an older one say
     // nothing of what this one would read.
-    return fmt::format("{}\n{}\n{}\nbeneath-1", options.stateDir, options.systemRoot, ::geteuid());
+    if (context.empty()) {
+      context =
+          fmt::format("{}\n{}\n{}\nbeneath-1", options.stateDir, options.systemRoot, ::geteuid());
+    }
+    return context;
   }
 
   Result<PlugInPlan> readPlugIn(const std::string& path) {
@@ -1036,8 +1096,11 @@ struct BundleReader {
     }
     plan.strings = readInfoStrings(path, &sources, directory.get());
     // The entitlements were read by path: a bundle swapped for a link meanwhile could have
-    // given them from elsewhere.
-    if (bundleIdentityOf(path) != plan.identity) {
+    // given them from elsewhere. The path must still name the directory read.
+    struct stat named {};
+    if (!plan.identity || ::stat(path.c_str(), &named) != 0 ||
+        static_cast<uint64_t>(named.st_dev) != plan.identity->device ||
+        static_cast<uint64_t>(named.st_ino) != plan.identity->inode) {
       return makeError(kMalformedBundle,
                        fmt::format("{}: the directory changed while it was read", path));
     }
@@ -1114,7 +1177,7 @@ Result<void> SqliteRegistry::commitWithNewKnowledge() {
     if (meta.step() != SQLITE_DONE) return rollback("changing the knowledge UUID");
   }
   if (Use(s.commit).step() != SQLITE_DONE) return rollback("committing a change");
-  knowledge_ = knowledge;
+  setKnowledge(knowledge);
   noteChange();
   return {};
 }
@@ -1167,13 +1230,21 @@ void SqliteRegistry::checkpoint() {
   }
 }
 
+namespace {
+
+Result<void> makeContainer(const PlugInPlan& plugIn) {
+  if (!plugIn.container) return {};
+  EK_TRY(paths::ensureDirectory(*plugIn.container));
+  return paths::ensureDirectory(paths::join(*plugIn.container, "tmp"));
+}
+
+}  // namespace
+
 Result<void> SqliteRegistry::applyPlan(Plan& plan) {
   // Containers first: they outlive registrations anyway, and a failure here leaves the
   // registry untouched.
-  for (const PlugInPlan& plugIn : plan.plugIns) {
-    if (!plugIn.container) continue;
-    EK_TRY(paths::ensureDirectory(*plugIn.container));
-    EK_TRY(paths::ensureDirectory(paths::join(*plugIn.container, "tmp")));
+  if (!plan.containersMade) {
+    for (const PlugInPlan& plugIn : plan.plugIns) EK_TRY(makeContainer(plugIn));
   }
 
   std::vector<Uuid> uuids;
@@ -1287,8 +1358,10 @@ Result<void> SqliteRegistry::applyPlan(Plan& plan) {
       if (find.step() == SQLITE_ROW) installed.push_back(readPlugInLocked(find.get()));
     }
   }
-  for (const PlugInProxyPtr& plugIn : installed) {
-    log::vr().info("registered %s", plugIn->description());
+  if (log::vr().enabled(log::Level::Info)) {
+    for (const PlugInProxyPtr& plugIn : installed) {
+      log::vr().info("registered %s", plugIn->description());
+    }
   }
   deliverInstall(std::move(installed));
   return {};
@@ -1383,6 +1456,11 @@ namespace {
 // every so many bundles.
 constexpr size_t kMaxCheckThreads = 4;
 constexpr size_t kBundlesPerCheckThread = 512;
+// The scan checks records a chunk of bundles at a time, and registers bundles a batch per
+// transaction: one commit (one sync of the log to disk) a batch rather than a bundle, while
+// lookups from other threads wait for one batch at most.
+constexpr size_t kScanChunk = 4096;
+constexpr size_t kScanBatch = 512;
 
 // A data container outlives registrations, but someone may have removed it.
 void ensureContainer(const std::string& container, const std::string& bundle) {
@@ -1395,139 +1473,229 @@ void ensureContainer(const std::string& container, const std::string& bundle) {
 
 }  // namespace
 
-void SqliteRegistry::reconcile() {
-  std::lock_guard change(changeMutex_);
+Registry::SystemVolumeScan SqliteRegistry::reconcile() {
   BundleReader reader{options_};
-  std::string dir = paths::join(options_.systemRoot, "Library/PlugIns");
-
-  // What each plug-in was last read from: a bundle whose sources all stat as recorded reads
-  // the same as it did, so it is left alone without opening a file.
-  struct Recorded {
-    std::optional<std::string> container;
-    std::vector<uint8_t> sources;
-  };
-  std::unordered_map<std::string, Recorded> recorded;
-  {
-    std::lock_guard db(dbMutex_);
-    Use list(statements_->allSources);
-    while (list.step() == SQLITE_ROW) {
-      sqlite3_stmt* row = list.get();
-      auto path = columnText(row, 0);
-      if (!path) continue;
-      const auto* bytes = static_cast<const uint8_t*>(sqlite3_column_blob(row, 2));
-      int size = sqlite3_column_bytes(row, 2);
-      recorded.emplace(std::move(*path),
-                       Recorded{columnText(row, 1), std::vector<uint8_t>(bytes, bytes + size)});
-    }
-  }
+  const std::string dir = paths::join(options_.systemRoot, "Library/PlugIns");
   bool truncated = false;
-  std::vector<std::string> names = subdirectories(dir, "", kMaxSystemBundles, truncated);
+  const std::vector<std::string> names = subdirectories(dir, "", kMaxSystemBundles, truncated);
+  auto pathOf = [&](size_t i) { return paths::join(dir, names[i]); };
+  SystemVolumeScan scan;
+  scan.bundles = names.size();
 
-  // Which records still hold. Checking them only reads the records and stats files, and with
-  // many system bundles it is most of a start, so it is shared among a few threads.
-  std::vector<char> holds(names.size(), 0);
-  const std::string context = reader.sourcesContext();
-  auto check = [&](size_t begin, size_t end) {
-    BundleSources::Checker checker(context);
-    for (size_t i = begin; i < end; ++i) {
-      const std::string path = paths::join(dir, names[i]);
-      auto known = recorded.find(path);
-      if (known == recorded.end() || !checker.unchanged(known->second.sources)) continue;
-      if (known->second.container) ensureContainer(*known->second.container, path);
-      holds[i] = 1;
-    }
+  // Registering thousands of bundles inserts into indexes keyed by random UUIDs: with the
+  // usual cache their pages were read back for nearly every bundle, and the log was moved into
+  // the file at nearly every commit. For a large scan both are larger, then back.
+  const bool large = names.size() > kScanBatch;
+  auto tune = [&](int cacheKiB, int checkpointPages) {
+    std::lock_guard db(dbMutex_);
+    execute(db_, fmt::format("PRAGMA cache_size=-{}", cacheKiB).c_str());
+    execute(db_, fmt::format("PRAGMA wal_autocheckpoint={}", checkpointPages).c_str());
   };
-  const size_t threads = std::clamp<size_t>(
-      std::min<size_t>(std::thread::hardware_concurrency(), names.size() / kBundlesPerCheckThread),
-      1, kMaxCheckThreads);
-  {
-    std::vector<std::thread> helpers;
-    const size_t share = (names.size() + threads - 1) / threads;
-    for (size_t t = 1; t < threads; ++t) {
-      const size_t begin = std::min(names.size(), t * share);
-      const size_t end = std::min(names.size(), (t + 1) * share);
-      try {
-        helpers.emplace_back(check, begin, end);
-      } catch (const std::system_error&) {
-        check(begin, end);  // no thread to be had: this one does that share too
+  if (large) tune(kScanCacheSizeKiB, kScanCheckpointPages);
+
+  // Bundles read again and found registered as they read: only their new records of sources
+  // are kept, so that the next scan need not read them.
+  Plan fresh;
+  // Bundles to register, a transaction each batch. A batch's data containers are made on a
+  // helper thread while this one reads the next batch: two new directories per plug-in were a
+  // third of a first registration.
+  Plan batch;
+  Plan prepared;  // the batch whose containers are being made
+  std::future<std::vector<Result<void>>> making;
+  auto makeContainers = [](const Plan* plan) {
+    std::vector<Result<void>> made;
+    made.reserve(plan->plugIns.size());
+    for (const PlugInPlan& plugIn : plan->plugIns) made.push_back(makeContainer(plugIn));
+    return made;
+  };
+  auto registerPrepared = [&] {
+    if (!making.valid()) return;
+    std::vector<Result<void>> made = making.get();
+    Plan ready;
+    ready.containersMade = true;
+    for (size_t i = 0; i < prepared.plugIns.size(); ++i) {
+      if (made[i].ok()) {
+        ready.plugIns.push_back(std::move(prepared.plugIns[i]));
+      } else {
+        log::vr().error("not registering system plug-in %s: %s", prepared.plugIns[i].path,
+                        made[i].error().message);
       }
     }
-    check(0, std::min(names.size(), share));
-    for (std::thread& helper : helpers) helper.join();
-  }
+    prepared = {};
+    if (ready.plugIns.empty()) return;
+    std::lock_guard change(changeMutex_);
+    if (applyPlan(ready).ok()) return;
+    // One bundle that cannot be registered keeps none of the others out.
+    for (PlugInPlan& plugIn : ready.plugIns) {
+      Plan one;
+      one.containersMade = true;
+      one.plugIns.push_back(std::move(plugIn));
+      if (auto applied = applyPlan(one); !applied.ok()) {
+        log::vr().error("not registering system plug-in %s: %s", one.plugIns[0].path,
+                        applied.error().message);
+      }
+    }
+  };
+  auto registerBatch = [&] {
+    registerPrepared();
+    if (batch.plugIns.empty()) return;
+    prepared = std::move(batch);
+    batch = {};
+    try {
+      making = std::async(std::launch::async, makeContainers, &prepared);
+    } catch (const std::system_error&) {
+      making = std::async(std::launch::deferred, makeContainers, &prepared);  // no thread
+    }
+  };
+  auto recordFresh = [&] {
+    if (fresh.plugIns.empty()) return;
+    std::lock_guard change(changeMutex_);
+    recordSources(fresh);
+    fresh = {};
+  };
 
-  // Unchanged bundles read again: their new records, written together at the end.
-  Plan fresh;
-  std::unordered_set<std::string> present;
-  present.reserve(names.size());
-  size_t untouched = 0;
-  for (size_t i = 0; i < names.size(); ++i) {
-    std::string path = paths::join(dir, names[i]);
-    present.insert(path);
-    if (holds[i]) {
-      ++untouched;
-      continue;
-    }
-    auto plugIn = reader.readPlugIn(path);
-    if (!plugIn.ok()) {
-      log::vr().error("not registering system plug-in %s: %s", path, plugIn.error().message);
-      continue;
-    }
-    // A bundle registered exactly as it reads now is left alone: re-registering it would cost
-    // a commit, a knowledge change and notices. Its new record of sources is kept, so that
-    // the next scan need not read it.
-    bool unchanged = false;
+  // A chunk of bundles at a time, so that what the scan holds stays bounded however many
+  // bundles there are.
+  const std::string context = reader.sourcesContext();
+  for (size_t first = 0; first < names.size(); first += kScanChunk) {
+    const size_t end = std::min(names.size(), first + kScanChunk);
+    // What each plug-in of the chunk was last read from: a bundle whose sources all stat as
+    // recorded reads the same as it did, so it is left alone without opening a file. Paths
+    // sort as the names do, so the chunk's records are one range of the table.
+    struct Recorded {
+      std::optional<std::string> container;
+      std::vector<uint8_t> sources;
+    };
+    std::unordered_map<std::string, Recorded> recorded;
     {
       std::lock_guard db(dbMutex_);
-      Use find(statements_->plugInByPath);
-      find.text(1, plugIn->path);
-      if (find.step() == SQLITE_ROW) {
-        sqlite3_stmt* row = find.get();
-        unchanged =
-            columnText(row, 2) == plugIn->identifier && columnText(row, 4) == plugIn->version &&
-            columnText(row, 5) == plugIn->appPath && columnText(row, 6) == plugIn->point &&
-            columnText(row, 11) == plugIn->container && columnDictionary(row, 7) == plugIn->info &&
-            columnDictionary(row, 8) == plugIn->sdk &&
-            columnDictionary(row, 9) == plugIn->entitlements &&
-            columnDictionary(row, 12) == plugIn->strings &&
-            columnIdentity(row, 13) == plugIn->identity;
+      Use list(statements_->sourcesBetween);
+      list.text(1, pathOf(first)).text(2, pathOf(end - 1));
+      while (list.step() == SQLITE_ROW) {
+        sqlite3_stmt* row = list.get();
+        auto path = columnText(row, 0);
+        if (!path) continue;
+        const auto* bytes = static_cast<const uint8_t*>(sqlite3_column_blob(row, 2));
+        int size = sqlite3_column_bytes(row, 2);
+        recorded.emplace(std::move(*path),
+                         Recorded{columnText(row, 1), std::vector<uint8_t>(bytes, bytes + size)});
       }
     }
-    if (unchanged) {
-      if (plugIn->container) ensureContainer(*plugIn->container, path);
-      if (plugIn->sources) fresh.plugIns.push_back(std::move(plugIn).value());
-      continue;
+
+    // Which records still hold. Checking them only reads the records and stats files, and
+    // with many system bundles it is most of a scan, so it is shared among a few threads.
+    std::vector<char> holds(end - first, 0);
+    auto check = [&](size_t begin, size_t stop) {
+      BundleSources::Checker checker(context);
+      for (size_t i = begin; i < stop; ++i) {
+        const std::string path = pathOf(first + i);
+        auto known = recorded.find(path);
+        if (known == recorded.end() || !checker.unchanged(known->second.sources)) continue;
+        if (known->second.container) ensureContainer(*known->second.container, path);
+        holds[i] = 1;
+      }
+    };
+    const size_t count = end - first;
+    const size_t threads = std::clamp<size_t>(
+        std::min<size_t>(std::thread::hardware_concurrency(), count / kBundlesPerCheckThread), 1,
+        kMaxCheckThreads);
+    {
+      std::vector<std::thread> helpers;
+      const size_t share = (count + threads - 1) / threads;
+      for (size_t t = 1; t < threads; ++t) {
+        const size_t begin = std::min(count, t * share);
+        const size_t stop = std::min(count, (t + 1) * share);
+        try {
+          helpers.emplace_back(check, begin, stop);
+        } catch (const std::system_error&) {
+          check(begin, stop);  // no thread to be had: this one does that share too
+        }
+      }
+      check(0, std::min(count, share));
+      for (std::thread& helper : helpers) helper.join();
     }
-    Plan plan;
-    plan.plugIns.push_back(std::move(plugIn).value());
-    if (auto applied = applyPlan(plan); !applied.ok()) {
-      log::vr().error("not registering system plug-in %s: %s", path, applied.error().message);
+
+    for (size_t i = 0; i < count; ++i) {
+      if (holds[i]) {
+        ++scan.unchanged;
+        continue;
+      }
+      const std::string path = pathOf(first + i);
+      ++scan.read;
+      auto plugIn = reader.readPlugIn(path);
+      if (!plugIn.ok()) {
+        log::vr().error("not registering system plug-in %s: %s", path, plugIn.error().message);
+        continue;
+      }
+      // A bundle registered exactly as it reads now is left alone: re-registering it would
+      // cost a commit, a knowledge change and notices.
+      bool unchanged = false;
+      {
+        std::lock_guard db(dbMutex_);
+        Use find(statements_->plugInByPath);
+        find.text(1, plugIn->path);
+        if (find.step() == SQLITE_ROW) {
+          sqlite3_stmt* row = find.get();
+          unchanged =
+              columnText(row, 2) == plugIn->identifier && columnText(row, 4) == plugIn->version &&
+              columnText(row, 5) == plugIn->appPath && columnText(row, 6) == plugIn->point &&
+              columnText(row, 11) == plugIn->container &&
+              columnDictionary(row, 7) == plugIn->info && columnDictionary(row, 8) == plugIn->sdk &&
+              columnDictionary(row, 9) == plugIn->entitlements &&
+              columnDictionary(row, 12) == plugIn->strings &&
+              columnIdentity(row, 13) == plugIn->identity;
+        }
+      }
+      if (unchanged) {
+        if (plugIn->container) ensureContainer(*plugIn->container, path);
+        if (plugIn->sources) fresh.plugIns.push_back(std::move(plugIn).value());
+        if (fresh.plugIns.size() == kScanBatch) recordFresh();
+        continue;
+      }
+      batch.plugIns.push_back(std::move(plugIn).value());
+      if (batch.plugIns.size() == kScanBatch) registerBatch();
     }
   }
-  if (truncated) log::vr().error("%s: too many bundles; the rest ignored", dir);
+  registerBatch();
+  registerPrepared();
+  recordFresh();
+  if (large) tune(kCacheSizeKiB, kCheckpointPages);
+  if (truncated) {
+    log::vr().error("%s: more than %zu bundles; the rest ignored", dir, kMaxSystemBundles);
+  }
   log::vr().info("%zu system bundles: %zu unchanged since they were last read, %zu read",
-                 names.size(), untouched, names.size() - untouched);
-  if (!fresh.plugIns.empty()) recordSources(fresh);
+                 scan.bundles, scan.unchanged, scan.read);
 
-  std::vector<std::string> gone;
+  // Registered plug-ins and applications whose bundles are gone. Names are sorted, so a
+  // system bundle's presence is a binary search.
+  std::vector<std::string> registered;
   {
     std::lock_guard db(dbMutex_);
     Use list(statements_->allPlugInPaths);
     while (list.step() == SQLITE_ROW) {
-      auto path = columnText(list.get(), 0);
-      if (path && !present.contains(*path) && isGone(*path)) gone.push_back(*path);
+      if (auto path = columnText(list.get(), 0)) registered.push_back(std::move(*path));
     }
     Use apps(statements_->allApps);
     while (apps.step() == SQLITE_ROW) {
-      if (auto path = columnText(apps.get(), 0); path && isGone(*path)) gone.push_back(*path);
+      if (auto path = columnText(apps.get(), 0)) registered.push_back(std::move(*path));
     }
   }
-  for (const std::string& path : gone) {
+  const std::string prefix = dir + "/";
+  auto present = [&](const std::string& path) {
+    if (!path.starts_with(prefix)) return false;
+    std::string_view name = std::string_view(path).substr(prefix.size());
+    return std::binary_search(names.begin(), names.end(), name,
+                              [](std::string_view a, std::string_view b) { return a < b; });
+  };
+  for (const std::string& path : registered) {
+    if (present(path) || !isGone(path)) continue;
+    std::lock_guard change(changeMutex_);
     if (auto removed = unregisterLocked(path);
         !removed.ok() && removed.error().code != kNotRegistered) {
       log::vr().error("could not unregister vanished bundle %s: %s", path, removed.error().message);
     }
   }
+  return scan;
 }
 
 // ---------------------------------------------------------------------------------------------
@@ -1733,6 +1901,12 @@ std::vector<Uuid> SqliteRegistry::uuidsLocked(const Dictionary& rules) {
   return uuids;
 }
 
+size_t SqliteRegistry::plugInCount() {
+  std::lock_guard db(dbMutex_);
+  Use count(statements_->countPlugIns);
+  return count.step() == SQLITE_ROW ? static_cast<size_t>(sqlite3_column_int64(count.get(), 0)) : 0;
+}
+
 std::optional<Dictionary> SqliteRegistry::extensionPointSdk(std::string_view identifier) {
   std::lock_guard db(dbMutex_);
   Use find(statements_->sdkOf);
@@ -1765,8 +1939,13 @@ Dictionary SqliteRegistry::localizedStrings(const Uuid& plugIn, std::string_view
 }
 
 Uuid SqliteRegistry::knowledgeUuid() {
-  std::lock_guard db(dbMutex_);
+  std::lock_guard lock(knowledgeMutex_);
   return knowledge_;
+}
+
+void SqliteRegistry::setKnowledge(const Uuid& knowledge) {
+  std::lock_guard lock(knowledgeMutex_);
+  knowledge_ = knowledge;
 }
 
 void SqliteRegistry::clearCaches() {

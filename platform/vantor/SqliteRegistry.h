@@ -34,7 +34,7 @@ namespace ek::vantor {
 // A write-ahead log that SQLite would silently ignore in part or whole (a damaged header, or a
 // broken checksum chain with later frames of the same log) is logged as an error and copied
 // aside with the database under the same name before the database opens. Then the start-up
-// scan runs (see reconcile).
+// scan runs (see reconcile), unless the owner runs it later (Options::scanOnOpen).
 //
 // The log is moved into the main file (a TRUNCATE checkpoint) once the registry has gone
 // unchanged for Options::idleDelay and whenever checkpoint() is called, and free pages are
@@ -49,6 +49,8 @@ class SqliteRegistry : public Registry, public std::enable_shared_from_this<Sqli
     std::shared_ptr<SerialQueue> queue;        // default: a new queue "com.corvane.vantor"
     // Told about everything the start-up scan installs and uninstalls.
     std::vector<std::weak_ptr<RegistryObserver>> observers;
+    // False leaves the start-up scan to the owner (rescanSystemVolume), who may serve lookups
+    // meanwhile: the daemon answers before it has read a large system volume.
     bool scanOnOpen = true;
     // How long a file must have been left alone before the scan trusts its stamp (see
     // BundleSources); tests shorten it.
@@ -72,6 +74,7 @@ class SqliteRegistry : public Registry, public std::enable_shared_from_this<Sqli
   ApplicationProxyPtr applicationByIdentifier(std::string_view identifier) override;
   std::vector<PlugInProxyPtr> query(const Dictionary& rules, const PlugInFilter& filter) override;
   std::vector<Uuid> queryUuids(const Dictionary& rules) override;
+  size_t plugInCount() override;
   // This registry never makes placeholders.
   bool applicationIsPlaceholder(std::string_view) override { return false; }
   std::optional<Dictionary> extensionPointSdk(std::string_view identifier) override;
@@ -80,15 +83,17 @@ class SqliteRegistry : public Registry, public std::enable_shared_from_this<Sqli
   Uuid knowledgeUuid() override;
   void clearCaches() override;
   void checkpoint() override;
-  void rescanSystemVolume() override { reconcile(); }
+  SystemVolumeScan rescanSystemVolume() override { return reconcile(); }
   void addObserver(std::weak_ptr<RegistryObserver> observer) override;
   void removeObserver(const std::shared_ptr<RegistryObserver>& observer) override;
 
   // The start-up scan: registers every bundle under <systemRoot>/Library/PlugIns/ and
   // unregisters every plug-in and application whose bundle directory no longer exists.
   // A bundle that fails to register is logged and skipped. A bundle none of whose files
-  // changed since it was last read (see BundleSources) is not read again.
-  void reconcile();
+  // changed since it was last read (see BundleSources) is not read again. Bundles are
+  // registered a batch per transaction, and changes from other threads wait for one batch at
+  // most, not for the whole scan.
+  SystemVolumeScan reconcile();
 
   // Compares the locale file with what was seen last and, when it changed, raises the
   // locale-change notice. Lookups do this on their own; exposed for callers that poll.
@@ -133,14 +138,18 @@ class SqliteRegistry : public Registry, public std::enable_shared_from_this<Sqli
   std::vector<std::shared_ptr<RegistryObserver>> liveObservers();
 
   Options options_;
-  // Serialises changes (register, unregister, the start-up scan), held across the uninstall
-  // notice so that what the notice announces is what gets deleted.
+  // Serialises changes (register, unregister, each batch of the start-up scan), held across the
+  // uninstall notice so that what the notice announces is what gets deleted.
   std::mutex changeMutex_;
   // Guards the connection and its statements.
   std::mutex dbMutex_;
   sqlite3* db_ = nullptr;
   std::unique_ptr<Statements> statements_;
-  Uuid knowledge_;  // REQUIRES dbMutex_
+  // Changed under dbMutex_ and knowledgeMutex_, read under either: records ask for it on
+  // every use and must not wait for a transaction of the start-up scan.
+  Uuid knowledge_;
+  std::mutex knowledgeMutex_;
+  void setKnowledge(const Uuid& knowledge);
   // uuidsLocked's answers for knowledge, by the index keys they read. REQUIRES dbMutex_.
   struct UuidLists {
     Uuid knowledge;
