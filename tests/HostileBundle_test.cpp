@@ -222,32 +222,33 @@ TEST_F(HostileBundle, ReplyLargerThanAFrameIsAnError) {
   EXPECT_EQ(replyErrorCode(match("com.example.hostile")), 0);
 }
 
-// A long "add" goes on in slices: a "find" sent by another client after it is answered
-// while the add is still at work.
+// A long "add" goes on in slices: a "find" sent by another client once the add is under way is
+// answered while the add is still at work.
 TEST_F(HostileBundle, LongAddDoesNotHoldOtherClients) {
-  const fs::path known = makePlugIn("Known");
-  ASSERT_EQ(replyErrorCode(add({Value(known.string())})), 0);
   Array paths;
-  for (int i = 0; i < 150; ++i) paths.emplace_back(makePlugIn("Many" + std::to_string(i)).string());
+  for (int i = 0; i < 1000; ++i)
+    paths.emplace_back(makePlugIn("Many" + std::to_string(i)).string());
 
   RawClient adder(daemon_->socketPath());
   RawClient finder(daemon_->socketPath());
   ASSERT_TRUE(adder.connected() && finder.connected());
   ASSERT_TRUE(adder.sendMessage(request("add", {{"paths", Value(std::move(paths))}}), 1));
-  // Sent once the add is under way: the daemon has answered something from the adder's
-  // connection only when it is done, so the find's reply must come first.
-  ::usleep(20000);
-  ASSERT_TRUE(
-      finder.sendMessage(request("find", {{"paths", Value("file://" + known.string())}}), 2));
-  auto found = finder.readFrame(std::chrono::seconds(30));
-  ASSERT_TRUE(found) << daemon_->log();
-  EXPECT_EQ(replyErrorCode(found->body), 0) << found->body.description();
+  // Asked until the add's first slice has registered the first plug-in: the add is under way
+  // from then on, and the rest of its thousand bundles takes more than one slice.
+  const Value first("file://" + plugIn("Many0").string());
+  for (uint32_t id = 2;; ++id) {
+    ASSERT_TRUE(finder.sendMessage(request("find", {{"paths", first}}), id));
+    auto found = finder.readFrame(std::chrono::seconds(30));
+    ASSERT_TRUE(found) << daemon_->log();
+    if (replyErrorCode(found->body) == 0) break;
+    ASSERT_LT(id, 1000000u) << "the first plug-in was never registered";
+  }
   pollfd pending{adder.fd(), POLLIN, 0};
   EXPECT_EQ(::poll(&pending, 1, 0), 0) << "the add was answered first";
   auto added = adder.readFrame(std::chrono::seconds(120));
   ASSERT_TRUE(added) << daemon_->log();
   EXPECT_EQ(replyErrorCode(added->body), 0) << added->body.description();
-  EXPECT_EQ(replyErrorCode(find(plugIn("Many149"))), 0);
+  EXPECT_EQ(replyErrorCode(find(plugIn("Many999"))), 0);
 }
 
 }  // namespace
