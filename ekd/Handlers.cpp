@@ -98,7 +98,7 @@ void continuePaths(const Request& request, EkDServer& daemon, std::shared_ptr<Pa
     }
     if (walk->next < paths.size() && std::chrono::steady_clock::now() >= deadline) {
       // respond keeps the request and the daemon alive until it has been called.
-      daemon.mainQueue()->async([&request, &daemon, walk, respond = std::move(respond)] {
+      daemon.mainQueue()->asyncAfterEvents([&request, &daemon, walk, respond = std::move(respond)] {
         continuePaths(request, daemon, walk, respond);
       });
       return;

@@ -100,9 +100,9 @@ using PathStep = std::function<Step(const std::string& path, bool resolved)>;
 // failure.
 Step forEachPath(const Request& request, const PathStep& step);
 // The same walk for work that takes long per path (registration), answered with an empty reply
-// once every path was accepted. It runs in slices of about 10 ms: after each, the rest
-// goes to the back of the work queue, so other clients' requests are answered in between. Stops
-// unanswered once the client is gone.
+// once every path was accepted. It runs in slices of about 10 ms: after each, the daemon reads
+// what waits on its sockets and the rest goes to the back of the work queue, so other clients'
+// requests are answered in between. Stops unanswered once the client is gone.
 void forEachPathInSlices(const Request& request, EkDServer& daemon, PathStep step, Respond respond);
 
 }  // namespace handlers

@@ -82,6 +82,12 @@ void SerialQueue::asyncContinuation(std::function<void()> block) {
   if (!owned_) scheduleLocked(context_.get_executor().running_in_this_thread());
 }
 
+void SerialQueue::asyncAfterEvents(std::function<void()> block) {
+  asio::post(context_, [self = shared_from_this(), block = std::move(block)]() mutable {
+    self->async(std::move(block));
+  });
+}
+
 void SerialQueue::scheduleLocked(bool continuation) {
   owned_ = true;
   auto drain = [self = shared_from_this()] { self->drain(); };

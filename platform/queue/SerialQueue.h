@@ -53,6 +53,10 @@ class SerialQueue : public std::enable_shared_from_this<SerialQueue> {
   // handler returns, rather than waking another thread for it. The handler must not wait for
   // the block (nor enter this queue with sync) before it returns. From any other thread, async.
   void asyncContinuation(std::function<void()> block);
+  // async, once the context has read the events waiting for it: for the next part of work that
+  // gives way to others between its parts. A block queued from a block of this queue would run
+  // in the same turn, before any request still unread on a socket.
+  void asyncAfterEvents(std::function<void()> block);
   void sync(const std::function<void()>& block);
 
   // Whether the calling thread is running a block of this queue (also inside a sync).
