@@ -214,18 +214,24 @@ void EkDServer::stop() {
   registry()->checkpoint();
 }
 
+std::shared_ptr<const EkDPlugInHolds> EkDServer::holds() const {
+  std::lock_guard lock(holdsPointer_);
+  return holds_;
+}
+
 void EkDServer::changeHolds(
     const std::function<void(std::vector<std::shared_ptr<EkDPlugInHold>>&)>& change) {
   std::shared_ptr<const EkDPlugInHolds> previous;
   std::lock_guard lock(holdsWriter_);
-  previous = holds_.load();
+  previous = holds();
   auto next = std::make_shared<EkDPlugInHolds>();
   next->holds = previous->holds;
   change(next->holds);
   for (const auto& hold : next->holds) {
     for (const auto& plugIn : hold->blocked()) next->blocked.insert(plugIn->uuid());
   }
-  holds_.store(std::move(next));
+  std::lock_guard pointer(holdsPointer_);
+  holds_ = std::move(next);
 }
 
 void EkDServer::watchHostExit(const AuditToken& host) {
