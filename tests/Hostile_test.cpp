@@ -1,0 +1,405 @@
+// What a hostile local client can do through a real ekd: lend a socket to gain entitlements,
+// flood or starve the connection layer, put hostile bundles on disk, and send annotations the
+// file cannot hold. The daemon must judge every request by its writer and keep serving others.
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cmath>
+#include <cstring>
+#include <fstream>
+#include <limits>
+#include <thread>
+
+#include "platform/dmap/Dmap.h"
+#include "platform/testing/Files.h"
+#include "platform/value/Uuid.h"
+#include "platform/wyre/Wyre.h"
+#include "tests/EkdProcess.h"
+#include "tests/RawClient.h"
+
+namespace ek::test {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+constexpr uint64_t kDiscoverAll = 0x200;
+constexpr const char* kManager = "com.corvane.private.ekora.manager";
+
+size_t occurrences(const std::string& text, std::string_view what) {
+  size_t count = 0;
+  for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++count;
+  return count;
+}
+
+void writeInfo(const fs::path& bundle, const Dictionary& info) {
+  ASSERT_TRUE(
+      testing::writeFile((bundle / "Info.dmap").string(), dmap::write(Value(info)).value()));
+}
+
+Dictionary plugInInfo(const std::string& identifier,
+                      const std::string& point = "com.example.hostile", std::string padding = {}) {
+  Dictionary extension{{"ZuExtensionPointIdentifier", Value(point)},
+                       {"ZuExtensionAttributes", Value(Dictionary{})}};
+  if (!padding.empty()) extension.emplace("Padding", Value(std::move(padding)));
+  return {{"QvBundleIdentifier", Value(identifier)}, {"ZuExtension", Value(std::move(extension))}};
+}
+
+// A daemon with Host.app, which holds hostile plug-ins, and the example Viewer.app.
+class Hostile : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_ = fs::canonical(daemon_.root().path());
+    writeInfo(host(), {{"QvBundleIdentifier", Value("com.example.host")}});
+    fs::copy(fs::path(EXAMPLES_DIR) / "Applications/Viewer.app", root_ / "Viewer.app",
+             fs::copy_options::recursive);
+    daemon_.setEnvironment("EKORA_LOG", "default");
+    ASSERT_TRUE(daemon_.start()) << daemon_.log();
+  }
+  void TearDown() override {
+    if (daemon_.running()) {
+      EXPECT_EQ(daemon_.terminate(), 0) << daemon_.log();
+    }
+  }
+
+  fs::path host() const { return root_ / "Apps" / "Host.app"; }
+  fs::path plugIn(const std::string& name) const { return host() / "PlugIns" / (name + ".appex"); }
+  fs::path makePlugIn(const std::string& name) const {
+    writeInfo(plugIn(name), plugInInfo("com.example." + name));
+    return plugIn(name);
+  }
+  Value ask(const Value& message) {
+    auto reply = daemon_.ask(message);
+    EXPECT_TRUE(reply) << message.description().substr(0, 200) << "\n" << daemon_.log();
+    return reply ? *reply : Value(Dictionary{{"errorcode", Value(uint64_t{999})}});
+  }
+  Value add(Array paths) { return ask(request("add", {{"paths", Value(std::move(paths))}})); }
+  Value find(const fs::path& bundle) {
+    Value reply = ask(request("find", {{"paths", Value("file://" + bundle.string())}}));
+    const Value* form = reply.get("matches");
+    return form ? *form : reply;
+  }
+  Uuid uuidOf(const fs::path& bundle) {
+    const Value form = find(bundle);
+    const std::string* uuid = form.getString("uuid");
+    return uuid ? *Uuid::parse(*uuid) : Uuid();
+  }
+  // Another client's request, answered within the time given.
+  bool servedWithin(std::chrono::milliseconds limit) {
+    RawClient client(daemon_.socketPath());
+    if (!client.sendMessage(request("Nope"), 9)) return false;
+    auto frame = client.readFrame(limit);
+    return frame && replyError(frame->body) == "unrecognized request";
+  }
+
+  EkdProcess daemon_;
+  fs::path root_;
+};
+using HostileConnection = Hostile;
+using HostileBundle = Hostile;
+using HostileAnnotation = Hostile;
+
+// Entitlements go with the program that writes a request, not with the connection.
+TEST_F(HostileConnection, EntitlementsAreNotLentWithTheSocket) {
+  struct stat st {};
+  ASSERT_EQ(::stat(daemon_.socketPath().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u) << "other users may connect";
+  const std::string entitled = ekctlWithEntitlements(root_ / "entitled", {kManager});
+  EXPECT_EQ(daemon_.ekctlAs(entitled, {"match", "--flags", "512"}).status, 0) << daemon_.log();
+
+  // The entitled program connects (as a child that then executes it) and idles; this process
+  // writes on the socket it kept.
+  RawClient lent(daemon_.socketPath());
+  ASSERT_TRUE(lent.connected());
+  pid_t child = fork();
+  if (child == 0) {
+    for (const auto& [key, value] : daemon_.environment()) setenv(key.c_str(), value.c_str(), 1);
+    execl(entitled.c_str(), entitled.c_str(), "watch", "com.example.idle", nullptr);
+    _exit(127);
+  }
+  const fs::path exe = "/proc/" + std::to_string(child) + "/exe";
+  for (int i = 0; i < 500; ++i) {
+    std::error_code ignored;
+    if (fs::read_symlink(exe, ignored) == entitled) break;
+    std::this_thread::sleep_for(10ms);
+  }
+  ASSERT_TRUE(lent.sendMessage(request("match", {{"flags", Value(kDiscoverAll)}}), 1));
+  auto reply = lent.readFrame();
+  ::kill(child, SIGKILL);
+  waitpid(child, nullptr, 0);
+  ASSERT_TRUE(reply) << daemon_.log();
+  EXPECT_EQ(replyErrorCode(reply->body), 11) << reply->body.description().substr(0, 200);
+}
+
+// Messages that want no reply count among those that may wait: a flood of them neither grows
+// the daemon nor keeps another client waiting.
+TEST_F(HostileConnection, FloodOfMessagesWantingNoReplyIsBounded) {
+  RawClient flooder(daemon_.socketPath());
+  // Cheap to read, dear to serve: every path is resolved and looked up in the registry.
+  std::vector<uint8_t> frame;
+  wyre::appendFrame(frame, request("lock", {{"paths", Value(Array(1000, Value("/")))}}), 0, 1);
+  std::atomic<int> sent{0};
+  const long baseline = residentKiB(daemon_.pid());
+  long peak = baseline;
+  std::thread flood([&] {
+    for (int i = 0; i < 3000 && flooder.sendBytes(frame); ++i) ++sent;
+  });
+  for (auto until = std::chrono::steady_clock::now() + 10s;
+       sent.load() <= static_cast<int>(wyre::kMaxWaitingMessages) &&
+       std::chrono::steady_clock::now() < until;) {
+    std::this_thread::sleep_for(1ms);
+  }
+  for (int i = 0; i < 20; ++i) {
+    EXPECT_TRUE(servedWithin(2s)) << "request " << i << " waited behind the flood";
+    peak = std::max(peak, residentKiB(daemon_.pid()));
+  }
+  ::shutdown(flooder.fd(), SHUT_RDWR);
+  flood.join();
+  EXPECT_GT(sent.load(), static_cast<int>(wyre::kMaxWaitingMessages));
+  if (!kSanitized) {
+    EXPECT_LT(peak - baseline, 64 * 1024) << "KiB grown while flooded";
+  }
+}
+
+// A frame left half-sent is closed after 10 s; malformed frames close their connections
+// without flooding the log.
+TEST_F(HostileConnection, HalfSentAndMalformedFramesAreClosedAndLoggedSparingly) {
+  std::vector<std::unique_ptr<RawClient>> holders;
+  for (int i = 0; i < 4; ++i) {
+    holders.push_back(std::make_unique<RawClient>(daemon_.socketPath()));
+    std::vector<uint8_t> bytes(wyre::kHeaderSize + (8u << 20), 'x');
+    wyre::encodeHeader({63u << 20, wyre::kFlagWantsReply, 1}, bytes.data());
+    ASSERT_TRUE(holders.back()->sendBytes(bytes));
+  }
+  EXPECT_TRUE(servedWithin(2s));
+
+  const size_t before = daemon_.log().size();
+  const auto begun = std::chrono::steady_clock::now();
+  std::vector<uint8_t> garbage(64, 0xff);
+  wyre::encodeHeader({48, wyre::kFlagWantsReply, 1}, garbage.data());
+  for (int i = 0; i < 2000; ++i) RawClient(daemon_.socketPath()).sendBytes(garbage);
+  EXPECT_TRUE(servedWithin(5s));
+  const auto seconds =
+      std::chrono::duration_cast<std::chrono::seconds>(std::chrono::steady_clock::now() - begun)
+          .count();
+  const std::string added = daemon_.log().substr(before);
+  EXPECT_GE(occurrences(added, "closing connection from pid="), 1u);
+  EXPECT_LE(occurrences(added, "closing connection from pid="), static_cast<size_t>(seconds + 2))
+      << added;
+
+  for (auto& holder : holders) EXPECT_TRUE(holder->closedByPeer(20s));
+  EXPECT_GE(std::chrono::steady_clock::now() - begun, 9s);
+  EXPECT_TRUE(daemon_.logShows("frame incomplete 10 s after it began"));
+}
+
+TEST_F(HostileConnection, ConnectionsBeyondTheBoundAreRefused) {
+  // A descriptor limit of 256 leaves room for (256 - 64) / 3 = 64 connections.
+  struct rlimit low {
+    256, 256
+  };
+  ASSERT_EQ(prlimit(daemon_.pid(), RLIMIT_NOFILE, &low, nullptr), 0);
+  std::vector<std::unique_ptr<RawClient>> clients;
+  for (int i = 0; i < 80; ++i) clients.push_back(std::make_unique<RawClient>(daemon_.socketPath()));
+  // Those beyond the bound are closed in the order they came; the connection with which start()
+  // saw the daemon up may still have counted among the first.
+  ASSERT_TRUE(clients.back()->closedByPeer(10s)) << daemon_.log();
+  size_t refused = 0;
+  for (auto it = clients.rbegin(); it != clients.rend() && (*it)->closedByPeer(200ms); ++it) {
+    ++refused;
+  }
+  EXPECT_GE(refused, 15u) << daemon_.log();
+  EXPECT_LE(refused, 16u) << daemon_.log();
+  EXPECT_TRUE(daemon_.logShows("connections already"));
+  clients.clear();
+  EXPECT_TRUE(servedWithin(5s));
+}
+
+// Each bundle is registered alone; the hostile ones are refused with the reason logged.
+TEST_F(HostileBundle, BundleFilesAreReadBeneathTheBundleAndBounded) {
+  const fs::path secret = root_ / "secret";
+  writeInfo(secret, plugInInfo("com.example.secret"));
+  ASSERT_EQ(::chmod((secret / "Info.dmap").c_str(), 0600), 0);
+  const struct {
+    std::string name;
+    std::function<void(const fs::path& bundle)> make;
+    std::string reason;  // in the log; empty: registered
+  } rows[] = {
+      {"Huge",
+       [](const fs::path& bundle) {
+         writeInfo(bundle, plugInInfo("com.example.huge", "p", std::string(1 << 20, 'x')));
+       },
+       "exceeds the limit of 1048576"},
+      {"Linked",
+       [&](const fs::path& bundle) {
+         fs::create_directories(bundle);
+         fs::create_symlink(secret / "Info.dmap", bundle / "Info.dmap");
+       },
+       "leads out of " + plugIn("Linked").string()},
+      {"Fifo",
+       [](const fs::path& bundle) {
+         fs::create_directories(bundle);
+         ASSERT_EQ(::mkfifo((bundle / "Info.dmap").c_str(), 0600), 0);
+       },
+       "Info.dmap: not a regular file"},
+      {"Good", [](const fs::path& bundle) { writeInfo(bundle, plugInInfo("g")); }, ""},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    const fs::path bundle = plugIn(row.name);
+    row.make(bundle);
+    Value reply = add({Value(bundle.string())});
+    if (row.reason.empty()) {
+      EXPECT_EQ(replyErrorCode(reply), 0) << reply.description();
+      EXPECT_TRUE(find(bundle).getString("uuid"));
+      continue;
+    }
+    EXPECT_EQ(replyErrorCode(reply), 2) << reply.description();
+    EXPECT_EQ(replyError(reply), "unable to register plug-in at " + bundle.string());
+    EXPECT_TRUE(daemon_.logShows(row.reason)) << daemon_.log();
+    EXPECT_EQ(replyErrorCode(find(bundle)), 15);
+  }
+  EXPECT_EQ(daemon_.log().find("com.example.secret"), std::string::npos);
+}
+
+TEST_F(HostileBundle, SwappedBundleDirectoryGetsNoToken) {
+  const fs::path bundle = makePlugIn("Swapped");
+  ASSERT_EQ(replyErrorCode(add({Value(bundle.string())})), 0);
+  const Uuid uuid = uuidOf(bundle);
+  auto access = [&] { return ask(request("access", {{"uuids", Value(Array{Value(uuid)})}})); };
+  ASSERT_EQ(replyErrorCode(access()), 0);
+  // Another directory, shaped like the bundle, now stands at its path.
+  fs::rename(bundle, root_ / "Elsewhere");
+  fs::create_symlink(root_ / "Elsewhere", bundle);
+  EXPECT_EQ(find(bundle).getDictionary("extensions")->size(), 0u);
+  Value refused = access();
+  EXPECT_EQ(replyErrorCode(refused), 4) << refused.description();
+  EXPECT_EQ(replyError(refused),
+            "cannot create file extension to " + bundle.string() + ": " + std::to_string(ESTALE));
+  EXPECT_EQ(refused.get("extensions"), nullptr);
+}
+
+// Bundles each within the file limit, but together more than a frame can carry: the match that
+// would send them all is answered with an error, and the daemon goes on serving.
+TEST_F(HostileBundle, ReplyLargerThanAFrameIsAnError) {
+  Array paths;
+  for (int i = 0; i < 34; ++i) {
+    const fs::path bundle = plugIn("Large" + std::to_string(i));
+    // Each form carries the padding twice ("info" and "bundleInfo").
+    writeInfo(bundle, plugInInfo("com.example.large" + std::to_string(i), "com.example.large",
+                                 std::string(1000 * 1000, 'x')));
+    paths.emplace_back(bundle.string());
+  }
+  ASSERT_EQ(replyErrorCode(add(std::move(paths))), 0);
+  auto match = [&](const char* point) {
+    return ask(request(
+        "match", {{"rules", Value(Dictionary{{"ZuExtensionPointIdentifier", Value(point)}})}}));
+  };
+  Value refused = match("com.example.large");
+  EXPECT_EQ(replyErrorCode(refused), 4) << refused.description().substr(0, 200);
+  EXPECT_NE(replyError(refused).find("exceeds the frame limit of 67108864 bytes"),
+            std::string::npos)
+      << replyError(refused);
+  EXPECT_EQ(replyErrorCode(match("com.example.hostile")), 0);
+}
+
+// A long "add" goes on in slices: a "find" sent by another client once the add is under way is
+// answered while the add is still at work.
+TEST_F(HostileBundle, LongAddDoesNotHoldOtherClients) {
+  // The host application is registered first, with one plug-in: registering it later would
+  // register every plug-in in its folder at once, in the add's first step.
+  ASSERT_EQ(replyErrorCode(add({Value(makePlugIn("Known").string())})), 0);
+  Array paths;
+  for (int i = 0; i < 1000; ++i)
+    paths.emplace_back(makePlugIn("Many" + std::to_string(i)).string());
+  RawClient adder(daemon_.socketPath());
+  RawClient finder(daemon_.socketPath());
+  ASSERT_TRUE(adder.sendMessage(request("add", {{"paths", Value(std::move(paths))}}), 1));
+  // Asked until the add's first slice has registered the first plug-in.
+  const Value first("file://" + plugIn("Many0").string());
+  for (uint32_t id = 2;; ++id) {
+    ASSERT_TRUE(finder.sendMessage(request("find", {{"paths", first}}), id));
+    auto found = finder.readFrame(30s);
+    ASSERT_TRUE(found) << daemon_.log();
+    if (replyErrorCode(found->body) == 0) break;
+    ASSERT_LT(id, 1000000u) << "the first plug-in was never registered";
+  }
+  pollfd pending{adder.fd(), POLLIN, 0};
+  EXPECT_EQ(::poll(&pending, 1, 0), 0) << "the add was answered first";
+  auto added = adder.readFrame(120s);
+  ASSERT_TRUE(added) << daemon_.log();
+  EXPECT_EQ(replyErrorCode(added->body), 0) << added->body.description();
+  EXPECT_EQ(replyErrorCode(find(plugIn("Many999"))), 0);
+}
+
+TEST_F(HostileAnnotation, ValuesTheFileCannotHoldAreRefusedAndLoseNobodysChanges) {
+  const std::string app = (root_ / "Viewer.app").string();
+  ASSERT_EQ(replyErrorCode(add({Value(app)})), 0);
+  const Uuid thumbs = uuidOf(app + "/PlugIns/Thumbs.appex");
+  const Uuid share = uuidOf(app + "/PlugIns/Share.appex");
+  auto annotate = [&](Dictionary annotations, const Uuid& uuid) {
+    return ask(request("annotate", {{"annotations", Value(std::move(annotations))},
+                                    {"uuids", Value(Array{Value(uuid)})}}));
+  };
+  auto extension = [](Value value) {
+    return Dictionary{{"extension", Value(Dictionary{{"v", std::move(value)}})}};
+  };
+  const struct {
+    const char* what;
+    Dictionary annotations;
+    int64_t code;
+  } cases[] = {
+      {"NaN election", {{"election", Value(std::numeric_limits<double>::quiet_NaN())}}, 4},
+      {"control character", extension(Value("bell\x07")), 4},
+      {"date after the year 9999", extension(Value(Date{253402300800})), 4},
+      {"over 64 KiB", extension(Value(std::string(65 * 1024, 'x'))), 18},
+      {"30 MB", extension(Value(std::string(30 << 20, 'x'))), 18},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.what);
+    Value reply = annotate(c.annotations, thumbs);
+    EXPECT_EQ(replyErrorCode(reply), c.code) << reply.description().substr(0, 300);
+    if (const auto it = c.annotations.find("extension"); it != c.annotations.end()) {
+      Value bulk = ask(request(
+          "bulk-annotate", {{"annotations", Value(Dictionary{{thumbs.string(), it->second}})}}));
+      EXPECT_EQ(replyErrorCode(bulk), 18) << bulk.description().substr(0, 300);
+    }
+  }
+  // Other changes are kept, on disk: an election given as a boolean is the number.
+  EXPECT_EQ(replyErrorCode(annotate({{"election", Value(true)}}, thumbs)), 0);
+  const Dictionary kept{{"ok", Value(1)}};
+  EXPECT_EQ(replyErrorCode(annotate({{"extension", Value(kept)}}, share)), 0);
+  daemon_.kill9();
+  ASSERT_TRUE(daemon_.start()) << daemon_.log();
+  EXPECT_EQ(*find(app + "/PlugIns/Thumbs.appex").get("annotations"),
+            Value(Dictionary{{"election", Value(1)}}));
+  EXPECT_EQ(*find(app + "/PlugIns/Share.appex").get("annotations"),
+            Value(Dictionary{{"extension", Value(kept)}}));
+}
+
+TEST_F(HostileAnnotation, DamagedRegistryLogIsReportedAndKeptAside) {
+  ASSERT_EQ(replyErrorCode(add({Value((root_ / "Viewer.app").string())})), 0);
+  // Killed before the registry went idle: its changes are still in the log.
+  daemon_.kill9();
+  const fs::path wal = root_ / "state/registry.db-wal";
+  ASSERT_GT(fs::file_size(wal), 32u);
+  std::fstream(wal, std::ios::in | std::ios::out | std::ios::binary) << std::string(32, 'x');
+  ASSERT_TRUE(daemon_.start()) << daemon_.log();
+  EXPECT_TRUE(daemon_.logShows("registry write-ahead log " + wal.string() + " is unusable"));
+  bool keptAside = false;
+  for (const auto& entry : fs::directory_iterator(root_ / "state")) {
+    const std::string name = entry.path().filename().string();
+    keptAside |= name.starts_with("registry.db.corrupt-") && name.ends_with("-wal");
+  }
+  EXPECT_TRUE(keptAside);
+}
+
+}  // namespace
+}  // namespace ek::test
