@@ -193,6 +193,24 @@ TEST_F(HandlersTest, RepliesToEachShapeOfRequest) {
        {{paths, Value(Array{Value("a")})}},
        kErrorBadPath},
       {"remove by a manager", M, kRemove, {{paths, Value(Array{dir, missing})}}, 0},
+      // Lists are bounded at 10,000 entries; copies of one path cost one registration.
+      {"add of 10,000 paths", N, kAdd, {{paths, Value(Array(10000, dir))}}, 0},
+      {"add of 10,001 paths", N, kAdd, {{paths, Value(Array(10001, dir))}}, kErrorInvalidRequest},
+      {"remove of 10,001 paths",
+       M,
+       kRemove,
+       {{paths, Value(Array(10001, dir))}},
+       kErrorInvalidRequest},
+      {"access to 10,001 plug-ins",
+       N,
+       kAccess,
+       {{uuids, Value(Array(10001, Value(kKnown)))}},
+       kErrorInvalidRequest},
+      {"ready of 10,001 plug-ins",
+       N,
+       kReady,
+       {{uuids, Value(Array(10001, Value(kKnown)))}},
+       kErrorInvalidRequest},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);

@@ -9,7 +9,6 @@
 #include <unistd.h>
 
 #include <cstring>
-#include <future>
 
 #include "platform/cbor/Cbor.h"
 #include "platform/wyre/Wyre.h"
@@ -98,20 +97,6 @@ TEST_F(DaemonFrame, EachRequestWantingAReplyGetsOneInOrder) {
     EXPECT_EQ(frame->id, expected);
     EXPECT_TRUE(frame->body.dictionary());
   }
-  // Many clients at once: each one's replies in the order of its requests.
-  std::vector<std::future<int>> results;
-  for (int c = 0; c < 8; ++c) {
-    results.push_back(std::async(std::launch::async, [this] {
-      RawClient client(daemon_.socketPath());
-      if (!client.sendBytes(batchOfUnknown(200))) return -1;
-      for (int i = 0; i < 200; ++i) {
-        auto frame = client.readFrame();
-        if (!frame || frame->id != static_cast<uint64_t>(i)) return i;
-      }
-      return 0;
-    }));
-  }
-  for (auto& r : results) EXPECT_EQ(r.get(), 0);
 }
 
 TEST_F(DaemonFaults, MalformedFramesCloseOnlyTheirConnection) {

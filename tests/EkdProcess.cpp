@@ -1,18 +1,14 @@
 #include "tests/EkdProcess.h"
 
 #include <fcntl.h>
-#include <poll.h>
 #include <signal.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <chrono>
 #include <cstdlib>
-#include <cstring>
 #include <fstream>
 #include <random>
 #include <sstream>
@@ -28,20 +24,6 @@ std::string ekdPath() {
 }
 std::string ekctlPath() {
   return EKCTL_PATH;
-}
-std::string sandboxExecPath() {
-  return SANDBOX_EXEC_PATH;
-}
-
-TempDir::TempDir() {
-  std::string pattern = (fs::temp_directory_path() / "ekora-test-XXXXXX").string();
-  if (!mkdtemp(pattern.data())) std::abort();
-  path_ = pattern;
-}
-
-TempDir::~TempDir() {
-  std::error_code ignored;
-  fs::remove_all(path_, ignored);
 }
 
 namespace {
@@ -116,10 +98,6 @@ std::map<std::string, std::string> EkdProcess::environment() const {
           {"EKORA_SYSTEM_ROOT", (root_.path() / "System").string()}};
 }
 
-void EkdProcess::exportEnvironment() const {
-  for (const auto& [key, value] : environment()) setenv(key.c_str(), value.c_str(), 1);
-}
-
 std::string EkdProcess::socketPath() const {
   return (root_.path() / "run" / service_).string();
 }
@@ -140,25 +118,6 @@ bool EkdProcess::logShows(std::string_view text) const {
 }
 
 bool EkdProcess::start() {
-  if (!startServing()) return false;
-  const Value status(Dictionary{{"request", Value("status")}, {"version", Value(uint64_t{3})}});
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
-  while (std::chrono::steady_clock::now() < deadline) {
-    auto reply = ask(status, std::chrono::seconds(5));
-    const Value* scanning = reply ? reply->get("scanning") : nullptr;
-    if (scanning && scanning->boolean() && !*scanning->boolean()) return true;
-    int code;
-    if (waitpid(pid_, &code, WNOHANG) == pid_) {
-      exitStatus_ = decodeStatus(code);
-      pid_ = -1;
-      return false;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  return false;
-}
-
-bool EkdProcess::startServing() {
   std::string logPath = (root_.path() / "ekd.log").string();
   pid_ = fork();
   if (pid_ == 0) {
@@ -179,22 +138,19 @@ bool EkdProcess::startServing() {
     execv(args[0], args.data());
     _exit(127);
   }
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  // Up once it answers and has registered the system volume.
+  const Value status(Dictionary{{"request", Value("status")}, {"version", Value(uint64_t{3})}});
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
   while (std::chrono::steady_clock::now() < deadline) {
-    int status;
-    if (waitpid(pid_, &status, WNOHANG) == pid_) {
-      exitStatus_ = decodeStatus(status);
+    int code;
+    if (waitpid(pid_, &code, WNOHANG) == pid_) {
+      exitStatus_ = decodeStatus(code);
       pid_ = -1;
       return false;
     }
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::string path = socketPath();
-    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-    bool connected = connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
-    close(fd);
-    if (connected) return true;
+    auto reply = ask(status, std::chrono::seconds(5));
+    const Value* scanning = reply ? reply->get("scanning") : nullptr;
+    if (scanning && scanning->boolean() && !*scanning->boolean()) return true;
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
   }
   return false;
@@ -257,13 +213,6 @@ uint64_t EkdProcess::notificationGeneration(std::string_view name) const {
   return generation;
 }
 
-std::string EkdProcess::annotationFile() const {
-  for (size_t i = 0; i + 1 < extraArgs_.size(); ++i) {
-    if (extraArgs_[i] == "-d") return extraArgs_[i + 1];
-  }
-  return (root_.path() / "state" / "Ekora-Annotations").string();
-}
-
 std::string ekctlWithEntitlements(const fs::path& dir,
                                   const std::vector<std::string>& entitlements) {
   fs::create_directories(dir);
@@ -289,15 +238,6 @@ int64_t replyErrorCode(const Value& reply) {
 std::string replyError(const Value& reply) {
   const std::string* text = reply.getString("error");
   return text ? *text : std::string();
-}
-
-long residentKiB(pid_t pid) {
-  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
-  }
-  return -1;
 }
 
 }  // namespace ek::test

@@ -7,10 +7,6 @@
 # Usage: user_instance_test.sh EKD EKCTL SOURCE_DIR
 set -euo pipefail
 
-if [[ $# -ne 3 ]]; then
-  echo "usage: $0 EKD EKCTL SOURCE_DIR" >&2
-  exit 2
-fi
 ekd=$1
 ekctl=$2
 source=$3
