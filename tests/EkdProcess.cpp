@@ -11,7 +11,6 @@
 #include <cstdlib>
 #include <fstream>
 #include <random>
-#include <sstream>
 #include <thread>
 
 #include "tests/RawClient.h"
@@ -104,9 +103,7 @@ std::string EkdProcess::socketPath() const {
 
 std::string EkdProcess::log() const {
   std::ifstream in(root_.path() / "ekd.log");
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
+  return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 bool EkdProcess::logShows(std::string_view text) const {
@@ -161,34 +158,29 @@ bool EkdProcess::running() const {
 }
 
 int EkdProcess::terminate() {
-  if (pid_ <= 0) return exitStatus_;
-  ::kill(pid_, SIGTERM);
-  int status = 0;
-  waitpid(pid_, &status, 0);
-  pid_ = -1;
-  exitStatus_ = decodeStatus(status);
+  if (pid_ > 0) {
+    ::kill(pid_, SIGTERM);
+    int status = 0;
+    waitpid(pid_, &status, 0);
+    pid_ = -1;
+    exitStatus_ = decodeStatus(status);
+  }
   return exitStatus_;
 }
 
 void EkdProcess::kill9() {
-  if (pid_ <= 0) return;
-  ::kill(pid_, SIGKILL);
-  int status = 0;
-  waitpid(pid_, &status, 0);
-  pid_ = -1;
-  exitStatus_ = decodeStatus(status);
+  if (pid_ > 0) ::kill(pid_, SIGKILL);
+  terminate();
 }
 
 CommandResult EkdProcess::ekctl(std::vector<std::string> args, const std::string& input) const {
-  std::vector<std::string> argv{ekctlPath(), "-S", service_};
-  argv.insert(argv.end(), args.begin(), args.end());
-  return runCommand(argv, environment(), input);
+  args.insert(args.begin(), {ekctlPath(), "-S", service_});
+  return runCommand(args, environment(), input);
 }
 
 CommandResult EkdProcess::ekctlAs(const std::string& program, std::vector<std::string> args) const {
-  std::vector<std::string> argv{program, "-S", service_};
-  argv.insert(argv.end(), args.begin(), args.end());
-  return runCommand(argv, environment());
+  args.insert(args.begin(), {program, "-S", service_});
+  return runCommand(args, environment());
 }
 
 void EkdProcess::setEnvironment(const std::string& name, const std::string& value) {
