@@ -53,6 +53,13 @@ std::vector<uint8_t> batchOfUnknown(int count) {
   return batch;
 }
 
+sockaddr_un addressOf(const std::string& path) {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+  return address;
+}
+
 size_t occurrences(const std::string& text, std::string_view what) {
   size_t count = 0;
   for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++count;
@@ -245,10 +252,8 @@ TEST(SocketActivation, DaemonServesThePassedSocketAndLeavesItInPlace) {
   // The socket lives where the manager put it, not where ekd would make its own.
   const std::string socketPath = (dir.path() / "activated.sock").string();
   int fd = socket(AF_UNIX, SOCK_STREAM, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
-  ASSERT_EQ(bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  const sockaddr_un address = addressOf(socketPath);
+  ASSERT_EQ(bind(fd, reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
   ASSERT_EQ(listen(fd, 16), 0);
 
   pid_t pid = fork();
@@ -285,12 +290,13 @@ TEST_F(HostileConnection, EntitlementsAreNotLentWithTheSocket) {
   const std::string entitled = ekctlWithEntitlements(root_ / "entitled", {kManager});
   EXPECT_EQ(daemon_.ekctlAs(entitled, {"match", "--flags", "512"}).status, 0) << daemon_.log();
 
-  // The entitled program connects (as a child that then executes it) and idles; this process writes
-  // on the socket it kept.
-  RawClient lent(daemon_.socketPath());
-  ASSERT_TRUE(lent.connected());
+  // A child connects, then executes the entitled program and idles; this process, which kept the
+  // socket, writes on it.
+  RawClient lent(::socket(AF_UNIX, SOCK_STREAM, 0));
   pid_t child = fork();
   if (child == 0) {
+    const sockaddr_un address = addressOf(daemon_.socketPath());
+    if (::connect(lent.fd(), reinterpret_cast<const sockaddr*>(&address), sizeof address)) _exit(1);
     for (const auto& [key, value] : daemon_.environment()) setenv(key.c_str(), value.c_str(), 1);
     execl(entitled.c_str(), entitled.c_str(), "watch", "com.example.idle", nullptr);
     _exit(127);

@@ -6,7 +6,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <thread>
 
 #include "platform/dmap/Dmap.h"
 #include "platform/stard/ServiceManager.h"
