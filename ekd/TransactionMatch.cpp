@@ -8,6 +8,7 @@
 #include "Ekora/EkDaemonClient.h"
 #include "Ekora/EkPlugInKeys.h"
 #include "Ekora/EkProtocol.h"
+#include "ekd/Duplicates.h"
 #include "ekd/EkDFormCache.h"
 #include "ekd/EkDPlugIn.h"
 #include "ekd/EkDPlugInHold.h"
@@ -46,14 +47,6 @@ struct Match {
   std::shared_ptr<const EkDFormCache::EncodedForm> form;
   Dictionary added;
 };
-
-// Whether candidate P wins over an earlier match X of the same identifier and version.
-bool candidateWins(const EkDPlugIn& plugIn, const EkDPlugIn& earlier) {
-  bool earlierSystem = earlier.onSystemVolume();
-  if (!plugIn.onSystemVolume() && earlierSystem) return false;
-  if (plugIn.onSystemVolume() && !earlierSystem) return true;
-  return plugIn.lastModified() > earlier.lastModified();
-}
 
 // A plug-in inside the requesting host's own application wins over other copies of its
 // identifier.
@@ -99,7 +92,62 @@ struct CandidateList {
   }
 };
 
+// Whether candidate P wins over an earlier match X of the same identifier and version.
+bool candidateWins(const DuplicateFilter::Weighed& plugIn,
+                   const DuplicateFilter::Weighed& earlier) {
+  bool earlierSystem = earlier.onSystemVolume();
+  if (!plugIn.onSystemVolume() && earlierSystem) return false;
+  if (plugIn.onSystemVolume() && !earlierSystem) return true;
+  return plugIn.lastModified() > earlier.lastModified();
+}
+
 }  // namespace
+
+DuplicateFilter::Verdict DuplicateFilter::admit(const Copy& copy) {
+  const uint64_t flags = flags_;
+  const std::string* version = copy.version ? copy.version->string() : nullptr;
+  const Weighed plugIn{std::string(formVersion(copy.version).value_or(std::string_view())),
+                       copy.system, copy.modified};
+  Verdict verdict;
+  bool dropped = false;
+  auto sameIdentifier = accepted_.find(copy.identifier.value_or(""));
+  if (sameIdentifier != accepted_.end()) {
+    auto& positions = sameIdentifier->second;
+    for (auto position = positions.begin(); position != positions.end(); ++position) {
+      const Weighed& earlier = position->second;
+      auto order = compareVersionString(version, earlier.version);
+      bool removeEarlier = false;
+      bool stop = true;
+      if (!(flags & protocol::kDiscoverKeepVersions)) {
+        if (order > 0) {
+          removeEarlier = true;
+        } else if (order < 0) {
+          dropped = true;
+        } else if (candidateWins(plugIn, earlier)) {
+          removeEarlier = true;
+        } else {
+          dropped = true;
+        }
+      } else if (order != 0 || (flags & protocol::kDiscoverKeepDuplicates)) {
+        stop = false;
+      } else if (candidateWins(plugIn, earlier)) {
+        removeEarlier = true;
+      } else {
+        dropped = true;
+      }
+      if (removeEarlier) {
+        verdict.replaces = position->first;
+        positions.erase(position);
+      }
+      if (stop) break;
+    }
+  }
+  if (dropped) return verdict;
+  verdict.kept = true;
+  if (copy.identifier) accepted_[*copy.identifier].emplace_back(next_, plugIn);
+  ++next_;
+  return verdict;
+}
 
 namespace handlers {
 
@@ -152,7 +200,7 @@ Reply matchPlugIns(const Request& request, EkDServer& daemon) {
   // so that the positions recorded per identifier stay valid.
   using MatchRef = std::shared_ptr<Match>;
   std::vector<MatchRef> results;
-  std::unordered_map<std::string, std::vector<size_t>> accepted;
+  DuplicateFilter duplicates(flags);
   std::unordered_map<std::string, MatchRef> overrides;
   const Dictionary* matchRules = rules ? &*rules : nullptr;
   EkDFormCache& forms = database.formCache();
@@ -195,49 +243,12 @@ Reply matchPlugIns(const Request& request, EkDServer& daemon) {
                        *match->form->error);
     }
 
-    // De-duplication against the matches accepted so far with the same identifier, earliest
-    // first; the index keeps this linear in the number of candidates.
-    const std::optional<std::string> identifier = plugIn->identifier();
-    const std::string* version = current->version ? current->version->string() : nullptr;
-    bool dropped = false;
-    auto sameIdentifier = accepted.find(identifier.value_or(""));
-    if (sameIdentifier != accepted.end()) {
-      std::vector<size_t>& positions = sameIdentifier->second;
-      for (auto position = positions.begin(); position != positions.end(); ++position) {
-        const Match& earlierMatch = *results[*position];
-        const EkDPlugIn& earlier = *earlierMatch.plugIn;
-        auto order = compareVersionString(
-            version, formVersion(earlierMatch.current->version).value_or(std::string_view()));
-        bool removeEarlier = false;
-        bool stop = true;
-        if (!(flags & protocol::kDiscoverKeepVersions)) {
-          if (order > 0) {
-            removeEarlier = true;
-          } else if (order < 0) {
-            dropped = true;
-          } else if (candidateWins(*plugIn, earlier)) {
-            removeEarlier = true;
-          } else {
-            dropped = true;
-          }
-        } else if (order != 0 || (flags & protocol::kDiscoverKeepDuplicates)) {
-          stop = false;
-        } else if (candidateWins(*plugIn, earlier)) {
-          removeEarlier = true;
-        } else {
-          dropped = true;
-        }
-        if (removeEarlier) {
-          results[*position] = nullptr;
-          positions.erase(position);
-        }
-        if (stop) break;
-      }
-    }
-    if (dropped) continue;
+    const DuplicateFilter::Verdict verdict = duplicates.admit(
+        {plugIn->identifier(), current->version, plugIn->onSystemVolume(), plugIn->lastModified()});
+    if (!verdict.kept) continue;
+    if (verdict.replaces) results[*verdict.replaces] = nullptr;
 
     plugIn->augmentForm(match->added, *current);
-    if (identifier) accepted[*identifier].push_back(results.size());
     results.push_back(match);
     if (auto replaces = plugIn->valueForEntitlement(protocol::kEntitlementReplacePlugIn)) {
       if (const std::string* name = replaces->string()) {

@@ -1,21 +1,16 @@
 #include "tests/EkdProcess.h"
 
 #include <fcntl.h>
-#include <poll.h>
 #include <signal.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <chrono>
 #include <cstdlib>
-#include <cstring>
 #include <fstream>
 #include <random>
-#include <sstream>
 #include <thread>
 
 #include "tests/RawClient.h"
@@ -28,20 +23,6 @@ std::string ekdPath() {
 }
 std::string ekctlPath() {
   return EKCTL_PATH;
-}
-std::string sandboxExecPath() {
-  return SANDBOX_EXEC_PATH;
-}
-
-TempDir::TempDir() {
-  std::string pattern = (fs::temp_directory_path() / "ekora-test-XXXXXX").string();
-  if (!mkdtemp(pattern.data())) std::abort();
-  path_ = pattern;
-}
-
-TempDir::~TempDir() {
-  std::error_code ignored;
-  fs::remove_all(path_, ignored);
 }
 
 namespace {
@@ -116,19 +97,13 @@ std::map<std::string, std::string> EkdProcess::environment() const {
           {"EKORA_SYSTEM_ROOT", (root_.path() / "System").string()}};
 }
 
-void EkdProcess::exportEnvironment() const {
-  for (const auto& [key, value] : environment()) setenv(key.c_str(), value.c_str(), 1);
-}
-
 std::string EkdProcess::socketPath() const {
   return (root_.path() / "run" / service_).string();
 }
 
 std::string EkdProcess::log() const {
   std::ifstream in(root_.path() / "ekd.log");
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
+  return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 bool EkdProcess::logShows(std::string_view text) const {
@@ -140,25 +115,6 @@ bool EkdProcess::logShows(std::string_view text) const {
 }
 
 bool EkdProcess::start() {
-  if (!startServing()) return false;
-  const Value status(Dictionary{{"request", Value("status")}, {"version", Value(uint64_t{3})}});
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
-  while (std::chrono::steady_clock::now() < deadline) {
-    auto reply = ask(status, std::chrono::seconds(5));
-    const Value* scanning = reply ? reply->get("scanning") : nullptr;
-    if (scanning && scanning->boolean() && !*scanning->boolean()) return true;
-    int code;
-    if (waitpid(pid_, &code, WNOHANG) == pid_) {
-      exitStatus_ = decodeStatus(code);
-      pid_ = -1;
-      return false;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  return false;
-}
-
-bool EkdProcess::startServing() {
   std::string logPath = (root_.path() / "ekd.log").string();
   pid_ = fork();
   if (pid_ == 0) {
@@ -179,22 +135,19 @@ bool EkdProcess::startServing() {
     execv(args[0], args.data());
     _exit(127);
   }
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  // Up once it answers and has registered the system volume.
+  const Value status(Dictionary{{"request", Value("status")}, {"version", Value(uint64_t{3})}});
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
   while (std::chrono::steady_clock::now() < deadline) {
-    int status;
-    if (waitpid(pid_, &status, WNOHANG) == pid_) {
-      exitStatus_ = decodeStatus(status);
+    int code;
+    if (waitpid(pid_, &code, WNOHANG) == pid_) {
+      exitStatus_ = decodeStatus(code);
       pid_ = -1;
       return false;
     }
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::string path = socketPath();
-    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-    bool connected = connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
-    close(fd);
-    if (connected) return true;
+    auto reply = ask(status, std::chrono::seconds(5));
+    const Value* scanning = reply ? reply->get("scanning") : nullptr;
+    if (scanning && scanning->boolean() && !*scanning->boolean()) return true;
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
   }
   return false;
@@ -205,34 +158,29 @@ bool EkdProcess::running() const {
 }
 
 int EkdProcess::terminate() {
-  if (pid_ <= 0) return exitStatus_;
-  ::kill(pid_, SIGTERM);
-  int status = 0;
-  waitpid(pid_, &status, 0);
-  pid_ = -1;
-  exitStatus_ = decodeStatus(status);
+  if (pid_ > 0) {
+    ::kill(pid_, SIGTERM);
+    int status = 0;
+    waitpid(pid_, &status, 0);
+    pid_ = -1;
+    exitStatus_ = decodeStatus(status);
+  }
   return exitStatus_;
 }
 
 void EkdProcess::kill9() {
-  if (pid_ <= 0) return;
-  ::kill(pid_, SIGKILL);
-  int status = 0;
-  waitpid(pid_, &status, 0);
-  pid_ = -1;
-  exitStatus_ = decodeStatus(status);
+  if (pid_ > 0) ::kill(pid_, SIGKILL);
+  terminate();
 }
 
 CommandResult EkdProcess::ekctl(std::vector<std::string> args, const std::string& input) const {
-  std::vector<std::string> argv{ekctlPath(), "-S", service_};
-  argv.insert(argv.end(), args.begin(), args.end());
-  return runCommand(argv, environment(), input);
+  args.insert(args.begin(), {ekctlPath(), "-S", service_});
+  return runCommand(args, environment(), input);
 }
 
 CommandResult EkdProcess::ekctlAs(const std::string& program, std::vector<std::string> args) const {
-  std::vector<std::string> argv{program, "-S", service_};
-  argv.insert(argv.end(), args.begin(), args.end());
-  return runCommand(argv, environment());
+  args.insert(args.begin(), {program, "-S", service_});
+  return runCommand(args, environment());
 }
 
 void EkdProcess::setEnvironment(const std::string& name, const std::string& value) {
@@ -255,13 +203,6 @@ uint64_t EkdProcess::notificationGeneration(std::string_view name) const {
   uint64_t generation = 0;
   if (!(in >> generation)) return 0;
   return generation;
-}
-
-std::string EkdProcess::annotationFile() const {
-  for (size_t i = 0; i + 1 < extraArgs_.size(); ++i) {
-    if (extraArgs_[i] == "-d") return extraArgs_[i + 1];
-  }
-  return (root_.path() / "state" / "Ekora-Annotations").string();
 }
 
 std::string ekctlWithEntitlements(const fs::path& dir,
@@ -289,15 +230,6 @@ int64_t replyErrorCode(const Value& reply) {
 std::string replyError(const Value& reply) {
   const std::string* text = reply.getString("error");
   return text ? *text : std::string();
-}
-
-long residentKiB(pid_t pid) {
-  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
-  }
-  return -1;
 }
 
 }  // namespace ek::test

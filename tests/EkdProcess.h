@@ -11,19 +11,15 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/testing/Files.h"
 #include "platform/value/Value.h"
 
 namespace ek::test {
 
 // A temporary directory removed with its contents on destruction.
-class TempDir {
+class TempDir : public ek::testing::TempDir {
  public:
-  TempDir();
-  ~TempDir();
-  const std::filesystem::path& path() const { return path_; }
-
- private:
-  std::filesystem::path path_;
+  std::filesystem::path path() const { return ek::testing::TempDir::path(); }
 };
 
 struct CommandResult {
@@ -46,8 +42,6 @@ class EkdProcess {
   // Starts ekd and waits until it answers and has registered the system volume; false (with
   // the log) when it did not.
   bool start();
-  // The same, returning as soon as the socket accepts: the system volume may still be read.
-  bool startServing();
   // Sends SIGTERM and answers the exit status (128 + signal when killed by one).
   int terminate();
   void kill9();
@@ -63,8 +57,6 @@ class EkdProcess {
   bool logShows(std::string_view text) const;
   // The environment every client of this daemon needs (EKORA_RUNTIME_DIR and friends).
   std::map<std::string, std::string> environment() const;
-  // Points this process's own EKORA_* variables at the daemon, for in-process clients.
-  void exportEnvironment() const;
 
   // Runs ekctl against this daemon.
   CommandResult ekctl(std::vector<std::string> args, const std::string& input = "") const;
@@ -81,8 +73,6 @@ class EkdProcess {
   // The last generation posted for a notification in this daemon's runtime directory (0 when
   // never posted).
   uint64_t notificationGeneration(std::string_view name) const;
-  // The annotation file: the argument of -d when given, else $EKORA_STATE_DIR/Ekora-Annotations.
-  std::string annotationFile() const;
 
   const TempDir& root() const { return root_; }
 
@@ -105,21 +95,8 @@ std::string ekctlWithEntitlements(const std::filesystem::path& dir,
 int64_t replyErrorCode(const Value& reply);
 std::string replyError(const Value& reply);
 
-// Whether the programs are built with a sanitizer. Its runtime keeps freed memory in quarantine
-// and needs descriptors of its own for its checks, so bounds on the daemon's memory and on
-// running out of descriptors cannot be judged then.
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-inline constexpr bool kSanitized = true;
-#else
-inline constexpr bool kSanitized = false;
-#endif
-
-// A process's resident memory in KiB, or -1 when it cannot be read.
-long residentKiB(pid_t pid);
-
 // The paths of the built programs.
 std::string ekdPath();
 std::string ekctlPath();
-std::string sandboxExecPath();
 
 }  // namespace ek::test

@@ -14,6 +14,8 @@ namespace ek::test {
 class RawClient {
  public:
   explicit RawClient(const std::string& socketPath);
+  // Takes over a connected socket.
+  explicit RawClient(int fd) : fd_(fd) {}
   ~RawClient();
   bool connected() const { return fd_ >= 0; }
   int fd() const { return fd_; }

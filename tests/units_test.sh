@@ -5,10 +5,6 @@
 # Usage: units_test.sh SOURCE_DIR EKD
 set -euo pipefail
 
-if [[ $# -ne 2 ]]; then
-  echo "usage: $0 SOURCE_DIR EKD" >&2
-  exit 2
-fi
 source=$1
 ekd=$2
 skip=77

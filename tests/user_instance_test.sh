@@ -1,16 +1,11 @@
 #!/usr/bin/env bash
-# Runs ekd as an ordinary user the way that user's service manager does (socket activation
-# on $XDG_RUNTIME_DIR/ekora/com.corvane.ekora.ekd) and reaches it with that user's ekctl
-# without options: ekctl must find the socket by the per-user default, with
-# XDG_RUNTIME_DIR set and, without it, in /tmp/ekora-<uid>.
+# Runs ekd as an ordinary user the way that user's service manager does (socket activation on
+# $XDG_RUNTIME_DIR/ekora/com.corvane.ekora.ekd) and reaches it with that user's ekctl without
+# options: ekctl must find the socket there, or in /tmp/ekora-<uid> without XDG_RUNTIME_DIR.
 #
 # Usage: user_instance_test.sh EKD EKCTL SOURCE_DIR
 set -euo pipefail
 
-if [[ $# -ne 3 ]]; then
-  echo "usage: $0 EKD EKCTL SOURCE_DIR" >&2
-  exit 2
-fi
 ekd=$1
 ekctl=$2
 source=$3
@@ -53,8 +48,7 @@ fail() {
   exit 1
 }
 
-# The user's own copies: the build tree need not be readable by that user, and a copy of
-# ekctl runs anywhere.
+# The user's own copies: the build tree need not be readable by that user.
 chmod 0755 "$scratch"
 install -m 0755 "$ekd" "$scratch/ekd"
 install -m 0755 "$ekctl" "$scratch/ekctl"
@@ -81,8 +75,7 @@ run_case() {
   # The user manager makes the socket's directory (DirectoryMode=0700) before listening.
   "${as_user[@]}" mkdir -p -m 0700 "$directory"
   : >"$scratch/ekd.log"
-  # systemd-socket-activate hands on only the variables it is told to, as a unit's
-  # environment would be given.
+  # systemd-socket-activate hands on only the variables it is told to, as a unit would.
   local passed=(-E HOME -E XDG_STATE_HOME -E EKORA_SYSTEM_ROOT)
   [[ -n $runtime ]] && passed+=(-E XDG_RUNTIME_DIR)
   "${as_user[@]}" systemd-socket-activate "${passed[@]}" -l "$socket" "$scratch/ekd" \
