@@ -27,32 +27,30 @@ TEST(FileConsent, OnlyBooleanTrueGrantsAndAnUnusableFileIsLoggedOncePerVersion) 
                                         {"com.example.other", Value(Dictionary{{"x", true}})}}))
         .value();
   };
-  const struct {
-    const char* name;
-    std::optional<std::string> bytes;  // absent: no file
-    std::optional<Services> granted;   // absent: nothing is known
-    int errors;                        // logged so far
-  } steps[] = {
-      {"missing", std::nullopt, Services{}, 0},
-      {"granted",
-       granting({{"b", true}, {"a", true}, {"no", false}, {"text", "true"}, {"number", 1}}),
-       Services{"a", "b"}, 0},
-      {"malformed", "<dmap version=\"1.0\"><dict><key>x</key></dmap>", std::nullopt, 1},
-      {"malformed, read again", std::nullopt, std::nullopt, 1},
-      {"replaced", granting({{"c", true}}), Services{"c"}, 1},
-      {"not a dictionary", dmap::write(Value(Array{})).value(), std::nullopt, 2},
-      {"oversized", granting({{"c", true}}) + std::string(kMaxConsentFileSize, ' '), std::nullopt,
-       3},
-      {"entry not a dictionary", dmap::write(Value(Dictionary{{"com.example.app", true}})).value(),
-       Services{}, 3},
-  };
-  for (const auto& step : steps) {
-    SCOPED_TRACE(step.name);
-    ASSERT_TRUE(!step.bytes || dmap::writeBytesAtomically(file, *step.bytes).ok());
-    EXPECT_EQ(consent.informationForApplication("com.example.app"), step.granted);
-    EXPECT_EQ(consent.grantedServices("com.example.app"), step.granted.value_or(Services{}));
+  // Name; the file's new bytes (absent: left as it is); the services granted (absent: nothing
+  // is known); errors logged so far.
+  const std::tuple<const char*, std::optional<std::string>, std::optional<Services>, int> steps[] =
+      {
+          {"missing", std::nullopt, Services{}, 0},
+          {"granted",
+           granting({{"b", true}, {"a", true}, {"no", false}, {"text", "true"}, {"number", 1}}),
+           Services{"a", "b"}, 0},
+          {"malformed", "<dmap version=\"1.0\"><dict><key>x</key></dmap>", std::nullopt, 1},
+          {"malformed, read again", std::nullopt, std::nullopt, 1},
+          {"replaced", granting({{"c", true}}), Services{"c"}, 1},
+          {"not a dictionary", dmap::write(Value(Array{})).value(), std::nullopt, 2},
+          {"oversized", granting({{"c", true}}) + std::string(kMaxConsentFileSize, ' '),
+           std::nullopt, 3},
+          {"entry not a dictionary",
+           dmap::write(Value(Dictionary{{"com.example.app", true}})).value(), Services{}, 3},
+      };
+  for (const auto& [name, bytes, granted, errors] : steps) {
+    SCOPED_TRACE(name);
+    ASSERT_TRUE(!bytes || dmap::writeBytesAtomically(file, *bytes).ok());
+    EXPECT_EQ(consent.informationForApplication("com.example.app"), granted);
+    EXPECT_EQ(consent.grantedServices("com.example.app"), granted.value_or(Services{}));
     EXPECT_EQ(sink->countIf([](const auto& line) { return line.level == log::Level::Error; }),
-              step.errors);
+              errors);
   }
   std::filesystem::remove(file);
   std::filesystem::create_directory(file);

@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -15,15 +16,14 @@ namespace {
 // installed its filter by then, since it only executes the program afterwards.
 AuditToken startSleep(bool sandboxed) {
   const std::string tool = EK_SANDBOX_EXEC_PATH, sleep = std::filesystem::canonical("/bin/sleep");
-  AuditToken token;
-  token.pid = fork();
-  if (token.pid == 0) {
+  const pid_t pid = fork();
+  if (pid == 0) {
     if (sandboxed) execl(tool.c_str(), tool.c_str(), sleep.c_str(), "30", nullptr);
     execl(sleep.c_str(), sleep.c_str(), "30", nullptr);
     _exit(127);
   }
-  for (int i = 0; i < 5000 && executablePathForPid(token.pid) != sleep; ++i) usleep(1000);
-  return token;
+  for (int i = 0; i < 5000 && executablePathForPid(pid) != sleep; ++i) usleep(1000);
+  return AuditToken::forWriter({pid, getuid(), getgid()});  // pinned by a pidfd
 }
 
 unsigned long seccompFilters(pid_t pid) {
@@ -42,16 +42,30 @@ TEST(SandboxCheck, OneFilterBeyondTheSystemsSandboxesAndAGoneProcessCountsAsSand
   EXPECT_EQ(seccompFilters(sandboxed.pid), seccompFilters(1) + 1);
   EXPECT_TRUE(check->isSandboxed(sandboxed));
   EXPECT_FALSE(check->isSandboxed(plain));
-  EXPECT_FALSE(check->isSandboxed(AuditToken::self()));
-  for (pid_t pid : {sandboxed.pid, plain.pid}) {
-    kill(pid, SIGKILL);
-    waitpid(pid, nullptr, 0);
-  }
-  AuditToken none;
+  for (pid_t pid : {sandboxed.pid, plain.pid}) kill(pid, SIGKILL);
+  // Fails closed: a process that has exited, reaped or not, or none at all, is sandboxed.
+  siginfo_t info{};
+  waitid(P_PID, id_t(plain.pid), &info, WEXITED | WNOWAIT);
+  EXPECT_TRUE(check->isSandboxed(plain));
+  for (pid_t pid : {sandboxed.pid, plain.pid}) waitpid(pid, nullptr, 0);
+  AuditToken unpinned;
   for (pid_t pid : {plain.pid, 0, -5}) {
-    none.pid = pid;
-    EXPECT_TRUE(check->isSandboxed(none)) << pid;
+    unpinned.pid = pid;
+    EXPECT_TRUE(check->isSandboxed(unpinned)) << pid;
   }
+}
+
+TEST(AuditToken, NamesThePeerOfASocket) {
+  int fds[2];
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
+  auto peer = AuditToken::forSocket(fds[0]);
+  ASSERT_TRUE(peer && peer->pidfd && peer->alive());
+  EXPECT_EQ(peer->pid, getpid());
+  EXPECT_EQ(peer->uid, geteuid());
+  EXPECT_FALSE(SandboxCheck::system()->isSandboxed(*peer));
+  close(fds[0]);
+  close(fds[1]);
+  for (int fd : {fds[0], -1}) EXPECT_FALSE(AuditToken::forSocket(fd));
 }
 
 }  // namespace
