@@ -73,13 +73,10 @@ TEST_F(CodeSigningFiles, OnlyATrustedDictionaryVouchesAndEachRefusalIsLoggedOnce
       {"group-writable program", file(entitlements_, 0644, 0775), false, 1},
       {"malformed", file("<dmap version=\"1.0\"><dict><key>a", 0644), false, 1},
       {"oversized", file(std::string(2 * 1024 * 1024, ' '), 0644), false, 1},
-      {"fifo",
-       [](const std::string& program) { mkfifo((program + ".entitlements").c_str(), 0644); }, false,
-       1},
-      {"symbolic link",
-       [&](const std::string& program) {
-         write(dir_.file("target"), entitlements_, 0644);
-         symlink(dir_.file("target").c_str(), (program + ".entitlements").c_str());
+      {"fifo", [](auto& program) { mkfifo((program + ".entitlements").c_str(), 0644); }, false, 1},
+      {"symbolic link",  // to the trusted file of the first case
+       [&](auto& program) {
+         symlink(dir_.file("plain.entitlements").c_str(), (program + ".entitlements").c_str());
        },
        false, 1},
   };

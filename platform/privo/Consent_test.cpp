@@ -3,8 +3,6 @@
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
-#include <filesystem>
-
 #include "platform/dmap/Dmap.h"
 #include "platform/log/testing/CapturingSink.h"
 #include "platform/testing/Files.h"
@@ -23,27 +21,24 @@ TEST(FileConsent, OnlyBooleanTrueGrantsAndAnUnusableFileIsLoggedOncePerVersion) 
   FileConsent consent;
   const std::string file = dir.file("consent.dmap");
   auto granting = [](const Dictionary& app) {
-    return dmap::write(Value(Dictionary{{"com.example.app", Value(app)},
-                                        {"com.example.other", Value(Dictionary{{"x", true}})}}))
-        .value();
+    return dmap::write(Value(Dictionary{{"com.example.app", Value(app)}})).value();
   };
   // Name; the file's new bytes (absent: left as it is); the services granted (absent: nothing
   // is known); errors logged so far.
-  const std::tuple<const char*, std::optional<std::string>, std::optional<Services>, int> steps[] =
-      {
-          {"missing", std::nullopt, Services{}, 0},
-          {"granted",
-           granting({{"b", true}, {"a", true}, {"no", false}, {"text", "true"}, {"number", 1}}),
-           Services{"a", "b"}, 0},
-          {"malformed", "<dmap version=\"1.0\"><dict><key>x</key></dmap>", std::nullopt, 1},
-          {"malformed, read again", std::nullopt, std::nullopt, 1},
-          {"replaced", granting({{"c", true}}), Services{"c"}, 1},
-          {"not a dictionary", dmap::write(Value(Array{})).value(), std::nullopt, 2},
-          {"oversized", granting({{"c", true}}) + std::string(kMaxConsentFileSize, ' '),
-           std::nullopt, 3},
-          {"entry not a dictionary",
-           dmap::write(Value(Dictionary{{"com.example.app", true}})).value(), Services{}, 3},
-      };
+  using Step = std::tuple<const char*, std::optional<std::string>, std::optional<Services>, int>;
+  const Step steps[] = {
+      {"missing", std::nullopt, Services{}, 0},
+      {"granted",
+       granting({{"b", true}, {"a", true}, {"no", false}, {"text", "true"}, {"number", 1}}),
+       Services{"a", "b"}, 0},
+      {"malformed", "<dmap version=\"1.0\"><dict><key>x</key></dmap>", std::nullopt, 1},
+      {"malformed, read again", std::nullopt, std::nullopt, 1},
+      {"replaced", granting({{"c", true}}), Services{"c"}, 1},
+      {"not a dictionary", dmap::write(Value(Array{})).value(), std::nullopt, 2},
+      {"oversized", granting({}) + std::string(kMaxConsentFileSize, ' '), std::nullopt, 3},
+      {"entry not a dictionary", dmap::write(Value(Dictionary{{"com.example.app", true}})).value(),
+       Services{}, 3},
+  };
   for (const auto& [name, bytes, granted, errors] : steps) {
     SCOPED_TRACE(name);
     ASSERT_TRUE(!bytes || dmap::writeBytesAtomically(file, *bytes).ok());
@@ -52,10 +47,6 @@ TEST(FileConsent, OnlyBooleanTrueGrantsAndAnUnusableFileIsLoggedOncePerVersion) 
     EXPECT_EQ(sink->countIf([](const auto& line) { return line.level == log::Level::Error; }),
               errors);
   }
-  std::filesystem::remove(file);
-  std::filesystem::create_directory(file);
-  EXPECT_EQ(consent.informationForApplication("com.example.app"), std::nullopt);
-  EXPECT_EQ(consent.path(), file);
   log::setSink(nullptr);
   unsetenv("EKORA_STATE_DIR");
 }

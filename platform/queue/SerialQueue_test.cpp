@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <future>
 #include <numeric>
 #include <thread>
 #include <vector>
@@ -26,11 +25,7 @@ TEST(SerialQueue, RunsBlocksOneAtATimeInTheOrderGiven) {
           seen[p].push_back(i);
           inside.fetch_sub(1);
         };
-        if (i % 5 == 0) {
-          queue->sync(block);
-        } else {
-          queue->async(block);
-        }
+        i % 5 == 0 ? queue->sync(block) : queue->async(block);
       }
     });
   }

@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 #include <signal.h>
-#include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -53,19 +52,6 @@ TEST(SandboxCheck, OneFilterBeyondTheSystemsSandboxesAndAGoneProcessCountsAsSand
     unpinned.pid = pid;
     EXPECT_TRUE(check->isSandboxed(unpinned)) << pid;
   }
-}
-
-TEST(AuditToken, NamesThePeerOfASocket) {
-  int fds[2];
-  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
-  auto peer = AuditToken::forSocket(fds[0]);
-  ASSERT_TRUE(peer && peer->pidfd && peer->alive());
-  EXPECT_EQ(peer->pid, getpid());
-  EXPECT_EQ(peer->uid, geteuid());
-  EXPECT_FALSE(SandboxCheck::system()->isSandboxed(*peer));
-  close(fds[0]);
-  close(fds[1]);
-  for (int fd : {fds[0], -1}) EXPECT_FALSE(AuditToken::forSocket(fd));
 }
 
 }  // namespace

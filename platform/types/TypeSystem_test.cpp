@@ -19,11 +19,10 @@ TEST(TypeSystem, TypeConformsToItselfAndEachAncestorOnceNearestFirst) {
   // public.data and public.content are reached through both public.image and public.xml.
   EXPECT_EQ(seen, (Types{"public.svg-image", "public.image", "public.xml", "public.data",
                          "public.content", "public.text", "public.item"}));
-  for (const std::string& ancestor : seen)
-    EXPECT_TRUE(types.conforms("public.svg-image", ancestor));
+  EXPECT_TRUE(types.conforms("public.svg-image", "public.text"));
   EXPECT_FALSE(types.conforms("public.image", "public.svg-image"));
-  EXPECT_TRUE(types.conforms("com.example.unknown", "com.example.unknown"));
-  EXPECT_FALSE(types.conforms("com.example.unknown", "public.item"));
+  EXPECT_TRUE(types.conforms("com.example.x", "com.example.x"));  // unknown, and nothing more
+  EXPECT_FALSE(types.conforms("com.example.x", "public.item"));
 }
 
 TEST(TypeSystem, FilesExtendTheHierarchyAndBadOnesOrCyclesAreLeftOut) {
@@ -38,7 +37,7 @@ TEST(TypeSystem, FilesExtendTheHierarchyAndBadOnesOrCyclesAreLeftOut) {
   write("bad-parent.dmap", Dictionary{{"com.example.b", Array{"public.data", 7}},
                                       {"com.example.c", Array{"public.data"}}});
   ASSERT_TRUE(testing::writeFile(dir.file("broken.dmap"), "<dmap version=\"1.0\"><dict>"));
-  // Sorted after camera.dmap, where public.png -> lossless made these two edges cycles.
+  // Read after camera.dmap: lossless -> public.png and self -> self would close cycles.
   write("cycles.dmap", Dictionary{{"com.example.lossless", Array{"public.png", "public.item"}},
                                   {"com.example.self", Array{"com.example.self"}}});
   auto types = TypeSystem::loadFrom(dir.path());
