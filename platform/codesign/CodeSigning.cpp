@@ -47,10 +47,11 @@ class FailedTask : public CodeSigningTask {
   EkError error_;
 };
 
-// Why a file may not vouch for a program; empty when it may.
-std::string untrustedReason(const struct stat& st, std::string_view what) {
+}  // namespace
+
+std::string untrustedReason(const struct stat& st, std::string_view what, uid_t self) {
   if (!S_ISREG(st.st_mode)) return fmt::format("the {} is not a regular file", what);
-  if (st.st_uid != 0 && st.st_uid != geteuid()) {
+  if (st.st_uid != 0 && st.st_uid != self) {
     return fmt::format("the {} is owned by uid {}", what, st.st_uid);
   }
   if ((st.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
@@ -58,6 +59,8 @@ std::string untrustedReason(const struct stat& st, std::string_view what) {
   }
   return {};
 }
+
+namespace {
 
 // What reading an entitlements file came to: the entitlements, or why there are none.
 // A refusal with an empty reason is a missing file, which is not worth a log line.
@@ -88,7 +91,8 @@ Result<std::string> readBounded(int fd, size_t limit) {
 }
 
 Outcome readEntitlements(const std::string& executable, const struct stat& executableStat) {
-  if (std::string reason = untrustedReason(executableStat, "executable"); !reason.empty()) {
+  if (std::string reason = untrustedReason(executableStat, "executable", geteuid());
+      !reason.empty()) {
     return refused(reason);
   }
   std::string path = executable + ".entitlements";
@@ -106,7 +110,7 @@ Outcome readEntitlements(const std::string& executable, const struct stat& execu
   if (fstat(fd.get(), &st) != 0) {
     return refused(fmt::format("reading {}: {}", path, std::strerror(errno)));
   }
-  if (std::string reason = untrustedReason(st, "entitlements file"); !reason.empty()) {
+  if (std::string reason = untrustedReason(st, "entitlements file", geteuid()); !reason.empty()) {
     return refused(reason);
   }
   if (static_cast<uint64_t>(st.st_size) > kMaxEntitlementsSize) {

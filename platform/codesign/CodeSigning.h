@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/stat.h>
+
 #include <map>
 #include <memory>
 #include <mutex>
@@ -52,6 +54,10 @@ class CodeSigning {
   // The real implementation over the file system.
   static std::shared_ptr<CodeSigning> system();
 };
+
+// Why a file with this status may not vouch for a program to a process running as user self
+// (the rule above); empty when it may.
+std::string untrustedReason(const struct stat& st, std::string_view what, uid_t self);
 
 // The SHA-256 of an executable file, in lower-case hex; absent when it cannot be read.
 std::optional<std::string> codeDirectoryHash(const std::string& executablePath);

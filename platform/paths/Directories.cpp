@@ -27,32 +27,40 @@ std::optional<std::string> absoluteFromEnvironment(const char* name) {
   return std::string(value);
 }
 
-std::string homeDirectory() {
+std::string homeDirectory(uid_t uid) {
   if (auto home = absoluteFromEnvironment("HOME")) return *home;
   std::vector<char> buffer(16384);
   struct passwd entry {};
   struct passwd* found = nullptr;
-  if (getpwuid_r(geteuid(), &entry, buffer.data(), buffer.size(), &found) == 0 && found &&
+  if (getpwuid_r(uid, &entry, buffer.data(), buffer.size(), &found) == 0 && found &&
       found->pw_dir && found->pw_dir[0] == '/') {
     return found->pw_dir;
   }
-  return fmt::format("/tmp/ekora-{}", geteuid());
+  return fmt::format("/tmp/ekora-{}", uid);
 }
 
 }  // namespace
 
-std::string runtimeDir() {
+std::string runtimeDir(uid_t uid) {
   if (auto dir = fromEnvironment("EKORA_RUNTIME_DIR")) return *dir;
-  if (geteuid() == 0) return "/run/ekora";
+  if (uid == 0) return "/run/ekora";
   if (auto dir = absoluteFromEnvironment("XDG_RUNTIME_DIR")) return join(*dir, "ekora");
-  return fmt::format("/tmp/ekora-{}", geteuid());
+  return fmt::format("/tmp/ekora-{}", uid);
+}
+
+std::string stateDir(uid_t uid) {
+  if (auto dir = fromEnvironment("EKORA_STATE_DIR")) return *dir;
+  if (uid == 0) return "/var/lib/ekora";
+  if (auto dir = absoluteFromEnvironment("XDG_STATE_HOME")) return join(*dir, "ekora");
+  return join(homeDirectory(uid), ".local/state/ekora");
+}
+
+std::string runtimeDir() {
+  return runtimeDir(geteuid());
 }
 
 std::string stateDir() {
-  if (auto dir = fromEnvironment("EKORA_STATE_DIR")) return *dir;
-  if (geteuid() == 0) return "/var/lib/ekora";
-  if (auto dir = absoluteFromEnvironment("XDG_STATE_HOME")) return join(*dir, "ekora");
-  return join(homeDirectory(), ".local/state/ekora");
+  return stateDir(geteuid());
 }
 
 std::string systemRoot() {

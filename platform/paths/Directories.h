@@ -13,6 +13,9 @@ namespace ek::paths {
 std::string runtimeDir();
 // EKORA_STATE_DIR, else /var/lib/ekora for root, $XDG_STATE_HOME/ekora or ~/.local/state/ekora.
 std::string stateDir();
+// The two above as they are for user uid; those ask for the effective user.
+std::string runtimeDir(uid_t uid);
+std::string stateDir(uid_t uid);
 // EKORA_SYSTEM_ROOT, else /usr/lib/ekora.
 std::string systemRoot();
 

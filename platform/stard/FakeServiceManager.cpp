@@ -3,6 +3,7 @@
 
 #include <algorithm>
 #include <cstdlib>
+#include <iterator>
 #include <utility>
 
 #include "platform/stard/ServiceManager.h"
@@ -30,38 +31,34 @@ void FakeServiceManager::removeExternalService(std::string_view bundleIdentifier
                                                std::shared_ptr<SerialQueue> queue,
                                                std::function<void(int)> answer) {
   if (!queue) std::abort();  // an answer with nowhere to go is a caller's broken invariant
-  auto post = [queue = std::move(queue), answer = std::move(answer)](int code) {
+  std::unique_lock lock(mutex_);
+  removals_.push_back(Removal{std::string(bundleIdentifier), std::string(version)});
+  auto it = answers_.find(bundleIdentifier);
+  std::function<void()> post = [queue = std::move(queue), answer = std::move(answer),
+                                code = it == answers_.end() ? kNoSuchProcess : it->second] {
     queue->async([answer, code] {
       if (answer) answer(code);
     });
   };
-  int code = kNoSuchProcess;
-  {
-    std::lock_guard lock(mutex_);
-    removals_.push_back(Removal{std::string(bundleIdentifier), std::string(version)});
-    if (auto it = answers_.find(bundleIdentifier); it != answers_.end()) code = it->second;
-    if (std::find(held_.begin(), held_.end(), bundleIdentifier) != held_.end()) {
-      heldAnswers_.push_back([post, code] { post(code); });
-      return;
-    }
+  if (std::find(held_.begin(), held_.end(), bundleIdentifier) != held_.end()) {
+    heldAnswers_.push_back(std::move(post));
+    return;
   }
-  post(code);
+  lock.unlock();
+  post();
 }
 
 Result<pid_t> FakeServiceManager::launch(pid_t, std::string_view, const std::vector<std::string>&) {
   return EkError::posix(ENOTSUP, "the fake service manager launches nothing");
 }
 
-std::vector<Instance> FakeServiceManager::instances(
-    const std::vector<std::string>& bundleIdentifiers) {
+std::vector<Instance> FakeServiceManager::instances(const std::vector<std::string>& identifiers) {
   std::lock_guard lock(mutex_);
   std::vector<Instance> result;
-  for (const Instance& instance : instances_) {
-    if (std::find(bundleIdentifiers.begin(), bundleIdentifiers.end(), instance.bundleIdentifier) !=
-        bundleIdentifiers.end()) {
-      result.push_back(instance);
-    }
-  }
+  std::copy_if(instances_.begin(), instances_.end(), std::back_inserter(result), [&](auto& one) {
+    return std::find(identifiers.begin(), identifiers.end(), one.bundleIdentifier) !=
+           identifiers.end();
+  });
   return result;
 }
 
