@@ -7,7 +7,6 @@
 #include <filesystem>
 #include <fstream>
 #include <iterator>
-#include <regex>
 #include <string>
 #include <vector>
 
@@ -113,28 +112,8 @@ TEST_F(EkDAnnotationStoreTest, UnusableFilesAreLoggedStartEmptyAndAreKeptAtTheFi
     EXPECT_TRUE(store->setAnnotation(elected(2), "com.example.one").ok());
     std::vector<fs::path> backups = backupsOf(file);
     ASSERT_EQ(backups.size(), 1u);
-    EXPECT_TRUE(std::regex_match(backups[0].filename().string(),
-                                 std::regex("Ekora-Annotations\\.bad-\\d{8}T\\d{6}Z")));
     EXPECT_EQ(readBytes(backups[0]), c.bytes);
   }
-}
-
-TEST_F(EkDAnnotationStoreTest, OpeningAFineOrMissingFileKeepsNothingAndRemovesTemporaries) {
-  const std::string fine = fileWith(fileOf({{"com.example.one", elected(1)}}));
-  testing::writeFile(fs::path(fine).parent_path() / ".Ekora-Annotations.Ab12Cd", "partial");
-  ::setenv("EKORA_STATE_DIR", dir_.file("state").c_str(), 1);
-  for (const std::optional<std::string>& file :
-       {std::optional(fine), std::optional<std::string>()}) {
-    auto store = EkDAnnotationStore::initWithDatabase(file);
-    ASSERT_NE(store, nullptr);
-    EXPECT_TRUE(store->setAnnotation(elected(2), "com.example.two").ok());
-    const std::string path = file.value_or(dir_.file("state/Ekora-Annotations"));
-    EXPECT_EQ(store->annotationsURL(), path);
-    EXPECT_TRUE(readBytes(path).find("com.example.two") != std::string::npos);
-    EXPECT_TRUE(backupsOf(path).empty());
-    EXPECT_FALSE(fs::exists(fs::path(path).parent_path() / ".Ekora-Annotations.Ab12Cd"));
-  }
-  EXPECT_TRUE(errors().empty());
 }
 
 TEST_F(EkDAnnotationStoreTest, EveryChangeMergesAndTheFileIsTheWholeTable) {

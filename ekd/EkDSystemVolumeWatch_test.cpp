@@ -2,11 +2,12 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <filesystem>
 #include <optional>
 #include <thread>
+
+#include "platform/testing/Files.h"
 
 namespace ek {
 namespace {
@@ -16,9 +17,6 @@ using namespace std::chrono_literals;
 class SystemVolumeWatchTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char pattern[] = "/tmp/ek-volume-XXXXXX";
-    ASSERT_TRUE(mkdtemp(pattern));
-    dir_ = pattern;
     guard_.emplace(context_.get_executor());
     thread_ = std::thread([this] { context_.run(); });
   }
@@ -27,7 +25,6 @@ class SystemVolumeWatchTest : public ::testing::Test {
     guard_.reset();
     context_.stop();
     thread_.join();
-    std::filesystem::remove_all(dir_);
   }
   void makeWatch(const std::string& directory) {
     auto made = EkDSystemVolumeWatch::make(context_, directory, 100ms, [this] { ++rescans_; });
@@ -44,7 +41,8 @@ class SystemVolumeWatchTest : public ::testing::Test {
     return rescans_;
   }
 
-  std::filesystem::path dir_;
+  testing::TempDir temp_;
+  std::filesystem::path dir_ = temp_.path();
   asio::io_context context_;
   std::optional<asio::executor_work_guard<asio::io_context::executor_type>> guard_;
   std::thread thread_;
