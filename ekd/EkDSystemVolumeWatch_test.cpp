@@ -31,10 +31,11 @@ class SystemVolumeWatchTest : public ::testing::Test {
     ASSERT_TRUE(made.ok()) << made.error().message;
     watch_ = std::move(made).value();
   }
-  // The rescans once they have stopped coming for half a second (at most fifty seconds).
-  int settledRescans() {
-    int last = -1;
-    for (int i = 0; i < 100 && rescans_ != last; ++i) {
+  // The rescans once at least `least` have come (waiting up to ten seconds) and then none
+  // for half a second (waiting up to fifty).
+  int settledRescans(int least) {
+    for (int i = 0; i < 1000 && rescans_ < least; ++i) std::this_thread::sleep_for(10ms);
+    for (int i = 0, last = -1; i < 100 && rescans_ != last; ++i) {
       last = rescans_;
       std::this_thread::sleep_for(500ms);
     }
@@ -53,21 +54,21 @@ class SystemVolumeWatchTest : public ::testing::Test {
 TEST_F(SystemVolumeWatchTest, ABurstOfBundlesIsOneRescanAndQuietIsNone) {
   makeWatch(dir_);
   EXPECT_TRUE(watch_->watching());
-  EXPECT_EQ(settledRescans(), 0);
+  EXPECT_EQ(settledRescans(0), 0);
   for (int i = 0; i < 20; ++i) {
     ASSERT_EQ(mkdir((dir_ / ("B" + std::to_string(i) + ".bundle")).c_str(), 0755), 0);
   }
-  EXPECT_EQ(settledRescans(), 1);
+  EXPECT_EQ(settledRescans(1), 1);
   std::filesystem::rename(dir_ / "B0.bundle", dir_ / "C.bundle");
   std::filesystem::remove(dir_ / "B1.bundle");
-  EXPECT_EQ(settledRescans(), 2);
+  EXPECT_EQ(settledRescans(2), 2);
 }
 
 TEST_F(SystemVolumeWatchTest, AMissingDirectoryStillRescansWhenAsked) {
   makeWatch((dir_ / "absent").string());
   EXPECT_FALSE(watch_->watching());
   watch_->requestRescan();
-  EXPECT_EQ(settledRescans(), 1);
+  EXPECT_EQ(settledRescans(1), 1);
 }
 
 }  // namespace
