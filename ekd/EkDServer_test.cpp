@@ -9,76 +9,42 @@
 #include <chrono>
 #include <filesystem>
 #include <future>
-#include <mutex>
 #include <thread>
-
-#include <fmt/format.h>
 
 #include "ekd/EkDPlugInHold.h"
 #include "ekd/EkDWyreClient.h"
-#include "platform/log/Log.h"
+#include "platform/cbor/Cbor.h"
+#include "platform/testing/Files.h"
 #include "platform/vantor/FakeRegistry.h"
 
 namespace ek {
 namespace {
 
 constexpr std::string_view kChange = "com.corvane.ekora.annotation-change";
+constexpr std::string_view kAutoElect = "com.corvane.developer.auto-elect-plugin";
+constexpr std::string_view kReplacePlugIn = "com.corvane.developer.replace-plugin";
 
-class CapturingSink : public log::Sink {
- public:
-  void write(const log::Record& record) override {
-    std::lock_guard lock(mutex_);
-    lines_.emplace_back(fmt_level(record.level) + std::string(record.message));
+template <typename Predicate>
+bool eventually(Predicate predicate) {
+  for (int i = 0; i < 1000 && !predicate(); ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
   }
-  // Lines containing needle.
-  size_t count(std::string_view needle) const {
-    std::lock_guard lock(mutex_);
-    size_t n = 0;
-    for (const auto& line : lines_) n += line.find(needle) != std::string::npos;
-    return n;
-  }
-  std::vector<std::string> lines() const {
-    std::lock_guard lock(mutex_);
-    return lines_;
-  }
-
- private:
-  static std::string fmt_level(log::Level level) {
-    return std::string(log::levelName(level)) + " ";
-  }
-  mutable std::mutex mutex_;
-  std::vector<std::string> lines_;
-};
+  return predicate();
+}
 
 class EkDServerTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char pattern[] = "/tmp/ekd-server-test-XXXXXX";
-    ASSERT_TRUE(mkdtemp(pattern));
-    dir_ = pattern;
-    setenv("EKORA_RUNTIME_DIR", dir_.c_str(), 1);
-    setenv("EKORA_STATE_DIR", dir_.c_str(), 1);
-    sink_ = std::make_shared<CapturingSink>();
-    log::setSink(sink_);
-    log::configure("debug");
-    registry_ = std::make_shared<vantor::FakeRegistry>();
-    serviceManager_ = std::make_shared<stard::FakeServiceManager>();
-    notifier_ = std::make_shared<notify::FakeNotifier>();
-    EkDPlatform platform;
-    platform.codeSigning = std::make_shared<FakeCodeSigning>();
-    platform.sandbox = std::make_shared<FakeSandboxCheck>();
-    platform.registry = registry_;
-    platform.serviceManager = serviceManager_;
-    platform.notifier = notifier_;
-    server_ = EkDServer::initForService("unit-server", std::nullopt, platform);
+    setenv("EKORA_RUNTIME_DIR", dir_.path().c_str(), 1);
+    setenv("EKORA_STATE_DIR", dir_.path().c_str(), 1);
+    server_ =
+        EkDServer::initForService("unit-server", std::nullopt,
+                                  {codeSigning_, sandbox_, registry_, serviceManager_, notifier_});
     ASSERT_TRUE(server_);
   }
   void TearDown() override {
     for (int fd : peers_) close(fd);
     server_->stop();
-    log::setSink(nullptr);
-    log::configure("default");
-    std::filesystem::remove_all(dir_);
   }
 
   std::shared_ptr<EkDWyreClient> connectClient() {
@@ -93,43 +59,78 @@ class EkDServerTest : public ::testing::Test {
         wyre::Connection::adopt(std::move(socket), std::move(*token)), server_);
   }
 
-  std::shared_ptr<EkDPlugIn> plugIn(const std::string& identifier,
-                                    std::optional<std::string> version = "7") {
+  // Installs a plug-in inside an application (so it passes the record's checks).
+  vantor::PlugInProxy install(const std::string& identifier, Dictionary entitlements = {}) {
     vantor::PlugInProxy proxy;
     proxy.uuid = Uuid::random();
-    proxy.identifier = identifier;
-    proxy.originalIdentifier = identifier;
+    proxy.identifier = proxy.originalIdentifier = identifier;
     proxy.path = "/Applications/Host.app/PlugIns/" + identifier + ".appex";
     proxy.url = vantor::fileUrlForPath(proxy.path);
     proxy.containingAppPath = "/Applications/Host.app";
     proxy.dataContainerPath = "/var/lib/ekora/containers/" + identifier;
-    Dictionary attributes{{"ZuExtensionPointIdentifier", Value("com.corvane.share")}};
+    proxy.entitlements = std::move(entitlements);
+    proxy.extensionPoint = "com.corvane.share";
+    const Dictionary attributes{{"ZuExtensionPointIdentifier", Value("com.corvane.share")}};
     proxy.info = Dictionary{
         {"QvBundleIdentifier", Value(identifier)},
         {"ZuExtension", Value(Dictionary{{"ZuExtensionPointIdentifier", Value("com.corvane.share")},
                                          {"ZuExtensionAttributes", Value(attributes)}})}};
-    if (version) proxy.info.emplace("QvBundleVersion", Value(*version));
     registry_->install(proxy);
-    proxies_.push_back(registry_->plugInByUuid(proxy.uuid));
-    auto record = server_->database().findPlugIn(proxy.uuid);
-    EXPECT_NE(record, nullptr) << sink_->lines().back();
+    return proxy;
+  }
+  std::shared_ptr<EkDPlugIn> plugIn(const std::string& identifier) {
+    auto record = database().findPlugIn(install(identifier).uuid);
+    EXPECT_NE(record, nullptr);
     return record;
   }
-
-  // Runs terminatePlugIns and waits for its completion.
-  void terminate(const std::vector<vantor::PlugInProxyPtr>& proxies) {
-    std::promise<void> completed;
-    server_->terminatePlugIns(proxies, [&] { completed.set_value(); });
-    ASSERT_EQ(completed.get_future().wait_for(std::chrono::seconds(30)), std::future_status::ready);
+  std::shared_ptr<EkDPlugInHold> hold(std::vector<std::shared_ptr<EkDPlugIn>> plugIns,
+                                      std::shared_ptr<EkDWyreClient> client) {
+    return EkDPlugInHold::initWithPlugIns(std::move(plugIns), std::move(client), serviceManager_);
   }
 
-  std::string dir_;
-  std::shared_ptr<CapturingSink> sink_;
-  std::shared_ptr<vantor::FakeRegistry> registry_;
-  std::shared_ptr<stard::FakeServiceManager> serviceManager_;
-  std::shared_ptr<notify::FakeNotifier> notifier_;
+  EkDatabase& database() { return server_->database(); }
+  std::string annotationPath() { return database().annotations().annotationsURL(); }
+  // The registry's notices, and the work they hand to the database's queue.
+  void drainRegistry() {
+    std::promise<void> drained;
+    registry_->queue()->async([&] { drained.set_value(); });
+    drained.get_future().wait();
+    database().databaseQueue()->sync([] {});
+  }
+  // Changes the store as another request would, on the database's queue.
+  void elect(const std::string& key, uint64_t election) {
+    database().databaseQueue()->sync([&] {
+      EXPECT_TRUE(database()
+                      .annotations()
+                      .setAnnotation(Dictionary{{"election", Value(election)}}, key)
+                      .ok());
+    });
+  }
+  std::optional<Value> storedElection(const std::string& key) {
+    std::optional<Value> election;
+    database().databaseQueue()->sync([&] {
+      auto annotation = database().annotations().annotationForIdentifier(key);
+      if (annotation && annotation->contains("election")) election = annotation->at("election");
+    });
+    return election;
+  }
+  std::vector<std::string> found(const Dictionary& query) {
+    std::vector<std::string> identifiers;
+    for (const auto& plugIn : database().findPlugIns(query).value_or(std::vector<EkDPlugInRef>{})) {
+      identifiers.push_back(plugIn->identifier().value_or(""));
+    }
+    std::sort(identifiers.begin(), identifiers.end());
+    return identifiers;
+  }
+
+  testing::TempDir dir_;
+  std::shared_ptr<FakeCodeSigning> codeSigning_ = std::make_shared<FakeCodeSigning>();
+  std::shared_ptr<FakeSandboxCheck> sandbox_ = std::make_shared<FakeSandboxCheck>();
+  std::shared_ptr<vantor::FakeRegistry> registry_ = std::make_shared<vantor::FakeRegistry>();
+  std::shared_ptr<stard::FakeServiceManager> serviceManager_ =
+      std::make_shared<stard::FakeServiceManager>();
+  std::shared_ptr<notify::FakeNotifier> notifier_ = std::make_shared<notify::FakeNotifier>();
   std::shared_ptr<EkDServer> server_;
-  std::vector<vantor::PlugInProxyPtr> proxies_;
   std::vector<int> peers_;
 };
 
@@ -137,139 +138,181 @@ TEST_F(EkDServerTest, HoldBlocksUntilEveryHoldOnThePlugInIsReleased) {
   auto client = connectClient();
   auto a = plugIn("com.example.a");
   auto b = plugIn("com.example.b");
-  auto first = EkDPlugInHold::initWithPlugIns({a, b}, client, serviceManager_);
-  auto second = EkDPlugInHold::initWithPlugIns({a}, client, serviceManager_);
+  auto first = hold({a, b}, client);
+  auto second = hold({a}, client);
   Uuid firstToken = first->uuid(), secondToken = second->uuid();
-  EXPECT_NE(firstToken, secondToken);
   EXPECT_EQ(serviceManager_->transactionCount(), 2);
   server_->addHold(std::move(first));
   server_->addHold(std::move(second));
   EXPECT_EQ(notifier_->count(kChange), 2u);
 
-  EXPECT_TRUE(server_->holdOnPlugIn(*a));
+  server_->unholdToken(Uuid::random());
+  EXPECT_EQ(notifier_->count(kChange), 2u);
   server_->unholdToken(firstToken);
   EXPECT_TRUE(server_->holdOnPlugIn(*a));
   EXPECT_FALSE(server_->holdOnPlugIn(*b));
   server_->unholdToken(secondToken);
   EXPECT_FALSE(server_->holdOnPlugIn(*a));
   EXPECT_EQ(notifier_->count(kChange), 4u);
-  EXPECT_EQ(sink_->count("at client's request"), 2u);
   // The list owned the holds: their keep-alive transactions are over.
   EXPECT_EQ(serviceManager_->transactionCount(), 0);
 }
 
-TEST_F(EkDServerTest, UnknownTokenChangesNothingAndPostsNothing) {
-  auto client = connectClient();
-  server_->addHold(
-      EkDPlugInHold::initWithPlugIns({plugIn("com.example.a")}, client, serviceManager_));
-  size_t posts = notifier_->count(kChange);
-  server_->unholdToken(Uuid::random());
-  EXPECT_EQ(server_->holdCount(), 1u);
-  EXPECT_EQ(notifier_->count(kChange), posts);
-  EXPECT_EQ(sink_->count("releasing plug-in hold"), 0u);
-}
-
-TEST_F(EkDServerTest, HoldPlacedAfterItsClientDiedIsDropped) {
-  // A hold request that passed its client's check before the client died must not outlive it.
-  auto dying = connectClient();
-  auto a = plugIn("com.example.a");
-  dying->dead();
-  size_t posts = notifier_->count(kChange);
-  server_->addHold(EkDPlugInHold::initWithPlugIns({a}, dying, serviceManager_));
-  EXPECT_EQ(server_->holdCount(), 0u);
-  EXPECT_FALSE(server_->holdOnPlugIn(*a));
-  EXPECT_EQ(notifier_->count(kChange), posts);
-}
-
-TEST_F(EkDServerTest, DeadClientReleasesOnlyItsOwnHoldsOnePostEach) {
+TEST_F(EkDServerTest, DeadClientReleasesOnlyItsOwnHoldsAndPlacesNoMore) {
   auto dying = connectClient();
   auto other = connectClient();
   auto a = plugIn("com.example.a");
-  server_->addHold(EkDPlugInHold::initWithPlugIns({a}, dying, serviceManager_));
-  server_->addHold(EkDPlugInHold::initWithPlugIns({a}, other, serviceManager_));
-  server_->addHold(EkDPlugInHold::initWithPlugIns({a}, dying, serviceManager_));
+  server_->addHold(hold({a}, dying));
+  server_->addHold(hold({a}, other));
+  server_->addHold(hold({a}, dying));
   size_t posts = notifier_->count(kChange);
   dying->dead();
   EXPECT_EQ(server_->holdCount(), 1u);
   EXPECT_EQ(notifier_->count(kChange), posts + 2);
-  EXPECT_EQ(sink_->count(fmt::format("for dead client pid {}", dying->pid())), 2u);
   EXPECT_TRUE(server_->holdOnPlugIn(*a));
-}
 
-TEST_F(EkDServerTest, HangingUpReleasesTheHoldsThroughTheConnection) {
-  auto client = connectClient();
-  server_->addHold(
-      EkDPlugInHold::initWithPlugIns({plugIn("com.example.a")}, client, serviceManager_));
-  close(peers_.back());
-  peers_.pop_back();
-  for (int i = 0; i < 1000 && server_->holdCount() != 0; ++i) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  EXPECT_EQ(server_->holdCount(), 0u);
-}
-
-TEST_F(EkDServerTest, StopReleasesEveryHoldAndPostsOnceEvenWhenEmpty) {
-  auto client = connectClient();
-  auto a = plugIn("com.example.a");
-  server_->addHold(EkDPlugInHold::initWithPlugIns({a}, client, serviceManager_));
-  server_->addHold(EkDPlugInHold::initWithPlugIns({a}, client, serviceManager_));
-  size_t posts = notifier_->count(kChange);
-  server_->stop();
-  EXPECT_EQ(server_->holdCount(), 0u);
-  EXPECT_EQ(notifier_->count(kChange), posts + 1);
-  EXPECT_EQ(sink_->count("because server is stopping"), 2u);
-  server_->stop();
+  // A hold request that passed its client's check before the client died must not outlive it.
+  auto b = plugIn("com.example.b");
+  server_->addHold(hold({b}, dying));
+  EXPECT_EQ(server_->holdCount(), 1u);
+  EXPECT_FALSE(server_->holdOnPlugIn(*b));
   EXPECT_EQ(notifier_->count(kChange), posts + 2);
 }
 
-TEST_F(EkDServerTest, TerminatingNothingStillCompletes) {
-  terminate({});
-  EXPECT_EQ(sink_->count("waiting for 0 termination replies"), 1u);
-  EXPECT_EQ(sink_->count("awaiting termination reply"), 0u);
-  EXPECT_EQ(sink_->count("sending termination reply"), 1u);
+TEST_F(EkDServerTest, HangingUpStopsWorkAndReleasesTheClientsHolds) {
+  auto client = connectClient();
+  server_->addHold(hold({plugIn("com.example.a")}, client));
+  EXPECT_TRUE(client->acceptWork());
+  close(peers_.back());
+  peers_.pop_back();
+  EXPECT_TRUE(eventually([&] { return !client->acceptWork() && server_->holdCount() == 0; }));
 }
 
-TEST_F(EkDServerTest, TerminationLogsEachAnswerAndCompletesAfterAll) {
-  plugIn("com.example.zero");
-  plugIn("com.example.none", std::nullopt);
-  plugIn("com.example.five");
-  serviceManager_->setRemovalAnswer("com.example.zero", 0);
-  serviceManager_->setRemovalAnswer("com.example.none", 3);
-  serviceManager_->setRemovalAnswer("com.example.five", 5);
-  terminate(proxies_);
-  EXPECT_EQ(sink_->count("info one or more plug-ins have been terminated for uuid="), 1u);
-  EXPECT_EQ(sink_->count("debug stard reported no plug-ins on record for uuid="), 1u);
-  EXPECT_EQ(sink_->count("error stard error attempting to terminate plug-ins: error=5"), 1u);
-  EXPECT_EQ(sink_->count("awaiting termination reply #"), 3u);
-  EXPECT_EQ(sink_->count("sending termination reply"), 1u);
-  // A plug-in without a version is named with "1".
-  auto removals = serviceManager_->removals();
-  ASSERT_EQ(removals.size(), 3u);
-  EXPECT_EQ(removals[0].version, "7");
-  EXPECT_EQ(removals[1].version, "1");
+// ---- The database -----------------------------------------------------------------------------
+
+using DatabaseTest = EkDServerTest;
+
+TEST_F(DatabaseTest, RecordsAreCachedByUuidAndPathAndPurgedPastTheLimit) {
+  EXPECT_EQ(database().findPlugIn(Uuid::random()), nullptr);
+  EXPECT_EQ(database().findPlugInAtPath("file:///nowhere/X.appex"), nullptr);
+  std::vector<vantor::PlugInProxy> proxies;
+  for (int i = 0; i < 4; ++i) proxies.push_back(install("com.example.p" + std::to_string(i)));
+  auto first = database().findPlugIn(proxies[0].uuid);
+  ASSERT_NE(first, nullptr);
+  EXPECT_EQ(database().findPlugIn(proxies[0].uuid), first);
+  EXPECT_EQ(database().findPlugInAtPath(proxies[0].url + "/"), first);
+  EXPECT_EQ(database().findPlugInAtPath(proxies[0].path), first);
+
+  database().setCacheLimit(2);
+  for (int i = 1; i < 3; ++i) ASSERT_NE(database().findPlugIn(proxies[i].uuid), nullptr);
+  EXPECT_EQ(database().cacheCount(), 3u);  // 2 is not greater than 2 when the third went in
+  EXPECT_EQ(registry_->clearCachesCount(), 0);
+  auto fourth = database().findPlugIn(proxies[3].uuid);
+  EXPECT_EQ(database().cacheCount(), 1u);
+  EXPECT_EQ(registry_->clearCachesCount(), 1);
+  EXPECT_EQ(database().findPlugIn(proxies[3].uuid), fourth);
+
+  registry_->changeLocale();
+  drainRegistry();
+  EXPECT_EQ(database().cacheCount(), 0u);
+  EXPECT_EQ(registry_->clearCachesCount(), 2);
 }
 
-TEST_F(EkDServerTest, TerminationWaitsForAnOutstandingAnswer) {
-  plugIn("com.example.slow");
-  serviceManager_->holdAnswers("com.example.slow");
-  std::promise<void> completed;
-  auto future = completed.get_future();
-  server_->terminatePlugIns(proxies_, [&] { completed.set_value(); });
-  EXPECT_EQ(future.wait_for(std::chrono::milliseconds(200)), std::future_status::timeout);
-  serviceManager_->releaseHeldAnswers();
-  EXPECT_EQ(future.wait_for(std::chrono::seconds(30)), std::future_status::ready);
+TEST_F(DatabaseTest, UninstallDropsTheCachedRecordAndEndsItsInstances) {
+  auto a = install("com.example.a");
+  database().findPlugIn(a.uuid);
+  drainRegistry();
+  EXPECT_EQ(database().cacheCount(), 1u);  // an install notice leaves the cache alone
+  ASSERT_TRUE(registry_->uninstall(a.uuid));
+  drainRegistry();
+  EXPECT_EQ(database().cacheCount(), 0u);
+  EXPECT_TRUE(eventually([&] { return serviceManager_->removals().size() == 1; }));
+  EXPECT_EQ(serviceManager_->removals()[0].bundleIdentifier, "com.example.a");
 }
 
-TEST_F(EkDServerTest, UninstallEndsThePlugInsInstances) {
-  auto a = plugIn("com.example.a");
-  registry_->uninstall(a->uuid());
-  for (int i = 0; i < 1000 && sink_->count("removal complete for") == 0; ++i) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  auto removals = serviceManager_->removals();
-  ASSERT_EQ(removals.size(), 1u);
-  EXPECT_EQ(removals[0].bundleIdentifier, "com.example.a");
-  EXPECT_EQ(sink_->count("removal complete for"), 1u);
+TEST_F(DatabaseTest, AutoElectionElectsOnlyWithoutAChoice) {
+  const Dictionary autoElect{{std::string(kAutoElect), Value(true)}};
+  const auto proxies = {install("com.example.fresh", autoElect),
+                        install("com.example.two", autoElect),
+                        install("com.example.zero", autoElect),
+                        install("com.example.off", {{std::string(kAutoElect), Value(false)}})};
+  elect("com.example.two", 2);
+  elect("com.example.zero", 0);
+  for (const auto& proxy : proxies) ASSERT_NE(database().findPlugIn(proxy.uuid), nullptr);
+  EXPECT_EQ(storedElection("com.example.fresh"), Value(uint64_t{1}));
+  EXPECT_EQ(storedElection("com.example.two"), Value(uint64_t{2}));
+  EXPECT_EQ(storedElection("com.example.zero"), Value(uint64_t{1}));
+  EXPECT_EQ(storedElection("com.example.off"), std::nullopt);
+  EXPECT_EQ(notifier_->posts().size(), 0u);  // auto-election posts nothing
+}
+
+TEST_F(DatabaseTest, QueryElectionFilterUsesStoredElectionsAutoElectAndReplacement) {
+  EXPECT_EQ(database().findPlugIns({}), std::nullopt);
+  install("com.example.elected");
+  install("com.example.none");
+  install("com.example.wide");
+  install("com.example.auto", {{std::string(kAutoElect), Value(uint64_t{1})}});
+  install("com.example.replacement", {{std::string(kReplacePlugIn), Value("com.example.elected")}});
+  elect("com.example.elected", 1);
+  elect("com.example.wide", 257);  // only the low 8 bits take part: 257 counts as 1
+  const Dictionary elected{{"ZuExtensionPointIdentifier", Value("com.corvane.share")},
+                           {"ZuUserElection", Value("=1")}};
+  const Dictionary unelected{{"ZuUserElection", Value("0")}};
+  EXPECT_EQ(found(elected),
+            (std::vector<std::string>{"com.example.auto", "com.example.elected",
+                                      "com.example.replacement", "com.example.wide"}));
+  EXPECT_EQ(found(unelected), (std::vector<std::string>{"com.example.none"}));
+  EXPECT_EQ(found({{"ZuUserElection", Value(Array{Value("1"), Value("<2")})}}).size(), 5u);
+  EXPECT_EQ(database().findPlugIns({{"ZuUserElection", Value("01")}}), std::nullopt);
+
+  // Every record is cached now; the filter still reads the elections as they are.
+  elect("com.example.none", 1);
+  elect("com.example.auto", 0);
+  EXPECT_EQ(found(elected),
+            (std::vector<std::string>{"com.example.elected", "com.example.none",
+                                      "com.example.replacement", "com.example.wide"}));
+  EXPECT_EQ(found(unelected), (std::vector<std::string>{"com.example.auto"}));
+}
+
+TEST_F(DatabaseTest, EncodedAnnotationsFollowEveryChangeOfTheStore) {
+  auto original = database().findPlugIn(install("com.example.shared").uuid);
+  // Files its annotations under the identifier it replaces: one entry for both records.
+  auto replacement = database().findPlugIn(
+      install("com.example.replacement", {{std::string(kReplacePlugIn), "com.example.shared"}})
+          .uuid);
+  auto other = database().findPlugIn(install("com.example.other").uuid);
+  ASSERT_TRUE(original && replacement && other);
+  const std::vector<const EkDPlugIn*> records = {original.get(), replacement.get(), other.get()};
+  auto annotations = [&] {
+    std::vector<Dictionary> decoded;
+    for (const auto& encoded : database().encodedAnnotationsForPlugIns(records)) {
+      Result<Value> value = cbor::decode(encoded.span());
+      decoded.push_back(value.ok() && value->dictionary() ? *value->dictionary()
+                                                          : Dictionary{{"undecodable", true}});
+    }
+    return decoded;
+  };
+  const Dictionary none;
+  const Dictionary one{{"election", Value(uint64_t{1})}};
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, none}));
+  // Through either record.
+  EXPECT_TRUE(database().setAnnotation(one, *replacement).ok());
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{one, one, none}));
+  EXPECT_EQ(notifier_->count("com.corvane.ekora.annotation-change"), 0u);
+  EXPECT_TRUE(database().setAnnotation(std::nullopt, *original).ok());
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, none}));
+  elect("com.example.shared", 1);  // straight through the store
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{one, one, none}));
+  // Changes whose save fails are undone, and so is what the records noted of them meanwhile.
+  std::filesystem::remove(annotationPath());
+  std::filesystem::create_directories(annotationPath() + "/in-the-way");
+  const Dictionary seven{{"election", Value(uint64_t{7})}};
+  database().beginAnnotationChanges();
+  EXPECT_TRUE(database().setAnnotation(seven, *other).ok());
+  EXPECT_TRUE(database().setAnnotation(std::nullopt, *original).ok());
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{none, none, seven}));
+  EXPECT_FALSE(database().commitAnnotationChanges().ok());
+  EXPECT_EQ(annotations(), (std::vector<Dictionary>{one, one, none}));
 }
 
 }  // namespace
