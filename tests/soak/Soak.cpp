@@ -3,12 +3,12 @@
 //
 //   ekora_soak [--duration SECONDS] [--seed N]
 //
-// ekbench sends every request type from 32 connections while a chaos driver kills clients in
-// the middle of requests (holding Notes, with a service declared, with replies unread),
-// installs and uninstalls bundles, sends malformed frames, keeps a connection that never reads
-// its replies, and kills ekd with SIGKILL a few times. An annotator writes increasing counters to
-// a few plug-ins throughout. After the last kill the run warms up, records ekd's RSS and
-// descriptors with no client connected, runs the rest of the traffic and records them again.
+// ekbench sends every request type from 32 connections (adding and removing a bundle among
+// them) while a chaos driver kills hostile clients in the middle of requests (holding Notes, with
+// a service declared, replies unread, a malformed frame sent), keeps a connection that never
+// reads its replies, and kills ekd with SIGKILL a few times. An annotator writes increasing
+// counters to a few plug-ins throughout. After the last kill the run warms up, records ekd's RSS
+// and descriptors with no client connected, runs the rest of the traffic and records them again.
 // The duration (default 600 s, or $EKORA_SOAK_SECONDS) is the traffic time.
 //
 // Run as `ekora_soak --client SOCKET PATH UUID` it is one of the clients the chaos driver kills.
@@ -34,7 +34,6 @@
 #include <sstream>
 #include <thread>
 
-#include "platform/cbor/Cbor.h"
 #include "platform/dmap/Dmap.h"
 #include "platform/json/WireJson.h"
 #include "platform/wyre/Wyre.h"
@@ -83,15 +82,13 @@ void writeDmap(const fs::path& path, const Dictionary& dictionary) {
   if (!dmap::writeFileAtomically(path.string(), Value(dictionary), 0644).ok()) std::abort();
 }
 
-// An application bundle with two plug-ins on the share point.
+// An application bundle with a plug-in on the share point.
 void writeApp(const fs::path& bundle, const std::string& identifier) {
   writeDmap(bundle / "Info.dmap", {{"QvBundleIdentifier", identifier}});
-  for (const std::string plugIn : {"One", "Two"}) {
-    writeDmap(bundle / "PlugIns" / (plugIn + ".appex/Info.dmap"),
-              {{"QvBundleIdentifier", identifier + "." + plugIn},
-               {"ZuExtension", Dictionary{{"ZuExtensionPointIdentifier", "com.corvane.share"},
-                                          {"ZuExtensionAttributes", Dictionary{}}}}});
-  }
+  writeDmap(bundle / "PlugIns/One.appex/Info.dmap",
+            {{"QvBundleIdentifier", identifier + ".one"},
+             {"ZuExtension", Dictionary{{"ZuExtensionPointIdentifier", "com.corvane.share"},
+                                        {"ZuExtensionAttributes", Dictionary{}}}}});
 }
 
 Value uuids(std::initializer_list<Uuid> list) {
@@ -153,78 +150,144 @@ class Child {
 };
 
 // The daemon, the world its traffic runs on, and the problems found by any thread.
-struct Soak {
-  test::EkdProcess daemon;
-  fs::path root;  // canonical root of the daemon's directories
-  std::string notes, churn, ekctl, ekbench, requests;
-  std::vector<Uuid> bench;               // by index i: System/Library/PlugIns/P<i>.bundle
-  Uuid viewerShare, thumbs, notesShare;  // Notes is held by the killed clients
-  std::mt19937_64 random;
-  std::atomic<unsigned> outputs{0};
-  std::mutex mutex;
-  std::vector<std::string> problems;
 
+// The daemon, the world its traffic runs on, the threads of the traffic (annotator and chaos
+// driver) and the problems any of them found.
+class Soak {
+ public:
+  int run(double duration, uint64_t seed);
+
+ private:
   void problem(const std::string& what) {
-    std::lock_guard lock(mutex);
-    problems.push_back(what);
+    std::lock_guard lock(mutex_);
+    problems_.push_back(what);
   }
   bool failed() {
-    std::lock_guard lock(mutex);
-    return !problems.empty();
+    std::lock_guard lock(mutex_);
+    return !problems_.empty();
   }
-  fs::path output() { return root / fmt::format("out-{}", outputs++); }
-  std::optional<Value> ask(const Value& message) const { return daemon.ask(message, kTimeout); }
-  bool setUp();
-  std::optional<Uuid> uuidOf(const std::string& path);
-  void finishBench(Child& bench, double duration);
-  void checkFiles(const std::string& when);
-  void checkListed(const std::string& when);
-  int run(double duration);
-};
+  std::optional<Value> ask(const Value& message) const { return daemon_.ask(message, kTimeout); }
+  fs::path output() { return root_ / fmt::format("out-{}", outputs_++); }
 
-// Writes increasing counters ("extension" {"soak": n}) to its plug-ins over one connection and
-// records every value sent and the last one acknowledged for each plug-in.
-class Annotator {
- public:
-  explicit Annotator(Soak& soak) : soak_(soak) {}
-  void start() {
-    stop_ = false;
-    thread_ = std::thread([this] { run(); });
+  std::optional<Uuid> uuidOf(const std::string& path) {
+    auto reply = ask(request("find", {{"paths", Value("file://" + path)}}));
+    const Value* form = reply ? reply->get("matches") : nullptr;
+    const std::string* uuid = form ? form->getString("uuid") : nullptr;
+    if (!uuid) problem("no plug-in found at " + path);
+    return uuid ? Uuid::parse(*uuid) : std::nullopt;
   }
-  void stop() {
-    stop_ = true;
-    if (thread_.joinable()) thread_.join();
-  }
-  uint64_t acknowledged() const { return acknowledged_; }
 
-  // Each counter stored is one that was sent and no older than the last acknowledged: exactly
-  // that one when nothing was left unanswered.
-  void verify(const std::string& when, bool exact) {
-    for (unsigned i = 0; i < kAnnotated; ++i) {
-      auto reply = soak_.ask(request("find", {{"uuids", Value(soak_.bench[i])}}));
-      const Value* form = reply ? reply->get("matches") : nullptr;
-      const Value* annotations = form ? form->get("annotations") : nullptr;
-      const Value* extension = annotations ? annotations->get("extension") : nullptr;
-      const uint64_t* stored = extension ? extension->getUnsigned("soak") : nullptr;
-      if (stored
-              ? !sent_[i].count(*stored) || *stored < acked_[i] || (exact && *stored != acked_[i])
-              : acked_[i] != 0) {
-        soak_.problem(fmt::format("{}: P{} holds {}, last acknowledged {}", when, i,
-                                  stored ? *stored : 0, acked_[i]));
-      }
+  bool setUp() {
+    root_ = fs::canonical(daemon_.root().path());
+    daemon_.setEnvironment("EKORA_LOG", "default");
+    daemon_.exportEnvironment();  // for every child started later
+    auto fixture = test::runCommand({BENCH_FIXTURE_PATH, "plugins", "--system-root",
+                                     (root_ / "System").string(), "--count",
+                                     std::to_string(kBenchPlugIns), "--points", "4"});
+    fs::create_directories(root_ / "Applications");
+    for (const char* app : {"Viewer.app", "Notes.app"}) {
+      fs::copy(fs::path(EXAMPLES_DIR) / "Applications" / app, root_ / "Applications" / app,
+               fs::copy_options::recursive);
+    }
+    const std::string viewer = (root_ / "Applications/Viewer.app").string();
+    const std::string churn = (root_ / "Applications/Churn.app").string();
+    notes_ = (root_ / "Applications/Notes.app").string();
+    writeApp(churn, "com.test.soak.churn");
+    // ekbench's removals are served only with the manager's entitlement.
+    ekbench_ = (root_ / "ekbench").string();
+    fs::copy_file(EKBENCH_PATH, ekbench_);
+    writeDmap(ekbench_ + ".entitlements", {{kManager, true}});
+    if (fixture.status != 0 || !daemon_.start()) {
+      problem("set-up failed: " + fixture.err + daemon_.log());
+      return false;
+    }
+    if (!ask(request("add", {{"paths", Array{viewer, notes_, churn}}}))) problem("add failed");
+    for (unsigned i = 0; i < kBenchPlugIns; ++i) {
+      auto uuid = uuidOf(fmt::format("{}/System/Library/PlugIns/P{}.bundle", root_.string(), i));
+      bench_.push_back(uuid.value_or(Uuid()));
+    }
+    viewerShare_ = uuidOf(viewer + "/PlugIns/Share.appex").value_or(Uuid());
+    thumbs_ = uuidOf(viewer + "/PlugIns/Thumbs.appex").value_or(Uuid());
+    notesShare_ = uuidOf(notes_ + "/PlugIns/Share.appex").value_or(Uuid());
+
+    // The request lines ekbench cycles through: every request type, weighted towards the common
+    // ones. No hold outlives its request and nothing touches the annotator's plug-ins.
+    std::vector<Value> lines{request("add", {{"paths", Array{churn}}}),
+                             request("remove", {{"paths", Array{churn}}}), request("match")};
+    for (unsigned i = 0; i < 24; ++i) {
+      const Uuid a = bench_[kAnnotated + i], b = bench_[kAnnotated + 100 + i];
+      const std::string point = fmt::format("com.corvane.bench.point{}", 1 + i % 3);
+      lines.push_back(request("find", {{"uuids", a}}));
+      lines.push_back(
+          request("match", {{"rules", Dictionary{{"ZuExtensionPointIdentifier", point}}}}));
+      if (i % 3) continue;
+      lines.push_back(request("annotate", {{"annotations", Dictionary{{"election", i % 2}}},
+                                           {"uuids", uuids({a, b})}}));
+      lines.push_back(request("bulk-annotate",
+                              {{"annotations", Dictionary{{b.string(), Dictionary{{"n", i}}}}}}));
+      lines.push_back(request("ready", {{"uuids", uuids({viewerShare_, a})}}));
+      lines.push_back(request("access", {{"uuids", uuids({thumbs_, b})}}));
+      lines.push_back(request("bulk", {{"flags", uint64_t{0}}}));
+      lines.push_back(request("lock", {{"uuids", uuids({Uuid::random()})}}));
+    }
+    std::shuffle(lines.begin(), lines.end(), random_);
+    requests_ = (root_ / "requests.jsonl").string();
+    std::ofstream out(requests_);
+    for (const Value& line : lines) out << wirejson::write(line) << "\n";
+    return out.flush() && !failed();
+  }
+
+  std::unique_ptr<Child> startBench(double seconds) {
+    return std::make_unique<Child>(
+        std::vector<std::string>{ekbench_, "-S", daemon_.service(), "--connections", "32",
+                                 "--duration", fmt::format("{:.3f}", seconds), "--warmup", "0",
+                                 "--timeout", "30", "--requests", requests_, "--json"},
+        output());
+  }
+
+  // No client is lost while ekd runs: ekbench ends in time with every request answered.
+  void finishBench(Child& bench, double duration) {
+    auto status = bench.wait(milliseconds(static_cast<int64_t>(duration * 1000)) + seconds(90));
+    auto report = nlohmann::json::parse(bench.output(), nullptr, false);
+    if (!status || report.is_discarded() || !report.contains("daemon")) {
+      return problem("ekbench ended without a report: " + bench.output());
+    }
+    if (*status != 0 || report["daemon"].value("requests", 0) == 0 ||
+        report["daemon"].value("failures", 0) != 0) {
+      problem(
+          fmt::format("ekbench (status {}) lost clients: {}", *status, report["daemon"].dump()));
     }
   }
 
- private:
-  void run() {
+  void startTraffic() {
+    stop_ = stopChaos_ = false;
+    rounds_ = 0;
+    annotator_ = std::thread([this] { annotate(); });
+    chaos_ = std::thread([this] { chaos(); });
+  }
+  // Stops the chaos driver after its current action, with wholeRound not before it ran once, and
+  // then the annotator when asked to.
+  void stopTraffic(bool wholeRound, bool annotator) {
+    for (auto end = Clock::now() + seconds(120); wholeRound && !rounds_ && Clock::now() < end;) {
+      sleepMs(50);
+    }
+    stopChaos_ = true;
+    if (chaos_.joinable()) chaos_.join();
+    stop_ = annotator;
+    if (annotator) annotator_.join();
+  }
+
+  // Writes increasing counters ("extension" {"soak": n}) to its plug-ins over one connection and
+  // records every value sent and the last one acknowledged for each plug-in.
+  void annotate() {
     std::unique_ptr<test::RawClient> client;
-    for (uint64_t id = 1; !stop_; ++id) {
-      if (!client) client = std::make_unique<test::RawClient>(soak_.daemon.socketPath());
+    for (uint64_t id = ++lastId_; !stop_; id = ++lastId_) {
+      if (!client) client = std::make_unique<test::RawClient>(daemon_.socketPath());
       const unsigned i = id % kAnnotated;
       sent_[i].insert(id);
       const Value body =
           request("annotate", {{"annotations", Dictionary{{"extension", Dictionary{{"soak", id}}}}},
-                               {"uuids", uuids({soak_.bench[i]})}});
+                               {"uuids", uuids({bench_[i]})}});
       auto reply = client->sendMessage(body, id) ? client->readFrame(kTimeout) : std::nullopt;
       if (reply && reply->id == id && test::replyErrorCode(reply->body) == 0) {
         acked_[i] = id;
@@ -236,129 +299,54 @@ class Annotator {
     }
   }
 
-  Soak& soak_;
-  std::set<uint64_t> sent_[kAnnotated];
-  uint64_t acked_[kAnnotated] = {};
-  std::atomic<uint64_t> acknowledged_{0};
-  std::atomic<bool> stop_{false};
-  std::thread thread_;
-};
-
-// Kills clients in the middle of their requests, installs and uninstalls bundles, sends
-// malformed frames and keeps a connection that never reads its replies.
-class Chaos {
- public:
-  explicit Chaos(Soak& soak) : soak_(soak), random_(soak.random()) {}
-  void start() {
-    stop_ = false;
-    rounds_ = 0;
-    thread_ = std::thread([this] { run(); });
-  }
-  // Stops after the current action; with wholeRound not before every action ran once.
-  void stop(bool wholeRound = false) {
-    for (auto end = Clock::now() + seconds(120); wholeRound && !rounds_ && Clock::now() < end;) {
-      sleepMs(50);
-    }
-    stop_ = true;
-    if (thread_.joinable()) thread_.join();
-  }
-  void uninstallAll() {
-    while (!installed_.empty()) uninstallOldest();
-  }
-  std::vector<pid_t> deadHosts;  // the killed clients that may have declared a service
-
- private:
-  void run() {
-    for (unsigned action = 0; !stop_; ++action) {
-      topUpNonReader();
-      switch (action % 4) {
-        case 0:
-          killedClient();
-          break;
-        case 1:
-          killedEkctl();
-          break;
-        case 2:
-          install();
-          break;
-        default:
-          garbage();
-          ++rounds_;
+  // Each counter stored is one that was sent and no older than the last acknowledged: exactly
+  // that one when nothing was left unanswered.
+  void verifyAnnotations(const std::string& when, bool exact) {
+    for (unsigned i = 0; i < kAnnotated; ++i) {
+      auto reply = ask(request("find", {{"uuids", Value(bench_[i])}}));
+      const Value* form = reply ? reply->get("matches") : nullptr;
+      const Value* annotations = form ? form->get("annotations") : nullptr;
+      const Value* extension = annotations ? annotations->get("extension") : nullptr;
+      const uint64_t* stored = extension ? extension->getUnsigned("soak") : nullptr;
+      if (stored
+              ? !sent_[i].count(*stored) || *stored < acked_[i] || (exact && *stored != acked_[i])
+              : acked_[i] != 0) {
+        problem(fmt::format("{}: P{} holds {}, last acknowledged {}", when, i, stored ? *stored : 0,
+                            acked_[i]));
       }
-      if (installed_.size() > 2) uninstallOldest();
-      sleepMs(std::uniform_int_distribution<int>(20, 150)(random_));
+    }
+  }
+
+  void chaos() {
+    while (!stopChaos_) {
+      killedClient();
+      topUpNonReader();
+      sleepMs(std::uniform_int_distribution<int>(20, 150)(chaosRandom_));
+      ++rounds_;
     }
     if (nonReader_ >= 0) ::close(nonReader_);
     nonReader_ = -1;
   }
 
-  // Holds Notes, declares Viewer's share service, sends a burst and is killed before it reads
-  // the replies.
+  // A client that holds Notes, declares Viewer's share service, sends a burst of requests and is
+  // killed before it reads their replies.
   void killedClient() {
-    Child child({fs::read_symlink("/proc/self/exe"), "--client", soak_.daemon.socketPath(),
-                 soak_.notes, soak_.viewerShare.string()},
-                soak_.output());
-    if (!child.printed("ready 0 0", kTimeout)) soak_.problem("raw client: " + child.output());
+    Child child({fs::read_symlink("/proc/self/exe"), "--client", daemon_.socketPath(), notes_,
+                 viewerShare_.string()},
+                output());
+    if (!child.printed("ready 0 0", kTimeout)) problem("raw client: " + child.output());
     child.printed("sent", kTimeout);
-    sleepMs(std::uniform_int_distribution<int>(0, 5)(random_));
+    sleepMs(std::uniform_int_distribution<int>(0, 5)(chaosRandom_));
     child.kill9();
-    deadHosts.push_back(child.pid());
+    deadHosts_.push_back(child.pid());
   }
 
-  void killedEkctl() {
-    const std::vector<std::string> commands[] = {
-        {"ready", soak_.viewerShare.string(), soak_.thumbs.string()},
-        {"annotate", "--set", R"({"extension":{"ekctl":1}})", soak_.bench[kAnnotated].string()},
-        {"hold", soak_.notes},
-        {"add", soak_.notes}};
-    std::vector<std::string> argv{test::ekctlPath(), "-S", soak_.daemon.service()};
-    const auto& command = commands[random_() % std::size(commands)];
-    argv.insert(argv.end(), command.begin(), command.end());
-    Child child(argv, soak_.output());
-    sleepMs(std::uniform_int_distribution<int>(0, 60)(random_));
-    child.kill9();
-    deadHosts.push_back(child.pid());
-  }
-
-  void install() {
-    const fs::path bundle = soak_.root / fmt::format("Applications/Install{}.app", installs_);
-    writeApp(bundle, fmt::format("com.test.soak.install{}", installs_++));
-    auto added = soak_.daemon.ekctl({"add", bundle.string()});
-    if (added.status != 0) soak_.problem("ekctl add failed: " + added.err);
-    installed_.push_back(bundle);
-  }
-  void uninstallOldest() {
-    auto removed = soak_.daemon.ekctlAs(soak_.ekctl, {"remove", installed_.front().string()});
-    if (removed.status != 0) soak_.problem("ekctl remove failed: " + removed.err);
-    fs::remove_all(installed_.front());
-    installed_.erase(installed_.begin());
-  }
-
-  // A malformed frame on a connection of its own; ekd must go on serving everyone else.
-  void garbage() {
-    std::vector<uint8_t> bytes(wyre::kHeaderSize);
-    const std::vector<uint8_t> bodies[] = {std::vector<uint8_t>(64, 0xff),
-                                           std::vector<uint8_t>(100000, 0x81),
-                                           cbor::encode(request("bulk"))};
-    const std::vector<uint8_t>& body = bodies[garbage_ % 3];
-    const uint32_t length =
-        garbage_++ % 2 ? wyre::kMaxBodySize + 1 : static_cast<uint32_t>(body.size() - 1);
-    wyre::encodeHeader({length, wyre::kFlagWantsReply, 1}, bytes.data());
-    bytes.insert(bytes.end(), body.begin(), body.end());
-    {
-      test::RawClient client(soak_.daemon.socketPath());
-      client.sendBytes(bytes);
-      client.readFrame(milliseconds(std::uniform_int_distribution<int>(0, 200)(random_)));
-    }
-    if (!soak_.ask(request("bulk"))) soak_.problem("ekd stopped answering after garbage");
-  }
-
+  // A connection that sends requests with large replies and never reads them.
   void topUpNonReader() {
     if (nonReader_ < 0) {
       nonReader_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
       sockaddr_un address{.sun_family = AF_UNIX};
-      std::strncpy(address.sun_path, soak_.daemon.socketPath().c_str(),
-                   sizeof address.sun_path - 1);
+      std::strncpy(address.sun_path, daemon_.socketPath().c_str(), sizeof address.sun_path - 1);
       connect(nonReader_, reinterpret_cast<sockaddr*>(&address), sizeof address);
       pending_.clear();
     }
@@ -375,146 +363,67 @@ class Chaos {
     }
   }
 
-  Soak& soak_;
-  std::mt19937_64 random_;
-  std::atomic<bool> stop_{false};
-  std::atomic<unsigned> rounds_{0};
-  std::thread thread_;
-  std::vector<fs::path> installed_;
-  unsigned installs_ = 0, garbage_ = 0;
+  // Nothing was found broken or set aside, and no declaration outlived its host.
+  void checkFiles(const std::string& when) {
+    std::ifstream log(daemon_.root().path() / "ekd.log");
+    for (std::string line; std::getline(log, line);) {
+      for (const char* bad : {"(resetting)", "moved aside", "kept unusable", "runtime error:"}) {
+        if (line.find(bad) != std::string::npos) problem(when + ": ekd logged: " + line);
+      }
+    }
+    std::error_code error;
+    for (const auto& entry : fs::directory_iterator(root_ / "state", error)) {
+      const std::string name = entry.path().filename();
+      if (name.find(".corrupt-") != std::string::npos || name.find(".bad-") != std::string::npos) {
+        problem(when + ": a state file was set aside: " + name);
+      }
+    }
+    for (const auto& entry : fs::directory_iterator(root_ / "run/services", error)) {
+      const std::string name = entry.path().filename();
+      if (std::all_of(name.begin(), name.end(), ::isdigit) && !processAlive(std::stoi(name))) {
+        problem(when + ": declarations of exited host " + name + " remain");
+      }
+    }
+  }
+
+  // Every plug-in is listed with its UUID: none was lost and none is left held.
+  void checkListed(const std::string& when) {
+    auto reply = ask(request("match"));
+    std::set<std::string> listed;
+    for (const Value& form :
+         reply && reply->getArray("matches") ? *reply->getArray("matches") : Array{}) {
+      if (const std::string* uuid = form.getString("uuid")) listed.insert(*uuid);
+    }
+    std::vector<Uuid> expected = bench_;
+    expected.insert(expected.end(), {viewerShare_, thumbs_, notesShare_});
+    for (const Uuid& uuid : expected) {
+      if (!listed.count(uuid.string())) problem(when + ": " + uuid.string() + " is not listed");
+    }
+  }
+
+  test::EkdProcess daemon_;
+  fs::path root_;  // canonical root of the daemon's directories
+  std::string notes_, ekbench_, requests_;
+  std::vector<Uuid> bench_;                 // by index i: System/Library/PlugIns/P<i>.bundle
+  Uuid viewerShare_, thumbs_, notesShare_;  // Notes is held by the killed clients
+  std::mt19937_64 random_, chaosRandom_;
+  std::atomic<unsigned> outputs_{0}, rounds_{0};
+  std::atomic<bool> stop_{false}, stopChaos_{false};
+  std::thread annotator_, chaos_;
+  std::mutex mutex_;
+  std::vector<std::string> problems_;
+  // The annotator's: values sent and last acknowledged for each plug-in.
+  std::set<uint64_t> sent_[kAnnotated];
+  uint64_t acked_[kAnnotated] = {}, lastId_ = 0;
+  std::atomic<uint64_t> acknowledged_{0};
+  // The chaos driver's.
+  std::vector<pid_t> deadHosts_;
   int nonReader_ = -1;
   std::vector<uint8_t> pending_;
 };
 
-std::optional<Uuid> Soak::uuidOf(const std::string& path) {
-  auto reply = ask(request("find", {{"paths", Value("file://" + path)}}));
-  const Value* form = reply ? reply->get("matches") : nullptr;
-  const std::string* uuid = form ? form->getString("uuid") : nullptr;
-  if (!uuid) problem("no plug-in found at " + path);
-  return uuid ? Uuid::parse(*uuid) : std::nullopt;
-}
-
-bool Soak::setUp() {
-  root = fs::canonical(daemon.root().path());
-  daemon.setEnvironment("EKORA_LOG", "default");
-  daemon.exportEnvironment();  // for every child started later
-  auto fixture =
-      test::runCommand({BENCH_FIXTURE_PATH, "plugins", "--system-root", (root / "System").string(),
-                        "--count", std::to_string(kBenchPlugIns), "--points", "4"});
-  for (const char* app : {"Viewer.app", "Notes.app"}) {
-    fs::create_directories(root / "Applications" / app);
-    fs::copy(fs::path(EXAMPLES_DIR) / "Applications" / app, root / "Applications" / app,
-             fs::copy_options::recursive);
-  }
-  const std::string viewer = (root / "Applications/Viewer.app").string();
-  notes = (root / "Applications/Notes.app").string();
-  churn = (root / "Applications/Churn.app").string();
-  writeApp(churn, "com.test.soak.churn");
-  // Copies with the manager's entitlement, so that their removals are served.
-  ekctl = test::ekctlWithEntitlements(root / "bin", {kManager});
-  ekbench = (root / "bin/ekbench").string();
-  fs::copy_file(EKBENCH_PATH, ekbench);
-  writeDmap(ekbench + ".entitlements", {{kManager, true}});
-  if (fixture.status != 0 || !daemon.start()) {
-    problem("set-up failed: " + fixture.err + daemon.log());
-    return false;
-  }
-  auto added = ask(request("add", {{"paths", Array{viewer, notes, churn}}}));
-  if (!added || test::replyErrorCode(*added) != 0) problem("adding the applications failed");
-  for (unsigned i = 0; i < kBenchPlugIns; ++i) {
-    auto uuid = uuidOf(fmt::format("{}/System/Library/PlugIns/P{}.bundle", root.string(), i));
-    bench.push_back(uuid.value_or(Uuid()));
-  }
-  viewerShare = uuidOf(viewer + "/PlugIns/Share.appex").value_or(Uuid());
-  thumbs = uuidOf(viewer + "/PlugIns/Thumbs.appex").value_or(Uuid());
-  notesShare = uuidOf(notes + "/PlugIns/Share.appex").value_or(Uuid());
-
-  // The request lines ekbench cycles through: every request type, weighted towards the common
-  // ones. No hold outlives its request and nothing touches the annotator's plug-ins.
-  std::vector<Value> lines{request("add", {{"paths", Array{churn}}}),
-                           request("remove", {{"paths", Array{churn}}}), request("match")};
-  auto some = [&](unsigned salt) {
-    return bench[kAnnotated + salt % (kBenchPlugIns - kAnnotated)];
-  };
-  for (unsigned i = 0; i < 24; ++i) {
-    const std::string point = fmt::format("com.corvane.bench.point{}", 1 + i % 3);
-    lines.push_back(request("find", {{"uuids", some(i * 7)}}));
-    lines.push_back(
-        request("match", {{"rules", Dictionary{{"ZuExtensionPointIdentifier", point}}}}));
-    if (i % 3) continue;
-    lines.push_back(request("annotate", {{"annotations", Dictionary{{"election", i % 2}}},
-                                         {"uuids", uuids({some(i), some(i + 50)})}}));
-    lines.push_back(request(
-        "bulk-annotate", {{"annotations", Dictionary{{some(i).string(), Dictionary{{"n", i}}}}}}));
-    lines.push_back(request("ready", {{"uuids", uuids({viewerShare, some(i + 20)})}}));
-    lines.push_back(request("access", {{"uuids", uuids({thumbs, some(i + 30)})}}));
-    lines.push_back(request("bulk", {{"flags", uint64_t{0}}}));
-    lines.push_back(request("lock", {{"uuids", uuids({Uuid::random()})}}));
-  }
-  std::shuffle(lines.begin(), lines.end(), random);
-  requests = (root / "requests.jsonl").string();
-  std::ofstream out(requests);
-  for (const Value& line : lines) out << wirejson::write(line) << "\n";
-  return out.flush() && !failed();
-}
-
-// No client is lost while ekd runs: ekbench ends in time with every request answered.
-void Soak::finishBench(Child& bench, double duration) {
-  auto status = bench.wait(milliseconds(static_cast<int64_t>(duration * 1000)) + seconds(90));
-  auto report = nlohmann::json::parse(bench.output(), nullptr, false);
-  if (!status || report.is_discarded() || !report.contains("daemon")) {
-    return problem("ekbench ended without a report: " + bench.output());
-  }
-  if (*status != 0 || report["daemon"].value("requests", 0) == 0 ||
-      report["daemon"].value("failures", 0) != 0) {
-    problem(fmt::format("ekbench (status {}) lost clients: {}", *status, report["daemon"].dump()));
-  }
-}
-
-// Nothing was found broken or set aside, and no declaration outlived its host.
-void Soak::checkFiles(const std::string& when) {
-  std::ifstream log(daemon.root().path() / "ekd.log");
-  for (std::string line; std::getline(log, line);) {
-    for (const char* bad : {"(resetting)", "moved aside", "kept unusable", "runtime error:"}) {
-      if (line.find(bad) != std::string::npos) problem(when + ": ekd logged: " + line);
-    }
-  }
-  std::error_code error;
-  for (const auto& entry : fs::directory_iterator(root / "state", error)) {
-    const std::string name = entry.path().filename();
-    if (name.find(".corrupt-") != std::string::npos || name.find(".bad-") != std::string::npos) {
-      problem(when + ": a state file was set aside: " + name);
-    }
-  }
-  for (const auto& entry : fs::directory_iterator(root / "run/services", error)) {
-    const std::string name = entry.path().filename();
-    if (std::all_of(name.begin(), name.end(), ::isdigit) && !processAlive(std::stoi(name))) {
-      problem(when + ": declarations of exited host " + name + " remain");
-    }
-  }
-}
-
-// Every plug-in is listed with its UUID: none was lost, none is left held; no uninstalled one is.
-void Soak::checkListed(const std::string& when) {
-  auto reply = ask(request("match"));
-  std::set<std::string> listed;
-  for (const Value& form :
-       reply && reply->getArray("matches") ? *reply->getArray("matches") : Array{}) {
-    if (const std::string* uuid = form.getString("uuid")) listed.insert(*uuid);
-    const std::string* identifier = form.getString("identifier");
-    if (identifier && identifier->starts_with("com.test.soak.install")) {
-      problem(when + ": uninstalled " + *identifier + " is listed");
-    }
-  }
-  std::vector<Uuid> expected = bench;
-  expected.insert(expected.end(), {viewerShare, thumbs, notesShare});
-  for (const Uuid& uuid : expected) {
-    if (!listed.count(uuid.string())) problem(when + ": " + uuid.string() + " is not listed");
-  }
-}
-
-// A figure of the idle daemon once it stayed the same for a second: closing connections and
-// giving freed heap back reach it a moment after the last client.
+// A figure of the idle daemon once it stayed the same for a second: closed connections and freed
+// heap reach it a moment after the last client.
 template <typename Measure>
 auto settled(Measure measure) {
   auto last = measure();
@@ -528,7 +437,7 @@ auto settled(Measure measure) {
   return last;
 }
 
-int Soak::run(double duration) {
+int Soak::run(double duration, uint64_t seed) {
   // Kill phases first, then the last lifetime of the daemon, whose first third warms it up
   // before its RSS and descriptors are recorded.
   const unsigned killPhases = std::clamp(static_cast<unsigned>(duration / 60), 2u, 10u);
@@ -536,52 +445,41 @@ int Soak::run(double duration) {
   const double warmup = std::max(4.0, last / 3);
   const double killPhase = std::max(2.0, (duration - last) / killPhases);
   const auto started = Clock::now();
-  Annotator annotator(*this);
-  Chaos chaos(*this);
-  auto bench = [&](double seconds) {
-    return std::make_unique<Child>(
-        std::vector<std::string>{ekbench, "-S", daemon.service(), "--connections", "32",
-                                 "--duration", fmt::format("{:.3f}", seconds), "--warmup", "0",
-                                 "--timeout", "30", "--requests", requests, "--json"},
-        output());
-  };
+  random_.seed(seed);
+  chaosRandom_.seed(random_());
   const bool ready = setUp();
   for (unsigned phase = 1; ready && phase <= killPhases && !failed(); ++phase) {
-    auto load = bench(killPhase + 120);
-    annotator.start();
-    chaos.start();
-    for (auto end = Clock::now() + milliseconds(static_cast<int64_t>(killPhase * 1000));
-         Clock::now() < end && daemon.running();) {
-      sleepMs(50);
-    }
-    chaos.stop();
-    if (!processAlive(daemon.pid())) problem(fmt::format("ekd died by itself in phase {}", phase));
-    sleepMs(std::uniform_int_distribution<int>(0, 300)(random));
-    daemon.kill9();
-    annotator.stop();
-    load.reset();
-    if (!daemon.start()) problem("ekd did not start after SIGKILL: " + daemon.log());
-    annotator.verify(fmt::format("after SIGKILL {}", phase), false);
+    auto bench = startBench(killPhase + 120);
+    startTraffic();
+    sleepMs(static_cast<int>(killPhase * 1000));
+    if (!processAlive(daemon_.pid())) problem(fmt::format("ekd died by itself in phase {}", phase));
+    stopTraffic(false, false);
+    sleepMs(std::uniform_int_distribution<int>(0, 300)(random_));
+    daemon_.kill9();
+    stopTraffic(false, true);
+    bench.reset();
+    if (!daemon_.start()) problem("ekd did not start after SIGKILL: " + daemon_.log());
+    verifyAnnotations(fmt::format("after SIGKILL {}", phase), false);
     checkFiles(fmt::format("after SIGKILL {}", phase));
   }
-  auto fds = [&] { return descriptorCount(daemon.pid()); };
-  auto rss = [&] { return test::residentKiB(daemon.pid()); };
+  auto fds = [&] { return descriptorCount(daemon_.pid()); };
+  auto rss = [&] { return test::residentKiB(daemon_.pid()); };
   size_t fdsBefore = 0, fdsAfter = 0;
   long rssBefore = 0, rssAfter = 0;
   for (double seconds : {warmup, last - warmup}) {
     if (!ready || failed()) break;
-    if (seconds != warmup) fdsBefore = settled(fds), rssBefore = settled(rss);
-    auto load = bench(seconds);
-    annotator.start();
-    chaos.start();
-    finishBench(*load, seconds);
-    chaos.stop(true);
-    annotator.stop();
-    if (!processAlive(daemon.pid())) problem("ekd died during the last lifetime");
+    if (seconds != warmup) {
+      fdsBefore = settled(fds);
+      rssBefore = settled(rss);
+    }
+    auto bench = startBench(seconds);
+    startTraffic();
+    finishBench(*bench, seconds);
+    stopTraffic(true, true);
+    if (!processAlive(daemon_.pid())) problem("ekd died during the last lifetime");
   }
   if (ready && !failed()) {
     // All clients are gone: the daemon must be back where the warm-up left it.
-    chaos.uninstallAll();
     for (auto end = Clock::now() + seconds(20); fds() != fdsBefore && Clock::now() < end;) {
       sleepMs(100);
     }
@@ -593,28 +491,29 @@ int Soak::run(double duration) {
       problem(fmt::format("ekd's RSS grew from {} KiB to {} KiB", rssBefore, rssAfter));
     }
     // A declaration written now prunes those of the hosts that exited.
-    if (!ask(request("ready", {{"uuids", uuids({viewerShare})}}))) problem("the last ready failed");
-    for (pid_t pid : chaos.deadHosts) {
-      if (fs::exists(root / "run/services" / std::to_string(pid))) {
+    if (!ask(request("ready", {{"uuids", uuids({viewerShare_})}})))
+      problem("the last ready failed");
+    for (pid_t pid : deadHosts_) {
+      if (fs::exists(root_ / "run/services" / std::to_string(pid))) {
         problem(fmt::format("declarations of killed client {} remain", pid));
       }
     }
     checkListed("at the end");
-    annotator.verify("at the end", true);
-    if (annotator.acknowledged() == 0) problem("no annotation was acknowledged");
+    verifyAnnotations("at the end", true);
+    if (acknowledged_ == 0) problem("no annotation was acknowledged");
     // The files load again after a clean stop.
-    if (int status = daemon.terminate(); status != 0)
+    if (int status = daemon_.terminate(); status != 0)
       problem(fmt::format("ekd exited with {}", status));
-    if (!daemon.start()) problem("ekd did not start again: " + daemon.log());
-    annotator.verify("after the last restart", true);
+    if (!daemon_.start()) problem("ekd did not start again: " + daemon_.log());
+    verifyAnnotations("after the last restart", true);
     checkListed("after the last restart");
     checkFiles("after the last restart");
   }
-  fmt::print("soak: {} in {:.0f} s: {} annotations acknowledged, rss_kib={}->{} fds={}->{}\n",
-             failed() ? "FAIL" : "PASS",
-             std::chrono::duration<double>(Clock::now() - started).count(),
-             annotator.acknowledged(), rssBefore, rssAfter, fdsBefore, fdsAfter);
-  for (const std::string& problem : problems) fmt::print("  problem: {}\n", problem);
+  fmt::print(
+      "soak: {} in {:.0f} s (seed {}): {} annotations acknowledged, rss_kib={}->{} fds={}->{}\n",
+      failed() ? "FAIL" : "PASS", std::chrono::duration<double>(Clock::now() - started).count(),
+      seed, acknowledged_.load(), rssBefore, rssAfter, fdsBefore, fdsAfter);
+  for (const std::string& problem : problems_) fmt::print("  problem: {}\n", problem);
   return failed() ? 1 : 0;
 }
 
@@ -633,6 +532,10 @@ int clientMode(char** argv) {
     client.sendMessage(id % 2 ? request("match") : request("access", {{"uuids", uuids({uuid})}}),
                        id);
   }
+  // And a frame longer than any the daemon accepts, which must cost it nothing but this client.
+  std::vector<uint8_t> header(wyre::kHeaderSize);
+  wyre::encodeHeader({wyre::kMaxBodySize + 1, wyre::kFlagWantsReply, 40}, header.data());
+  client.sendBytes(header);
   fmt::print("sent\n");
   std::fflush(stdout);
   std::this_thread::sleep_for(seconds(120));
@@ -656,8 +559,5 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "usage: ekora_soak [--duration SECONDS (10 to 86400)] [--seed N]\n");
     return 2;
   }
-  std::printf("soak: seed %llu\n", static_cast<unsigned long long>(seed));
-  ek::soak::Soak soak;
-  soak.random.seed(seed);
-  return soak.run(duration);
+  return ek::soak::Soak().run(duration, seed);
 }
