@@ -7,17 +7,6 @@
 namespace ek {
 namespace {
 
-TEST(DictionaryChanging, CopiesWithOneKeySetOrRemovedAndNeverCreates) {
-  const Dictionary receiver{{"election", 1}, {"name", "A"}};
-  EXPECT_EQ(dictionaryChanging(&receiver, "election", Value(2)),
-            (Dictionary{{"election", 2}, {"name", "A"}}));
-  EXPECT_EQ(dictionaryChanging(&receiver, "election", std::nullopt), (Dictionary{{"name", "A"}}));
-  EXPECT_EQ(dictionaryChanging(&receiver, "new", Value(3)),
-            (Dictionary{{"election", 1}, {"name", "A"}, {"new", 3}}));
-  EXPECT_EQ(receiver, (Dictionary{{"election", 1}, {"name", "A"}}));
-  EXPECT_FALSE(dictionaryChanging(nullptr, "election", Value(1)).has_value());
-}
-
 const char* name(std::strong_ordering order) {
   return order < 0 ? "less" : order > 0 ? "greater" : "equal";
 }

@@ -75,61 +75,49 @@ TEST_F(EkPlugInCoreTest, SetUpReadsTheInfoAndDefaultsTheSpecsOfApplicationExtens
   EXPECT_EQ(*record->plugInDictionary(), *appexInfo().at("ZuExtension").dictionary());
 }
 
-TEST_F(EkPlugInCoreTest, FlagsFollowPathAndPlugInKeys) {
-  const struct {
-    std::string path;
-    Dictionary plugIn;
-    bool appex, dedicated, data, hybrid;
-  } rows[] = {
-      {"/a/A.app/PlugIns/B.appex", {}, true, false, false, false},
-      {"/a/A.app/PlugIns/B.appex2", {}, false, false, false, false},
-      {"/s/P", {{"Dedicated", true}}, false, true, false, false},
-      {"/s/P", {{"Dedicated", 1}}, false, true, false, false},
-      {"/s/P", {{"ZuExtensionProtocol", "#Data"}}, false, false, true, false},
-      {"/s/P", {{"ZuExtensionProtocol", "#data"}}, false, false, false, false},
-      {"/s/P", {{"EmbeddedCode", false}}, false, false, false, true},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.path + " " + Value(row.plugIn).description());
-    auto record = fromPlugIn(row.plugIn, row.path);
-    EXPECT_EQ(record->isAppExtension(), row.appex);
-    EXPECT_EQ(record->isDedicated(), row.dedicated);
-    EXPECT_EQ(record->isData(), row.data);
-    EXPECT_EQ(record->isHybrid(), row.hybrid);
-  }
-}
-
-TEST_F(EkPlugInCoreTest, DiagnoseAnswersTheFirstFailureInItsOrder) {
+// Each row: the flags read from the path and the plug-in dictionary, and the first reason, in a
+// fixed order, why the definition is invalid.
+TEST_F(EkPlugInCoreTest, FlagsAndDiagnoseFollowPathAndPlugInKeys) {
   const std::string principal = "Application Extensions may not use the \"PrincipalClass\" key";
   const std::string protocol = "missing \"ZuExtensionProtocol\" key in Info.dmap or SDK";
   const std::string attributes = "missing \"ZuExtensionAttributes\" key in Info.dmap or SDK";
-  const std::string passProxy = "the \"PassProxy\" key is not supported on this platform";
   const Value a(Dictionary{});
   const std::string appex = "/a/A.app/PlugIns/B.appex";
   const struct {
     std::string path;
     Dictionary plugIn;
-    std::string message;  // empty: valid
+    std::string flags, message;  // message empty: valid
   } rows[] = {
-      {appex, {{"ZuExtensionAttributes", a}, {"PrincipalClass", "ZuObject"}}, ""},
-      {appex, {{"ZuExtensionAttributes", a}, {"PrincipalClass", 7}}, principal},
+      {appex, {{"ZuExtensionAttributes", a}, {"PrincipalClass", "ZuObject"}}, "appex", ""},
+      {appex, {{"ZuExtensionAttributes", a}, {"PrincipalClass", 7}}, "appex", principal},
+      {appex + "2", {{"ZuExtensionAttributes", a}}, "", protocol},
+      {"/a/A.app/PlugIns/B.APPEX", {{"Dedicated", 1}}, "dedicated", protocol},
+      {"/s/P", {{"ZuExtensionProtocol", "P"}, {"Dedicated", "YES"}}, "", attributes},
+      {"/s/P", {{"ZuExtensionProtocol", "#Data"}, {"ZuExtensionAttributes", a}}, "data", ""},
+      {"/s/P", {{"ZuExtensionProtocol", "#data"}, {"ZuExtensionAttributes", a}}, "", ""},
       {appex,
-       {{"ZuExtensionAttributes", a}, {"PassProxy", true}, {"PrincipalClass", "X"}},
-       principal},
-      {"/a/A.app/PlugIns/B.APPEX", {{"ZuExtensionAttributes", a}}, protocol},
-      {"/s/P", {}, protocol},
-      {"/s/P", {{"ZuExtensionProtocol", "P"}}, attributes},
-      {"/s/P", {{"ZuExtensionProtocol", "#Data"}, {"ZuExtensionAttributes", a}}, ""},
-      {appex, {{"ZuExtensionAttributes", a}, {"PassProxy", false}, {"EmbeddedCode", 1}}, passProxy},
+       {{"ZuExtensionAttributes", a}, {"PassProxy", false}, {"EmbeddedCode", 1}},
+       "appex hybrid",
+       "the \"PassProxy\" key is not supported on this platform"},
       {appex,
-       {{"ZuExtensionAttributes", a}, {"EmbeddedCode", a}},
+       {{"ZuExtensionAttributes", a}, {"EmbeddedCode", false}},
+       "appex hybrid",
        "hybrid plug-ins are not supported on this platform"},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.path + " " + Value(row.plugIn).description());
-    std::optional<EkError> error = fromPlugIn(row.plugIn, row.path)->diagnose();
-    EXPECT_EQ(error, row.message.empty() ? std::nullopt
-                                         : std::optional(EkError{"Ekora", 12, row.message}));
+    auto record = fromPlugIn(row.plugIn, row.path);
+    std::string flags;
+    for (auto [name, set] : {std::pair{"appex", record->isAppExtension()},
+                             {"dedicated", record->isDedicated()},
+                             {"data", record->isData()},
+                             {"hybrid", record->isHybrid()}}) {
+      if (set) flags += (flags.empty() ? "" : " ") + std::string(name);
+    }
+    EXPECT_EQ(flags, row.flags);
+    EXPECT_EQ(record->diagnose(), row.message.empty()
+                                      ? std::nullopt
+                                      : std::optional(EkError{"Ekora", 12, row.message}));
   }
 }
 
