@@ -121,35 +121,6 @@ TEST_F(EkPlugInCoreTest, FlagsAndDiagnoseFollowPathAndPlugInKeys) {
   }
 }
 
-// A record whose registry knows one SDK.
-class SdkRecord : public EkPlugInCore {
- public:
-  explicit SdkRecord(const Dictionary& info) {
-    const Value bundleInfo(info);
-    initWithName("com.x", EkFileURL::fromPath(kSystemPath).value(), &bundleInfo, nullptr, {});
-  }
-  std::optional<Dictionary> readSDKDictionary(std::string_view point) const override {
-    if (point != "com.corvane.import") return std::nullopt;
-    return Dictionary{
-        {"ZuExtension", Dictionary{{"CleanTimeout", 30},
-                                   {"ZuExtensionProtocol", "SdkProtocol"},
-                                   {"ZuExtensionAttributes", Dictionary{{"FromSdk", true}}}}}};
-  }
-};
-
-TEST_F(EkPlugInCoreTest, ResolveSdkMergesTheRegisteredSdkUnderThePlugInsOwnValues) {
-  auto record = std::make_shared<SdkRecord>(
-      Dictionary{{"ZuExtension", Dictionary{{"ZuExtensionPointIdentifier", "com.corvane.import"},
-                                            {"CleanTimeout", 5},
-                                            {"ZuExtensionProtocol", "Own"},
-                                            {"ZuExtensionAttributes", Dictionary{{"Kinds", 1}}}}}});
-  record->resolveSDK();
-  EXPECT_EQ(*record->pluginKey("CleanTimeout"), Value(30));
-  EXPECT_EQ(*record->protocolSpec(), Value("Own"));
-  EXPECT_EQ(*record->attributes(),
-            (Dictionary{{"FromSdk", true}, {"Kinds", 1}, {"ZuExtensionVersion", "1"}}));
-}
-
 std::shared_ptr<EkPlugInCore> fullRecord() {
   auto record = fromInfo(appexInfo(), kAppexPath);
   record->setUuid(Uuid::parse("e621e1f8-c36c-495a-93fc-0c247a3e6e5f").value());
@@ -199,17 +170,14 @@ TEST_F(EkPlugInCoreTest, FormsWithAKeyOfTheWrongTypeAreRefused) {
   Result<std::shared_ptr<EkPlugInCore>> read = EkPlugInCore::createWithForm(minimal);
   ASSERT_TRUE(read.ok());
   EXPECT_EQ(read.value()->path(), "/System/X");
-  EXPECT_EQ(read.value()->hubProtocolVersion(), 1u);
   EXPECT_FALSE(read.value()->uuid().isNull());
   const std::pair<const char*, std::optional<Value>> rows[] = {
       {"identifier", std::nullopt},
       {"path", Value("relative/X")},
       {"bundleInfo", Value(Dictionary{{"ZuExtension", "text"}})},
-      {"info", Value(Array{})},
       {"lastmodified", Value(uint64_t{1} << 31)},
       {"systemResident", Value("yes")},
       {"annotations", Value(Array{})},
-      {"containingPath", Value("apps/A.app")},
   };
   for (const auto& [key, value] : rows) {
     Dictionary form = minimal;
