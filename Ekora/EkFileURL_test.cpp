@@ -26,9 +26,7 @@ TEST(EkFileURL, PathsAndURLsRoundTripWithPercentEncoding) {
     EXPECT_EQ(pathFromFileURL(other).value(), "/x") << other;
   }
   EXPECT_EQ(pathFromFileURL("file:///%c3%bc b").value(), "/\xc3\xbc b");
-}
-
-TEST(EkFileURL, RefusesRelativePathsAndURLsNamingNoLocalFile) {
+  // Refused: relative paths, and URLs naming no local file.
   for (const std::string& path : {std::string(""), std::string("./x"), std::string("/a\0b", 4)}) {
     EXPECT_EQ(EkFileURL::fromPath(path).error().domain, kFormatErrorDomain) << path;
   }
