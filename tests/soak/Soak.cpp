@@ -293,7 +293,7 @@ class Soak {
            Clock::now() < end && !child.output().ends_with("sent\n");) {
         sleepMs(10);
       }
-      if (child.output() != "ready 0 0\nsent\n") problem("raw client: " + child.output());
+      if (child.output() != "ready 00 0\nsent\n") problem("raw client: " + child.output());
       sleepMs(std::uniform_int_distribution<int>(0, 500)(chaosRandom_));
       child.kill9();
       deadHosts_.push_back(child.pid());
@@ -432,7 +432,7 @@ int Soak::run(double duration, uint64_t seed) {
   return failed() ? 1 : 0;
 }
 
-// The client the chaos driver kills: holds a path, declares a service, sends a burst of
+// The client the chaos driver kills: holds a path twice, declares a service, sends a burst of
 // requests without reading the replies and waits (bounded) to be killed.
 int clientMode(char** argv) {
   test::RawClient client(argv[2]);
@@ -441,9 +441,10 @@ int clientMode(char** argv) {
     return reply ? std::to_string(test::replyErrorCode(reply->body)) : "none";
   };
   const Uuid uuid = Uuid::parse(argv[4]).value_or(Uuid());
-  const std::string held = code(request("lock", {{"paths", Array{argv[3]}}}), 1);
-  fmt::print("ready {} {}\n", held, code(request("ready", {{"uuids", uuids({uuid})}}), 2));
-  for (uint64_t id = 3; id < 200; ++id) {
+  const std::string held = code(request("lock", {{"paths", Array{argv[3]}}}), 1) +
+                           code(request("lock", {{"paths", Array{argv[3]}}}), 2);
+  fmt::print("ready {} {}\n", held, code(request("ready", {{"uuids", uuids({uuid})}}), 3));
+  for (uint64_t id = 4; id < 200; ++id) {
     client.sendMessage(id % 2 ? request("match") : request("access", {{"uuids", uuids({uuid})}}),
                        id);
   }
