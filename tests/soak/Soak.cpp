@@ -416,12 +416,13 @@ int Soak::run(double duration, uint64_t seed) {
       }
     }
     if (acknowledged_ == 0) problem("no annotation was acknowledged");
+    if (listed() != everyPlugIn_) problem("at the end plug-ins were lost or left held");
     // The files load again after a clean stop.
     if (int status = daemon_.terminate(); status != 0)
       problem(fmt::format("ekd exited with {}", status));
     if (!daemon_.start()) problem("ekd did not start again: " + daemon_.log());
     verifyAnnotations("after the last restart", true);
-    if (listed() != everyPlugIn_) problem("plug-ins were lost or left held");
+    if (listed() != everyPlugIn_) problem("after the last restart plug-ins were lost");
     checkFiles("after the last restart");
   }
   fmt::print(
