@@ -76,8 +76,9 @@ class EkDWyreClient : public std::enable_shared_from_this<EkDWyreClient> {
   const std::shared_ptr<const EkDClientProcess>& process() const { return process_; }
   // The record of the process that wrote a message on this connection: kept per process and
   // executable, read anew when the process has executed another program. Costs one stat of
-  // /proc/<pid>/exe per read of the socket (the messages of one read share it). Called on the
-  // connection's event queue.
+  // /proc/<pid>/exe per read of the socket (the messages of one read share it), made after the
+  // read. Called on the work queue, in the order the messages arrived, and only for requests
+  // that ask about their writer.
   std::shared_ptr<const EkDClientProcess> writerOf(const wyre::Message& message);
 
   // Reactions to the connection's termination-imminent and connection-invalid events.
@@ -109,7 +110,7 @@ class EkDWyreClient : public std::enable_shared_from_this<EkDWyreClient> {
   pid_t pid_ = 0;
   std::atomic<uint32_t> requestCount_{0};
 
-  // Writers seen on the connection, the connecting process first; on the connection's queue.
+  // Writers seen on the connection, the connecting process first; on the work queue.
   std::vector<std::shared_ptr<const EkDClientProcess>> writers_;
   // The writer of the last message and the read it came in.
   std::shared_ptr<const EkDClientProcess> lastWriter_;

@@ -22,6 +22,30 @@ class EkDPlugIn;
 class EkDServer;
 class EkDWyreClient;
 
+// The process that wrote a request, found on first use: finding it costs a stat of the
+// writer's executable (EkDWyreClient::writerOf), which the many requests that never ask about
+// their caller do without. Used on the work queue only.
+class RequestSender {
+ public:
+  // Already known.
+  RequestSender(const EkDClientProcess& process) : process_(&process) {}  // NOLINT: implicit
+  // Found by resolve(context) on first use.
+  RequestSender(const EkDClientProcess& (*resolve)(const void*), const void* context)
+      : resolve_(resolve), context_(context) {}
+
+  const EkDClientProcess& get() const {
+    if (!process_) process_ = &resolve_(context_);
+    return *process_;
+  }
+  operator const EkDClientProcess&() const { return get(); }  // NOLINT: implicit
+  const EkDClientProcess* operator->() const { return &get(); }
+
+ private:
+  mutable const EkDClientProcess* process_ = nullptr;
+  const EkDClientProcess& (*resolve_)(const void*) = nullptr;
+  const void* context_ = nullptr;
+};
+
 // A request as its handler sees it; valid until the reply has been sent.
 struct Request {
   // The request dictionary.
@@ -29,7 +53,7 @@ struct Request {
   // The protocol version the request asked for (3 or 2).
   uint64_t version = 0;
   // The process that wrote the request: every question about the caller is asked of it.
-  const EkDClientProcess& sender;
+  RequestSender sender;
   // The process that connected, as the logs name the client.
   pid_t pid = 0;
   // The connection's record; null for a request that came without a connection.

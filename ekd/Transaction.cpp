@@ -20,9 +20,20 @@ std::shared_ptr<Transaction> Transaction::initWithRequest(
       new Transaction(std::move(request), std::move(client), std::move(sender)));
 }
 
+std::shared_ptr<Transaction> Transaction::initWithWrittenRequest(
+    wyre::Message request, std::shared_ptr<EkDWyreClient> client) {
+  return std::shared_ptr<Transaction>(
+      new Transaction(std::move(request), std::move(client), nullptr));
+}
+
 Transaction::Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client,
                          std::shared_ptr<const EkDClientProcess> sender)
     : client_(std::move(client)), sender_(std::move(sender)), request_(std::move(request)) {}
+
+const EkDClientProcess& Transaction::sender() const {
+  if (!sender_) sender_ = client_->writerOf(request_);
+  return *sender_;
+}
 
 EkDServer& Transaction::server() const {
   return *client_->server();
@@ -59,7 +70,12 @@ void Transaction::dispatch() {
     send(Reply::failure(protocol::kErrorInvalidRequest, protocol::kMsgUnrecognized));
     return;
   }
-  decoded_.emplace(Request{request_.body, version_.load(), *sender_, client_->pid(), client_});
+  const RequestSender sender(
+      [](const void* self) -> const EkDClientProcess& {
+        return static_cast<const Transaction*>(self)->sender();
+      },
+      this);
+  decoded_.emplace(Request{request_.body, version_.load(), sender, client_->pid(), client_});
   if (handler->answer) {
     send(handler->answer(*decoded_, server()));
     return;

@@ -28,6 +28,10 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   static std::shared_ptr<Transaction> initWithRequest(
       wyre::Message request, std::shared_ptr<EkDWyreClient> client,
       std::shared_ptr<const EkDClientProcess> sender = nullptr);
+  // The same, with the writer's record looked up (EkDWyreClient::writerOf) only when the
+  // request first asks about its sender.
+  static std::shared_ptr<Transaction> initWithWrittenRequest(wyre::Message request,
+                                                             std::shared_ptr<EkDWyreClient> client);
 
   // Checks version and type and runs the request's handler; its reply is sent exactly once.
   void dispatch();
@@ -35,7 +39,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   const std::shared_ptr<EkDWyreClient>& client() const { return client_; }
   // The process that wrote this request: every question about the caller's program,
   // entitlements or sandbox is asked of it, never of the connection.
-  const EkDClientProcess& sender() const { return *sender_; }
+  const EkDClientProcess& sender() const;
   const Value& request() const { return request_.body; }
   uint64_t version() const { return version_.load(); }
   EkDServer& server() const;
@@ -52,7 +56,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   void sendFrame(std::vector<uint8_t> frame);
 
   std::shared_ptr<EkDWyreClient> client_;
-  std::shared_ptr<const EkDClientProcess> sender_;
+  // Null until asked for when the writer's record is looked up on first use; then set on the
+  // work queue.
+  mutable std::shared_ptr<const EkDClientProcess> sender_;
   wyre::Message request_;
   std::atomic<uint64_t> version_{0};
   // What the handler sees; made by dispatch.

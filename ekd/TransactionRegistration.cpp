@@ -43,7 +43,7 @@ void removePlugIns(const Request& request, EkDServer& daemon, Respond respond) {
   EkDatabase& database = daemon.database();
   auto step = [&request, &database](const std::string& path, bool resolved) -> Step {
     EK_PROBE2(plugin_remove, path.c_str(), resolved);
-    if (!request.sender.hasEntitlement(protocol::kEntitlementManager)) {
+    if (!request.sender->hasEntitlement(protocol::kEntitlementManager)) {
       log::process().defaultLevel(
           "refused request from pid=%d to remove plug-in at %@ - client lacks required "
           "entitlement",

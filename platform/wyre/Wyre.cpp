@@ -361,6 +361,10 @@ void Connection::receive() {
     }
     ++reads_;
     if (!consume(buffer, static_cast<size_t>(n), writer)) return;
+    // A short read emptied the socket, or stopped where the next bytes' writer differs: either
+    // way the wait readMore arms re-arms the descriptor, which reports bytes already there at
+    // once. Reading on would cost a call that mostly answers EAGAIN.
+    if (static_cast<size_t>(n) < kReadChunk) break;
   }
   readMore();
 }
