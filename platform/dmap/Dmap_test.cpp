@@ -95,22 +95,6 @@ TEST(Dmap, AssembledDocumentIsWhatWriteGives) {
   EXPECT_FALSE(writeAssembled(root, "data", {&big, &big}).ok());
 }
 
-TEST(Dmap, ParsesLenientlyWhereXmlAllows) {
-  const struct {
-    std::string body;
-    Value expected;
-  } rows[] = {
-      {"<string>&#65;&#x42;<![CDATA[<c>]]><!-- x --></string>", "AB<c>"},
-      {"<data>aGVs\n\t bG8=\r\n</data>", Data{'h', 'e', 'l', 'l', 'o'}},
-      {"<dict><key/><true></true></dict>", Dictionary{{"", true}}},
-  };
-  for (const auto& row : rows)
-    EXPECT_EQ(parse(document(row.body)).value(), row.expected) << row.body;
-  EXPECT_EQ(parse("<?xml version=\"1.0\"?>\n<!DOCTYPE dmap>\n<dmap version=\"1.0\"><true/></dmap>")
-                .value(),
-            Value(true));
-}
-
 TEST(Dmap, RefusesMalformedDocumentsNamingTheLine) {
   const std::string head = "<?xml version=\"1.0\"?>\n";
   const struct {
@@ -144,6 +128,9 @@ TEST(Dmap, RefusesMalformedDocumentsNamingTheLine) {
     EXPECT_EQ(read.error().message.rfind(row.message, 0), 0u) << read.error().message;
   }
   EXPECT_FALSE(parse(document("<string>" + std::string(kMaxFileSize, 'a') + "</string>")).ok());
+  EXPECT_EQ(
+      parse("<!DOCTYPE dmap>\n<dmap version=\"1.0\"><data>aGVs\n\t bG8=</data></dmap>").value(),
+      Value(Data{'h', 'e', 'l', 'l', 'o'}));
 }
 
 TEST(DmapFile, ReadsWhatWasWrittenAtomicallyAndNamesTheFileOfAnError) {
