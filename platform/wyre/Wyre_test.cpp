@@ -32,59 +32,17 @@ TEST(WyreServiceName, OnlyPlainFileNamesAreServiceNames) {
   }
 }
 
-// A service "echo" that answers each request with the pid that wrote it.
-class WyreLoopback : public ::testing::Test {
- protected:
-  void SetUp() override {
-    setenv("EKORA_RUNTIME_DIR", dir_.path().c_str(), 1);
-    auto listener = Listener::create("echo", queue_);
-    ASSERT_TRUE(listener.ok()) << listener.error().message;
-    listener_ = listener.value();
-    listener_->setEventHandler([](const ListenerEvent& event) {
-      if (!event.connection) return;
-      std::weak_ptr<Connection> weak = event.connection;
-      event.connection->setEventHandler([weak](const Event& e) {
-        auto self = weak.lock();
-        if (self && e.type == EventType::Message) {
-          self->reply(e.message, Value(Dictionary{{"pid", uint64_t(e.message.sender.pid)}}));
-        }
-      });
-      event.connection->resume();
-    });
-    listener_->resume();
-  }
-  void TearDown() override { listener_->cancel(); }
-
-  ek::testing::TempDir dir_;
-  std::shared_ptr<SerialQueue> queue_ = SerialQueue::make("wyre-test");
-  std::shared_ptr<Listener> listener_;
-};
-
-TEST_F(WyreLoopback, ServiceHasOneListenerAndOnlyItsOwnerMayConnect) {
-  EXPECT_EQ(Listener::create("echo", queue_).error().code, EADDRINUSE);
-  EXPECT_EQ(Connection::connect("nobody-listens").error().code, ENOENT);
-  struct stat st {};
-  ASSERT_EQ(::stat(listener_->path().c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
-}
-
 // The pid the service saw as the writer of the reply's request; absent when the connection
 // closed instead.
 std::optional<pid_t> replyPid(int fd) {
   const timeval timeout{10, 0};
   setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
-  std::vector<uint8_t> bytes;
-  uint8_t buffer[4096];
-  for (ssize_t n; (n = ::read(fd, buffer, sizeof buffer)) > 0;) {
-    bytes.insert(bytes.end(), buffer, buffer + n);
-    if (bytes.size() < kHeaderSize) continue;
-    FrameHeader header = decodeHeader(bytes.data());
-    if (bytes.size() < kHeaderSize + header.length) continue;
-    auto body = cbor::decode(std::span(bytes).subspan(kHeaderSize, header.length));
-    if (!body.ok() || !body->getUnsigned("pid")) return std::nullopt;
-    return static_cast<pid_t>(*body->getUnsigned("pid"));
-  }
-  return std::nullopt;
+  std::vector<uint8_t> bytes(kHeaderSize);
+  if (::recv(fd, bytes.data(), kHeaderSize, MSG_WAITALL) != ssize_t(kHeaderSize)) return {};
+  bytes.resize(kHeaderSize + decodeHeader(bytes.data()).length);
+  ::recv(fd, bytes.data() + kHeaderSize, bytes.size() - kHeaderSize, MSG_WAITALL);
+  const auto pid = cbor::decode(std::span(bytes).subspan(kHeaderSize)).value().getUnsigned("pid");
+  return pid ? std::optional(pid_t(*pid)) : std::nullopt;
 }
 
 void writeAll(int fd, std::span<const uint8_t> bytes) {
@@ -104,9 +62,24 @@ pid_t writeFromChild(const std::function<void()>& write) {
   return child;
 }
 
-// Frames written on a socket by hand: each message carries the process that wrote it; a frame
-// two processes wrote, or one longer than the limit, closes the connection.
-TEST_F(WyreLoopback, FramesAreTakenFromTheProcessThatWroteThemWhole) {
+// Frames written by hand to a service that answers each request with the pid that wrote it:
+// a message carries its writer; a frame two processes wrote, or one over the limit, closes the
+// connection.
+TEST(WyreLoopback, FramesAreTakenFromTheProcessThatWroteThemWhole) {
+  ek::testing::TempDir dir;
+  setenv("EKORA_RUNTIME_DIR", dir.path().c_str(), 1);
+  auto listener = Listener::create("echo", SerialQueue::make("wyre-test")).value();
+  listener->setEventHandler([](const ListenerEvent& event) {
+    if (!event.connection) return;
+    event.connection->setEventHandler([weak = std::weak_ptr(event.connection)](const Event& e) {
+      auto self = weak.lock();
+      if (self && e.type == EventType::Message) {
+        self->reply(e.message, Value(Dictionary{{"pid", uint64_t(e.message.sender.pid)}}));
+      }
+    });
+    event.connection->resume();
+  });
+  listener->resume();
   std::vector<uint8_t> frame;
   appendFrame(frame, Value(Dictionary{}), kFlagWantsReply, 1);
   const auto half = std::span(frame).first(frame.size() / 2);
@@ -132,15 +105,19 @@ TEST_F(WyreLoopback, FramesAreTakenFromTheProcessThatWroteThemWhole) {
          return 0;
        }},
   };
+  struct stat st {};  // the socket is for its owner only
+  ASSERT_EQ(::stat(listener->path().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
   for (const auto& row : rows) {
     int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     sockaddr_un address{.sun_family = AF_UNIX};
-    listener_->path().copy(address.sun_path, sizeof address.sun_path - 1);
+    listener->path().copy(address.sun_path, sizeof address.sun_path - 1);
     ASSERT_EQ(::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
     const pid_t expected = row.write(fd);
     EXPECT_EQ(replyPid(fd), expected ? std::optional(expected) : std::nullopt) << row.name;
     ::close(fd);
   }
+  listener->cancel();
 }
 
 }  // namespace
