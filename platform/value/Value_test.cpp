@@ -19,16 +19,5 @@ TEST(Uuid, ParsesEitherCaseWritesUpperCaseAndRefusesAnythingElse) {
   EXPECT_NE(random, Uuid::random());
 }
 
-TEST(Value, IntegersAreUnsignedUnlessNegativeAndLookupsAnswerOnlyTheirType) {
-  EXPECT_EQ(Value(int64_t{5}), Value(uint64_t{5}));
-  EXPECT_EQ(Value(-3).type(), ValueType::Negative);
-  EXPECT_NE(Value(1), Value(true));
-  Value v(Dictionary{{"name", "A"}, {"list", Array{1, -2, "x"}}});
-  EXPECT_EQ(*v.getString("name"), "A");
-  EXPECT_EQ(v.getString("list"), nullptr);
-  EXPECT_EQ(v.get("missing"), nullptr);
-  EXPECT_EQ(v.description(), R"({"list": [1, -2, "x"], "name": "A"})");
-}
-
 }  // namespace
 }  // namespace ek

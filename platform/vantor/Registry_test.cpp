@@ -2,8 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
-
 namespace ek::vantor {
 namespace {
 
@@ -19,17 +17,6 @@ TEST(PlugInIdentifier, RefusesNamesThatEscapeTheContainersDirectory) {
   for (const std::string& good :
        {std::string("com.example.x"), std::string("..a"), std::string(255, 'y')}) {
     EXPECT_TRUE(checkPlugInIdentifier(good).ok()) << good;
-  }
-}
-
-// Beyond what the registry suite shows: operators and strings among other values.
-TEST(IndexedExtensionPoints, NarrowOnlyForPlainStringsOrArraysOfThem) {
-  auto points = [](Value pattern) {
-    return indexedExtensionPoints({{"ZuExtensionPointIdentifier", pattern}, {"Other", "x"}});
-  };
-  EXPECT_EQ(points(Array{"com.a", 5}), std::vector<std::string>{"com.a"});
-  for (const Value& pattern : {Value("=com.a"), Value("?TY-IS:x"), Value(Array{"a", "<b"})}) {
-    EXPECT_EQ(points(pattern), std::nullopt) << pattern.description();
   }
 }
 
@@ -89,19 +76,6 @@ TEST(Language, CandidatesStripEncodingAndFallBackToTheBaseLanguage) {
       {"../evil", {"en"}},
   };
   for (const Case& c : cases) EXPECT_EQ(languageCandidates(c.language), c.expected) << c.language;
-}
-
-TEST(Language, EnvironmentOrderIsEkoraLocaleThenLcAllThenLcMessagesThenLang) {
-  const char* names[] = {"LANG", "LC_MESSAGES", "LC_ALL", "EKORA_LOCALE"};
-  for (const char* name : names) unsetenv(name);
-  EXPECT_EQ(environmentLanguage(), "en");
-  for (const char* name : names) {
-    setenv(name, name, 1);
-    EXPECT_EQ(environmentLanguage(), name);
-  }
-  setenv("EKORA_LOCALE", "", 1);  // empty is unset
-  EXPECT_EQ(environmentLanguage(), "LC_ALL");
-  for (const char* name : names) unsetenv(name);
 }
 
 }  // namespace

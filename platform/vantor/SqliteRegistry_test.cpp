@@ -2,11 +2,9 @@
 
 #include <fmt/format.h>
 #include <gtest/gtest.h>
-#include <sqlite3.h>
 #include <sys/stat.h>
 
 #include <filesystem>
-#include <fstream>
 
 #include "platform/dmap/Dmap.h"
 #include "platform/testing/Files.h"
@@ -329,20 +327,19 @@ TEST_F(SqliteRegistryTest, NamesFollowTheLanguageAndTheLocaleFileOverridesIt) {
   info["QvBundleDisplayName"] = Value("Display");
   const std::string path = writeApp("X.app", {{"A.appex", info}}) + "/PlugIns/A.appex";
   writeDmap(path + "/fr.lproj/InfoDmap.strings", {{"QvBundleDisplayName", Value("Affichage")}});
-  writeDmap(path + "/de.lproj/Localizable.strings", {{"Rename", Value("Umbenennen")}});
   SqliteRegistry& registry = open();
   ASSERT_TRUE(registry.registerBundle(path).ok());
-  setenv("EKORA_LOCALE", "fr_FR.UTF-8", 1);  // the environment's choice comes first
+  setenv("EKORA_LOCALE", "fr_FR.UTF-8", 1);
   EXPECT_EQ(registry.plugInByUrl(path)->localizedName, "Affichage");
-  unsetenv("EKORA_LOCALE");
+  EXPECT_EQ(registry.localizedStrings(registry.plugInByUrl(path)->uuid, "InfoDmap",
+                                      {"QvBundleDisplayName", "X"}),
+            (Dictionary{{"QvBundleDisplayName", Value("Affichage")}}));
   ASSERT_TRUE(dmap::writeBytesAtomically(state_ + "/locale", "de\nignored\n").ok());
-  const Uuid uuid = registry.plugInByUrl(path)->uuid;
-  EXPECT_EQ(registry.plugInByUrl(path)->localizedName, "Display");
-  EXPECT_EQ(registry.localizedStrings(uuid, "Localizable", {"Rename", "Missing"}),
-            (Dictionary{{"Rename", Value("Umbenennen")}}));
-  // Each change of the language is a notice, also to a query that reads no proxy.
+  EXPECT_EQ(registry.plugInByUrl(path)->localizedName, "Display");  // the file overrides
+  // Each change of the file is a notice, also to a query that reads no proxy.
   fs::remove(state_ + "/locale");
   EXPECT_EQ(registry.queryUuids({}).size(), 1u);
+  unsetenv("EKORA_LOCALE");
   EXPECT_EQ(recorder_->drain(), (std::vector<std::string>{"install 1", "locale 0", "locale 0"}));
 }
 
