@@ -18,9 +18,7 @@ std::vector<uint8_t> fromHex(std::string_view hex) {
 }
 
 std::string toHex(const std::vector<uint8_t>& bytes) {
-  std::string hex;
-  for (uint8_t b : bytes) hex += fmt::format("{:02x}", b);
-  return hex;
+  return fmt::format("{:02x}", fmt::join(bytes, ""));
 }
 
 std::string repeat(std::string_view hex, size_t times) {

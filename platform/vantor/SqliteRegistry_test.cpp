@@ -248,7 +248,6 @@ TEST_F(SqliteRegistryTest, RegistrationReadsBundlesAndKeepsTheirUuids) {
   a.emplace("QvBundleExecutable", "run");
   const std::string app = writeApp("My App.app", {{"A.appex", a}, {"B.appex", b}});
   fakeSigning_->setExecutableEntitlements(app + "/PlugIns/A.appex/run", {{"ent", Value(true)}});
-  fs::create_directories(app + "/PlugIns/NotAPlugIn");
   // A plug-in registers its application with itself alone; the application, all of them.
   ASSERT_TRUE(registry.registerBundle(app + "/PlugIns/A.appex").ok());
   EXPECT_EQ(registry.applicationByPath(app)->plugInUuids.size(), 1u);
@@ -367,10 +366,7 @@ TEST_F(SqliteRegistryTest, StartUpScanReadsOnlyBundlesWithAChangedFile) {
   const std::pair<const char*, std::function<void()>> changes[] = {
       {"Info.dmap rewritten in place",
        [&] { writeFile(bundle + "/Info.dmap", dmap::write(Value(spellInfo("2.0"))).value()); }},
-      {"entitlements added",
-       [&] {
-         writeDmap(bundle + "/spell.entitlements", {{"ent", true}});
-       }},
+      {"entitlements added", [&] { writeDmap(bundle + "/spell.entitlements", {}); }},
       {"strings added", [&] { writeDmap(bundle + "/ja.lproj/InfoDmap.strings", {}); }},
       {"extension point", [&] { writeDmap(system_ + "/Library/ExtensionPoints/x.dmap", {}); }},
       {"executable writable by others", [&] { ::chmod((bundle + "/spell").c_str(), 0777); }},

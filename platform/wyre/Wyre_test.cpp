@@ -24,14 +24,6 @@ TEST(WyreFrame, HeaderIsBigEndianAndCountsTheBody) {
   EXPECT_EQ(back.id, 0x0A0B0C0D0E0F1011ULL);
 }
 
-TEST(WyreServiceName, OnlyPlainFileNamesAreServiceNames) {
-  EXPECT_TRUE(isValidServiceName("com.corvane.ekora.ekd"));
-  for (std::string bad : std::vector<std::string>{"", ".", "..", "a/b", ".hidden", "a b", "a\nb",
-                                                  std::string(200, 'a')}) {
-    EXPECT_FALSE(isValidServiceName(bad)) << bad;
-  }
-}
-
 // The pid the service saw as the writer of the reply's request; absent when the connection
 // closed instead.
 std::optional<pid_t> replyPid(int fd) {
