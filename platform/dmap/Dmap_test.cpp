@@ -116,9 +116,7 @@ TEST(DmapFile, ReadsWhatWasWrittenAtomicallyAndNamesTheFileOfAnError) {
   writeFile(path, "old");
   ASSERT_TRUE(writeFileAtomically(path, value, 0640, Durability::RuntimeOnly).ok());
   EXPECT_EQ(readFile(path).value(), value);
-  struct stat status;
-  ASSERT_EQ(::stat(path.c_str(), &status), 0);
-  EXPECT_EQ(status.st_mode & 07777, 0640u);
+  EXPECT_EQ(std::filesystem::status(path).permissions(), std::filesystem::perms(0640));
   // A failure leaves the old file and no temporary beside it.
   EXPECT_EQ(writeFileAtomically(path, Value("bad\x01")).error().domain, kFormatErrorDomain);
   ASSERT_EQ(::mkdir(dir.file("dir").c_str(), 0700), 0);
@@ -146,7 +144,6 @@ TEST(DmapFile, ReadsBeneathADirectoryOnly) {
   writeFile(bundle + "/Big.dmap",
             document("<string>" + std::string(kMaxBundleFileSize, 'a') + "</string>"));
   ASSERT_EQ(::symlink(secret.c_str(), (bundle + "/Out.dmap").c_str()), 0);
-  ASSERT_EQ(::symlink("/proc/self/root/etc/hostname", (bundle + "/Magic.dmap").c_str()), 0);
   ASSERT_EQ(::mkfifo((bundle + "/Fifo.dmap").c_str(), 0600), 0);
   const struct {
     std::string relative;
@@ -155,7 +152,6 @@ TEST(DmapFile, ReadsBeneathADirectoryOnly) {
   } rows[] = {
       {"Info.dmap", 0, ""},
       {"Out.dmap", EXDEV, "leads out of"},
-      {"Magic.dmap", EXDEV, "leads out of"},
       {"../B.appex/Info.dmap", EXDEV, "leads out of"},
       {secret, EXDEV, "not a path beneath"},
       {"Fifo.dmap", 1, "not a regular file"},

@@ -46,10 +46,8 @@ TEST(WireJson, RefusesWhatTheValueModelCannotHold) {
       {R"({"a": 1, "a": 2})", "repeats the key \"a\""},
       {"18446744073709551616", "outside the 64-bit range"},
       {R"({"$uuid": "E621E1F8-C36C-495A-93FC-0C247A3E6E5"})", "$uuid"},
-      {R"({"$data": "QQ"})", "$data"},
       {R"({"$real": {"$real": 1}})", "holds a typed value"},
       {std::string(kMaxDepth + 1, '[') + std::string(kMaxDepth + 1, ']'), "deeper than 512"},
-      {std::string(100000, '['), "deeper than 512"},
   };
   for (const auto& row : rows) {
     auto parsed = parse(row.text);

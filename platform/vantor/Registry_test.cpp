@@ -35,8 +35,6 @@ TEST(MergeSdk, FollowsTheRuleOfEachKey) {
        D{{"CleanTimeout", 5}}, D{{"CleanTimeout", 30}}},
       {"Shared: lists united, sorted, once each", D{{"Shared", A{"a", "c"}}},
        D{{"Shared", A{"c", "b"}}}, D{{"Shared", A{"a", "b", "c"}}}},
-      {"any other key: the plug-in's own value", D{{"Dedicated", true}}, D{{"Dedicated", false}},
-       D{{"Dedicated", false}}},
       {"dictionaries merge key by key, the rules at every depth",
        D{{"ZuExtensionAttributes", D{{"Sdk", "s"}, {"Both", "sdk"}, {"CleanTimeout", 1}}}},
        D{{"ZuExtensionAttributes", D{{"Both", "own"}, {"CleanTimeout", 2}}}},
