@@ -46,7 +46,6 @@ TEST(Dmap, WritesTheExactFormAndReadsItBack) {
       {std::numeric_limits<int64_t>::min(), "<integer>-9223372036854775808</integer>"},
       {0.5, "<real>0.5</real>"},
       {Data{'h', 'i', '!'}, "<data>aGkh</data>"},
-      {Date{-62135596800}, "<date>0001-01-01T00:00:00Z</date>"},
       {*Uuid::parse("e621e1f8-c36c-495a-93fc-0c247a3e6e5f"),
        "<string>E621E1F8-C36C-495A-93FC-0C247A3E6E5F</string>"},
   };
@@ -85,7 +84,6 @@ TEST(Dmap, RefusesMalformedDocumentsNamingTheLine) {
     std::string message;  // the start of the error message
   } rows[] = {
       {"", "line 1: empty document"},
-      {document("<string>\xff</string>"), "line 3: "},
       {document("<dict>\n<key>x</key><true/>\n<key>x</key><false/>\n</dict>"),
        "line 5: duplicate key \"x\""},
       {head + "<!DOCTYPE dmap [<!ENTITY a \"lol\">]>\n<dmap "

@@ -2,10 +2,10 @@
 
 #include <gtest/gtest.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <filesystem>
 
 #include "platform/cbor/Cbor.h"
 #include "platform/testing/Files.h"
@@ -97,9 +97,8 @@ TEST(WyreLoopback, FramesAreTakenFromTheProcessThatWroteThemWhole) {
          return 0;
        }},
   };
-  struct stat st {};  // the socket is for its owner only
-  ASSERT_EQ(::stat(listener->path().c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  EXPECT_EQ(std::filesystem::status(listener->path()).permissions(),  // for its owner only
+            std::filesystem::perms(0600));
   for (const auto& row : rows) {
     int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     sockaddr_un address{.sun_family = AF_UNIX};
