@@ -154,13 +154,11 @@ std::vector<PlugInProxyPtr> FakeRegistry::query(const Dictionary& rules,
     keys.insert(extensionPointIndexKey(point));
   }
   std::erase_if(candidates, [&](const PlugInProxyPtr& proxy) {
-    const auto values = extensionPointIndexValues(proxy->info);
-    if (points && std::none_of(values.begin(), values.end(), [&](const std::string& value) {
-          return keys.contains(extensionPointIndexKey(value));
-        })) {
-      return true;
+    bool indexed = !points;
+    for (const std::string& value : extensionPointIndexValues(proxy->info)) {
+      indexed = indexed || keys.contains(extensionPointIndexKey(value));
     }
-    return filter && !filter(*proxy);
+    return !indexed || (filter && !filter(*proxy));
   });
   return candidates;
 }
@@ -168,8 +166,7 @@ std::vector<PlugInProxyPtr> FakeRegistry::query(const Dictionary& rules,
 std::optional<Dictionary> FakeRegistry::extensionPointSdk(std::string_view identifier) {
   std::lock_guard lock(mutex_);
   auto it = sdks_.find(identifier);
-  if (it == sdks_.end()) return std::nullopt;
-  return it->second;
+  return it == sdks_.end() ? std::nullopt : std::optional(it->second);
 }
 
 Dictionary FakeRegistry::localizedStrings(const Uuid& plugIn, std::string_view table,

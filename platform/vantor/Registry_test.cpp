@@ -21,30 +21,27 @@ TEST(PlugInIdentifier, RefusesNamesThatEscapeTheContainersDirectory) {
 }
 
 // Each row merges one SDK "ZuExtension" into one of the plug-in's and names what comes out.
+// CleanTimeout: the SDK's wins; Shared: lists united, sorted, once each; any other key: the
+// plug-in's own; dictionaries merge key by key, with these rules at every depth.
 TEST(MergeSdk, FollowsTheRuleOfEachKey) {
   using D = Dictionary;
-  using A = Array;
-  struct Row {
-    const char* name;
-    D sdk;
-    D own;
-    D expected;
-  };
-  const Row rows[] = {
-      {"CleanTimeout: the SDK's replaces the plug-in's", D{{"CleanTimeout", 30}},
-       D{{"CleanTimeout", 5}}, D{{"CleanTimeout", 30}}},
-      {"Shared: lists united, sorted, once each", D{{"Shared", A{"a", "c"}}},
-       D{{"Shared", A{"c", "b"}}}, D{{"Shared", A{"a", "b", "c"}}}},
-      {"dictionaries merge key by key, the rules at every depth",
-       D{{"ZuExtensionAttributes", D{{"Sdk", "s"}, {"Both", "sdk"}, {"CleanTimeout", 1}}}},
-       D{{"ZuExtensionAttributes", D{{"Both", "own"}, {"CleanTimeout", 2}}}},
-       D{{"ZuExtensionAttributes", D{{"Both", "own"}, {"CleanTimeout", 1}, {"Sdk", "s"}}}}},
-  };
-  for (const Row& row : rows) {
-    const D merged = mergeSdk(D{{"ZuExtension", row.sdk}, {"QvBundleName", "sdk"}},
-                              D{{"ZuExtension", row.own}, {"QvBundleName", "own"}});
-    EXPECT_EQ(merged, (D{{"ZuExtension", row.expected}, {"QvBundleName", "own"}})) << row.name;
-  }
+  const D sdk{{"CleanTimeout", 30},
+              {"Shared", Array{"a", "c"}},
+              {"Own", 1},
+              {"Sdk", 1},
+              {"ZuExtensionAttributes", D{{"CleanTimeout", 1}, {"Own", 1}}}};
+  const D own{{"CleanTimeout", 5},
+              {"Shared", Array{"c", "b"}},
+              {"Own", 2},
+              {"ZuExtensionAttributes", D{{"CleanTimeout", 2}, {"Own", 2}}}};
+  const D merged{{"CleanTimeout", 30},
+                 {"Shared", Array{"a", "b", "c"}},
+                 {"Own", 2},
+                 {"Sdk", 1},
+                 {"ZuExtensionAttributes", D{{"CleanTimeout", 1}, {"Own", 2}}}};
+  EXPECT_EQ(mergeSdk({{"ZuExtension", sdk}, {"QvBundleName", "sdk"}},
+                     {{"ZuExtension", own}, {"QvBundleName", "own"}}),
+            (D{{"ZuExtension", merged}, {"QvBundleName", "own"}}));
 }
 
 TEST(FileUrl, RoundTripsPathsAndRefusesWhatDoesNotLocateALocalBundle) {

@@ -13,17 +13,6 @@
 namespace ek::wyre {
 namespace {
 
-TEST(WyreFrame, HeaderIsBigEndianAndCountsTheBody) {
-  std::vector<uint8_t> out{0xEE};
-  appendFrame(out, Value(Dictionary{{"a", 1}}), kFlagWantsReply, 0x0A0B0C0D0E0F1011ULL);
-  const std::vector<uint8_t> header(out.begin() + 1, out.begin() + 1 + kHeaderSize);
-  EXPECT_EQ(header, (std::vector<uint8_t>{0, 0, 0, 4, 0, 0, 0, 1, 10, 11, 12, 13, 14, 15, 16, 17}));
-  FrameHeader back = decodeHeader(header.data());
-  EXPECT_EQ(back.length, out.size() - 1 - kHeaderSize);
-  EXPECT_EQ(back.flags, kFlagWantsReply);
-  EXPECT_EQ(back.id, 0x0A0B0C0D0E0F1011ULL);
-}
-
 // The pid the service saw as the writer of the reply's request; absent when the connection
 // closed instead.
 std::optional<pid_t> replyPid(int fd) {
@@ -57,7 +46,7 @@ pid_t writeFromChild(const std::function<void()>& write) {
 // Frames written by hand to a service that answers each request with the pid that wrote it:
 // a message carries its writer; a frame two processes wrote, or one over the limit, closes the
 // connection.
-TEST(WyreLoopback, FramesAreTakenFromTheProcessThatWroteThemWhole) {
+TEST(WyreFrame, FramesAreTakenWholeFromTheProcessThatWroteThem) {
   ek::testing::TempDir dir;
   setenv("EKORA_RUNTIME_DIR", dir.path().c_str(), 1);
   auto listener = Listener::create("echo", SerialQueue::make("wyre-test")).value();
@@ -72,8 +61,11 @@ TEST(WyreLoopback, FramesAreTakenFromTheProcessThatWroteThemWhole) {
     event.connection->resume();
   });
   listener->resume();
-  std::vector<uint8_t> frame;
-  appendFrame(frame, Value(Dictionary{}), kFlagWantsReply, 1);
+  std::vector<uint8_t> frame;  // its header big-endian: length, flags, id
+  appendFrame(frame, Value(Dictionary{}), kFlagWantsReply, 0x0A0B0C0D0E0F1011);
+  EXPECT_EQ(std::vector(frame.begin(), frame.begin() + kHeaderSize),
+            (std::vector<uint8_t>{0, 0, 0, 1, 0, 0, 0, 1, 10, 11, 12, 13, 14, 15, 16, 17}));
+  EXPECT_EQ(decodeHeader(frame.data()).id, 0x0A0B0C0D0E0F1011u);
   const auto half = std::span(frame).first(frame.size() / 2);
   const auto rest = std::span(frame).subspan(half.size());
   const struct {
