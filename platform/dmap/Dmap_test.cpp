@@ -43,7 +43,6 @@ TEST(Dmap, WritesTheExactFormAndReadsItBack) {
     std::string element;
   } rows[] = {
       {"a < \" ' ]]> \t\n\xe2\x82\xac", "<string>a &lt; \" ' ]]&gt; \t\n\xe2\x82\xac</string>"},
-      {std::numeric_limits<int64_t>::min(), "<integer>-9223372036854775808</integer>"},
       {0.5, "<real>0.5</real>"},
       {Data{'h', 'i', '!'}, "<data>aGkh</data>"},
       {*Uuid::parse("e621e1f8-c36c-495a-93fc-0c247a3e6e5f"),

@@ -20,7 +20,6 @@ TEST(WireJson, TypedValuesRoundTripThroughTheirReservedNames) {
       {std::numeric_limits<uint64_t>::max(), "18446744073709551615"},
       {std::numeric_limits<int64_t>::min(), "-9223372036854775808"},
       {0.1, R"({"$real":0.1})"},
-      {std::numeric_limits<double>::infinity(), R"({"$real":"Infinity"})"},
       {kUuid, R"({"$uuid":"E621E1F8-C36C-495A-93FC-0C247A3E6E5F"})"},
       {Data{'A', 'B'}, R"({"$data":"QUI="})"},
       {Date{1700000000.25}, R"({"$date":1700000000.25})"},

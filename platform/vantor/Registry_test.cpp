@@ -11,7 +11,6 @@ TEST(PlugInIdentifier, RefusesNamesThatEscapeTheContainersDirectory) {
         std::string("a\0b", 3), std::string(256, 'x')}) {
     auto checked = checkPlugInIdentifier(bad);
     ASSERT_FALSE(checked.ok()) << bad;
-    EXPECT_EQ(checked.error().domain, kErrorDomain);
     EXPECT_EQ(checked.error().code, kInvalidIdentifier);
   }
   for (const std::string& good :
