@@ -71,9 +71,7 @@ TEST(Dmap, WriteAndItsCheckRefuseWhatTheFormatCannotCarry) {
   // Depth counts from where the value will sit.
   EXPECT_FALSE(checkWritable(nestedArrays(kMaxDepth), 1).ok());
   EXPECT_FALSE(writeEntry("key", nestedArrays(kMaxDepth - 1), 2).ok());
-  EXPECT_FALSE(
-      write(Value(Array{std::string(kMaxFileSize / 2, 'a'), std::string(kMaxFileSize / 2, 'b')}))
-          .ok());
+  EXPECT_FALSE(write(Value(std::string(kMaxFileSize, 'a'))).ok());
 }
 
 TEST(Dmap, RefusesMalformedDocumentsNamingTheLine) {
@@ -167,17 +165,6 @@ TEST(DmapFile, ReadsBeneathADirectoryOnly) {
     EXPECT_NE(read.error().message.find(row.reason), std::string::npos) << read.error().message;
     EXPECT_EQ(read.error().message.find("secret</string>"), std::string::npos);
   }
-}
-
-TEST(DmapFile, StaleTemporariesOfTheTargetAloneAreRemoved) {
-  TempDir dir;
-  for (const char* name : {".Annotations.a1B2c3", ".Annotations.ZZZZZZ", "Annotations",
-                           ".Annotations.short", ".Annotations.toolong1", ".Other.a1B2c3"}) {
-    writeFile(dir.file(name), "x");
-  }
-  ASSERT_EQ(::mkdir(dir.file(".Annotations.dir123").c_str(), 0700), 0);
-  EXPECT_EQ(removeStaleTemporaries(dir.file("Annotations")).value(), 2u);
-  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.path()), {}), 5);
 }
 
 }  // namespace

@@ -240,9 +240,6 @@ TEST_F(SqliteRegistryTest, RegistrationReadsBundlesInTheCurrentLanguageAndKeepsT
   writeDmap(app + "/PlugIns/A.appex/fr.lproj/InfoDmap.strings",
             {{"QvBundleDisplayName", Value("Affichage")}});
   fakeSigning_->setExecutableEntitlements(app + "/PlugIns/A.appex/run", {{"ent", Value(true)}});
-  // A plug-in registers its application with itself alone; the application, all of them.
-  ASSERT_TRUE(registry.registerBundle(app + "/PlugIns/A.appex").ok());
-  EXPECT_EQ(registry.applicationByPath(app)->plugInUuids.size(), 1u);
   ASSERT_TRUE(registry.registerBundle(app).ok());
   const PlugInProxies plugIns = registry.plugInsOfApplication(app);
   ASSERT_EQ(plugIns.size(), 2u);
