@@ -54,7 +54,6 @@ std::vector<std::pair<Value, std::string>> known() {
 std::vector<std::pair<Value, std::string>> foreign() {
   return {
       {Data{1, 2, 3, 4, 5}, "5f42010243030405ff"},
-      {"streaming", "7f657374726561646d696e67ff"},
       {Dictionary{{"a", 1}, {"b", Array{2, 3}}}, "bf61610161629f0203ffff"},
   };
 }

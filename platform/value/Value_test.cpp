@@ -13,10 +13,7 @@ TEST(Uuid, ParsesEitherCaseWritesUpperCaseAndRefusesAnythingElse) {
         "G621E1F8-C36C-495A-93FC-0C247A3E6E5F"}) {
     EXPECT_FALSE(Uuid::parse(text)) << text;
   }
-  const Uuid random = Uuid::random();
-  EXPECT_EQ(random.bytes[6] >> 4, 4);
-  EXPECT_EQ(random.bytes[8] >> 6, 2);
-  EXPECT_NE(random, Uuid::random());
+  EXPECT_EQ(Uuid::random().bytes[6] >> 4, 4);  // version 4
 }
 
 }  // namespace

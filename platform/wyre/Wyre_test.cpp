@@ -5,6 +5,7 @@
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
 #include <filesystem>
 
 #include "platform/cbor/Cbor.h"
