@@ -43,15 +43,11 @@ TEST(Dmap, WritesTheExactFormAndReadsItBack) {
     std::string element;
   } rows[] = {
       {"a < \" ' ]]> \t\n\xe2\x82\xac", "<string>a &lt; \" ' ]]&gt; \t\n\xe2\x82\xac</string>"},
-      {0.5, "<real>0.5</real>"},
       {Data{'h', 'i', '!'}, "<data>aGkh</data>"},
-      {*Uuid::parse("e621e1f8-c36c-495a-93fc-0c247a3e6e5f"),
-       "<string>E621E1F8-C36C-495A-93FC-0C247A3E6E5F</string>"},
   };
   for (const auto& row : rows) {
     EXPECT_EQ(write(row.value).value(), document(row.element));
-    const Value read = row.value.uuid() ? Value(row.value.uuid()->string()) : row.value;
-    EXPECT_EQ(parse(document(row.element)).value(), read);
+    EXPECT_EQ(parse(document(row.element)).value(), row.value);
   }
   EXPECT_EQ(write(Value(Date{1700000000.75})).value(),
             document("<date>2023-11-14T22:13:20Z</date>"));
@@ -66,7 +62,6 @@ TEST(Dmap, WriteAndItsCheckRefuseWhatTheFormatCannotCarry) {
     Result<std::string> written = write(value);
     ASSERT_FALSE(written.ok()) << value.description();
     EXPECT_EQ(checkWritable(value).error(), written.error());
-    EXPECT_FALSE(checkWritable(Value(Dictionary{{"k", Array{value}}})).ok());
   }
   // Depth counts from where the value will sit.
   EXPECT_FALSE(checkWritable(nestedArrays(kMaxDepth), 1).ok());
