@@ -13,8 +13,7 @@ TEST(PlugInIdentifier, RefusesNamesThatEscapeTheContainersDirectory) {
     ASSERT_FALSE(checked.ok()) << bad;
     EXPECT_EQ(checked.error().code, kInvalidIdentifier);
   }
-  for (const std::string& good :
-       {std::string("com.example.x"), std::string("..a"), std::string(255, 'y')}) {
+  for (const std::string& good : {std::string("..a"), std::string(255, 'y')}) {
     EXPECT_TRUE(checkPlugInIdentifier(good).ok()) << good;
   }
 }
