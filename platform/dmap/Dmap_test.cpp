@@ -76,6 +76,7 @@ TEST(Dmap, RefusesMalformedDocumentsNamingTheLine) {
     std::string message;  // the start of the error message
   } rows[] = {
       {"", "line 1: empty document"},
+      {document("<integer>18446744073709551616</integer>"), "line 3: "},
       {document("<dict>\n<key>x</key><true/>\n<key>x</key><false/>\n</dict>"),
        "line 5: duplicate key \"x\""},
       {head + "<!DOCTYPE dmap [<!ENTITY a \"lol\">]>\n<dmap "

@@ -41,6 +41,7 @@ TEST(WireJson, RefusesWhatTheValueModelCannotHold) {
     const char* message;  // a fragment of the expected message
   } rows[] = {
       {"[1, null]", "null"},
+      {R"("\ud800")", "malformed"},
       {R"({"a": 1, "a": 2})", "repeats the key \"a\""},
       {"18446744073709551616", "outside the 64-bit range"},
       {R"({"$uuid": "E621E1F8-C36C-495A-93FC-0C247A3E6E5"})", "$uuid"},
