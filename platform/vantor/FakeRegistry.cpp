@@ -17,9 +17,7 @@ void FakeRegistry::install(PlugInProxy proxy) {
     plugIns_[shared->uuid] = shared;
     knowledge_ = Uuid::random();
   }
-  auto observers = liveObservers();
-  if (observers.empty()) return;
-  queue_->async([observers = std::move(observers), shared] {
+  queue_->async([observers = liveObservers(), shared] {
     for (const auto& observer : observers) observer->pluginsDidInstall({shared});
   });
 }
@@ -27,17 +25,12 @@ void FakeRegistry::install(PlugInProxy proxy) {
 bool FakeRegistry::uninstall(const Uuid& uuid) {
   PlugInProxyPtr proxy = plugInByUuid(uuid);
   if (!proxy) return false;
+  // Told before the plug-in goes, as the registry does, on its queue.
   auto observers = liveObservers();
   auto deliver = [&] {
     for (const auto& observer : observers) observer->pluginsWillUninstall({proxy});
   };
-  if (!observers.empty()) {
-    if (queue_->isCurrent()) {
-      deliver();
-    } else {
-      queue_->sync(deliver);
-    }
-  }
+  if (!observers.empty()) queue_->isCurrent() ? deliver() : queue_->sync(deliver);
   std::lock_guard lock(mutex_);
   plugIns_.erase(uuid);
   knowledge_ = Uuid::random();
@@ -83,8 +76,7 @@ std::vector<std::string> FakeRegistry::unregisteredPaths() const {
 }
 
 void FakeRegistry::changeLocale() {
-  auto observers = liveObservers();
-  queue_->async([observers = std::move(observers)] {
+  queue_->async([observers = liveObservers()] {
     for (const auto& observer : observers) observer->localeDidChange();
   });
 }
@@ -114,12 +106,9 @@ PlugInProxyPtr FakeRegistry::plugInByUuid(const Uuid& uuid) {
 
 PlugInProxyPtr FakeRegistry::plugInByUrl(std::string_view urlOrPath) {
   auto path = pathFromUrlOrPath(urlOrPath);
-  if (!path) return nullptr;
-  std::lock_guard lock(mutex_);
-  for (const auto& [uuid, proxy] : plugIns_) {
-    if (proxy->path == *path) return proxy;
-  }
-  return nullptr;
+  auto all = installedPlugIns();
+  auto it = std::find_if(all.begin(), all.end(), [&](const auto& p) { return p->path == path; });
+  return it == all.end() ? nullptr : *it;
 }
 
 std::vector<PlugInProxyPtr> FakeRegistry::sortedLocked() const {
@@ -131,13 +120,9 @@ std::vector<PlugInProxyPtr> FakeRegistry::sortedLocked() const {
 
 std::vector<PlugInProxyPtr> FakeRegistry::plugInsOfApplication(std::string_view appPath) {
   auto path = pathFromUrlOrPath(appPath);
-  if (!path) return {};
-  std::lock_guard lock(mutex_);
-  std::vector<PlugInProxyPtr> result;
-  for (PlugInProxyPtr& proxy : sortedLocked()) {
-    if (proxy->containingAppPath == *path) result.push_back(std::move(proxy));
-  }
-  return result;
+  auto all = installedPlugIns();
+  std::erase_if(all, [&](const auto& p) { return !path || p->containingAppPath != *path; });
+  return all;
 }
 
 std::vector<PlugInProxyPtr> FakeRegistry::installedPlugIns() {
@@ -147,9 +132,8 @@ std::vector<PlugInProxyPtr> FakeRegistry::installedPlugIns() {
 
 ApplicationProxyPtr FakeRegistry::applicationByPath(std::string_view urlOrPath) {
   auto path = pathFromUrlOrPath(urlOrPath);
-  if (!path) return nullptr;
   std::lock_guard lock(mutex_);
-  auto it = applications_.find(*path);
+  auto it = path ? applications_.find(*path) : applications_.end();
   return it == applications_.end() ? nullptr : it->second;
 }
 
@@ -163,32 +147,26 @@ ApplicationProxyPtr FakeRegistry::applicationByIdentifier(std::string_view ident
 
 std::vector<PlugInProxyPtr> FakeRegistry::query(const Dictionary& rules,
                                                 const PlugInFilter& filter) {
-  std::vector<PlugInProxyPtr> candidates;
-  {
-    std::lock_guard lock(mutex_);
-    candidates = sortedLocked();
+  std::vector<PlugInProxyPtr> candidates = installedPlugIns();
+  std::set<std::string> keys;
+  auto points = indexedExtensionPoints(rules);
+  for (const std::string& point : points.value_or(std::vector<std::string>{})) {
+    keys.insert(extensionPointIndexKey(point));
   }
-  if (auto points = indexedExtensionPoints(rules)) {
-    std::set<std::string> keys;
-    for (const std::string& point : *points) keys.insert(extensionPointIndexKey(point));
-    std::erase_if(candidates, [&](const PlugInProxyPtr& proxy) {
-      for (const std::string& value : extensionPointIndexValues(proxy->info)) {
-        if (keys.contains(extensionPointIndexKey(value))) return false;
-      }
-      return true;
-    });
-  }
-  if (filter) {
-    std::erase_if(candidates, [&](const PlugInProxyPtr& proxy) { return !filter(*proxy); });
-  }
+  std::erase_if(candidates, [&](const PlugInProxyPtr& proxy) {
+    bool indexed = !points;
+    for (const std::string& value : extensionPointIndexValues(proxy->info)) {
+      indexed = indexed || keys.contains(extensionPointIndexKey(value));
+    }
+    return !indexed || (filter && !filter(*proxy));
+  });
   return candidates;
 }
 
 std::optional<Dictionary> FakeRegistry::extensionPointSdk(std::string_view identifier) {
   std::lock_guard lock(mutex_);
   auto it = sdks_.find(identifier);
-  if (it == sdks_.end()) return std::nullopt;
-  return it->second;
+  return it == sdks_.end() ? std::nullopt : std::optional(it->second);
 }
 
 Dictionary FakeRegistry::localizedStrings(const Uuid& plugIn, std::string_view table,
@@ -198,9 +176,7 @@ Dictionary FakeRegistry::localizedStrings(const Uuid& plugIn, std::string_view t
   auto it = strings_.find({plugIn, std::string(table)});
   if (it == strings_.end()) return result;
   for (const std::string& key : keys) {
-    if (auto value = it->second.find(key); value != it->second.end()) {
-      result.emplace(key, value->second);
-    }
+    if (auto value = it->second.find(key); value != it->second.end()) result.insert(*value);
   }
   return result;
 }
