@@ -205,11 +205,11 @@ uint64_t EkdProcess::notificationGeneration(std::string_view name) const {
   return generation;
 }
 
-std::string ekctlWithEntitlements(const fs::path& dir,
-                                  const std::vector<std::string>& entitlements) {
+std::string ekctlWithEntitlements(const fs::path& dir, const std::vector<std::string>& entitlements,
+                                  const fs::path& source) {
   fs::create_directories(dir);
-  fs::path program = dir / "ekctl";
-  fs::copy_file(ekctlPath(), program, fs::copy_options::overwrite_existing);
+  fs::path program = dir / source.filename();
+  fs::copy_file(source, program, fs::copy_options::overwrite_existing);
   std::string text = "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<dmap version=\"1.0\">\n<dict>\n";
   for (const auto& name : entitlements) text += "\t<key>" + name + "</key>\n\t<true/>\n";
   text += "</dict>\n</dmap>\n";

@@ -85,18 +85,19 @@ class EkdProcess {
   int exitStatus_ = -1;
 };
 
-// A copy of ekctl in dir with an entitlements file beside it granting each name (owned by this
-// user, mode 0644, so the daemon honours it); answers the copy's path.
+// The paths of the built programs.
+std::string ekdPath();
+std::string ekctlPath();
+
+// A copy of ekctl (or of program) in dir with an entitlements file beside it granting each name
+// (owned by this user, mode 0644, so the daemon honours it); answers the copy's path.
 std::string ekctlWithEntitlements(const std::filesystem::path& dir,
-                                  const std::vector<std::string>& entitlements);
+                                  const std::vector<std::string>& entitlements,
+                                  const std::filesystem::path& program = ekctlPath());
 
 // The "errorcode" of a reply as the signed 32-bit code it carries (0 when absent), and its
 // "error" text (empty when absent).
 int64_t replyErrorCode(const Value& reply);
 std::string replyError(const Value& reply);
-
-// The paths of the built programs.
-std::string ekdPath();
-std::string ekctlPath();
 
 }  // namespace ek::test

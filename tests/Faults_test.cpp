@@ -315,6 +315,63 @@ TEST_F(HostileConnection, EntitlementsAreNotLentWithTheSocket) {
   EXPECT_EQ(replyErrorCode(reply->body), 11) << reply->body.description().substr(0, 200);
 }
 
+// A writer that executes another program is judged as the program it runs now, not by the record
+// kept for its pid.
+TEST_F(HostileConnection, WriterThatExecutesAnotherProgramIsJudgedAnew) {
+  const std::string cat = ekctlWithEntitlements(root_ / "entitled", {kManager}, "/bin/cat");
+  const Value all = request("match", {{"flags", Value(kDiscoverAll)}});
+  RawClient client(daemon_.socketPath());
+  int input[2];
+  ASSERT_EQ(::pipe(input), 0);
+  pid_t child = fork();
+  if (child == 0) {
+    // First as this unentitled program, refused; then cat, entitled, copies the next request in.
+    RawClient own(::dup(client.fd()));
+    if (!own.sendMessage(all, 1)) _exit(1);
+    auto refused = own.readFrame();
+    if (!refused || replyErrorCode(refused->body) != 11) _exit(2);
+    ::dup2(input[0], 0);
+    ::dup2(client.fd(), 1);
+    ::close(input[1]);  // cat ends at the end of its input
+    execl(cat.c_str(), cat.c_str(), nullptr);
+    _exit(127);
+  }
+  ::close(input[0]);
+  const fs::path exe = "/proc/" + std::to_string(child) + "/exe";
+  for (int i = 0; i < 500; ++i) {
+    std::error_code ignored;
+    if (fs::read_symlink(exe, ignored) == cat) break;
+    std::this_thread::sleep_for(10ms);
+  }
+  std::vector<uint8_t> frame;
+  wyre::appendFrame(frame, all, wyre::kFlagWantsReply, 2);
+  ASSERT_EQ(::write(input[1], frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+  auto reply = client.readFrame();
+  ::close(input[1]);
+  int status = 0;
+  waitpid(child, &status, 0);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
+  ASSERT_TRUE(reply) << daemon_.log();
+  EXPECT_EQ(replyErrorCode(reply->body), 0) << reply->body.description().substr(0, 200);
+}
+
+// An instance serves its own user and root only: a writer of another uid is cut off, whoever
+// connected. Writing as another user needs root.
+TEST_F(HostileConnection, WriterOfAnotherUserIsCutOff) {
+  if (geteuid() != 0) GTEST_SKIP() << "only root can write as another user";
+  RawClient client(daemon_.socketPath());
+  pid_t child = fork();
+  if (child == 0) {
+    if (::setgid(65534) != 0 || ::setuid(65534) != 0) _exit(1);
+    _exit(client.sendMessage(request("status"), 1) ? 0 : 2);
+  }
+  int status = 0;
+  waitpid(child, &status, 0);
+  ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
+  EXPECT_TRUE(client.closedByPeer()) << daemon_.log();
+  EXPECT_TRUE(servedWithin(2s)) << daemon_.log();
+}
+
 // Messages that want no reply count among those that may wait: a flood of them keeps no other
 // client waiting.
 TEST_F(HostileConnection, FloodOfMessagesWantingNoReplyIsBounded) {
