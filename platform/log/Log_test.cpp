@@ -23,13 +23,14 @@ namespace {
 TEST(FormatMessage, RendersTheDaemonsSpecifiers) {
   const Value dict(Dictionary{{"a", Value(1)}});
   int negative = -1;
+  const std::string owned = "owned";  // an argument views its text, so the text must outlive it
   const std::tuple<const char*, std::vector<Arg>, std::string> cases[] = {
       {"client %d requested %{public}s", {4243, "find"}, "client 4243 requested find"},
       {"%999999999999d", {1}, std::string(4095, ' ') + "1"},  // a hostile width is bounded
       {"%u %lx %llu",
        {negative, negative, uint64_t{1} << 63},
        "4294967295 ffffffffffffffff 9223372036854775808"},
-      {"%@ %{private}s %s", {dict, std::string("owned"), true}, dict.description() + " owned true"},
+      {"%@ %{private}s %s", {dict, owned, true}, dict.description() + " owned true"},
       {"failed: %{errno}d, %{uuid_t}.16P",
        {2, *Uuid::parse("e621e1f8-c36c-495a-93fc-0c247a3e6e5f")},
        "failed: 2, E621E1F8-C36C-495A-93FC-0C247A3E6E5F"},

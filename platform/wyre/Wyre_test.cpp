@@ -25,7 +25,8 @@ std::optional<pid_t> replyPid(int fd) {
   if (n != ssize_t(kHeaderSize)) return std::nullopt;
   bytes.resize(kHeaderSize + decodeHeader(bytes.data()).length);
   ::recv(fd, bytes.data() + kHeaderSize, bytes.size() - kHeaderSize, MSG_WAITALL);
-  const auto pid = cbor::decode(std::span(bytes).subspan(kHeaderSize)).value().getUnsigned("pid");
+  const Value reply = cbor::decode(std::span(bytes).subspan(kHeaderSize)).value();
+  const uint64_t* pid = reply.getUnsigned("pid");
   return pid ? std::optional(pid_t(*pid)) : std::nullopt;
 }
 
