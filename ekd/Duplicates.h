@@ -31,7 +31,10 @@ class DuplicateFilter {
     std::optional<size_t> replaces;
   };
 
-  explicit DuplicateFilter(uint64_t flags) : flags_(flags) {}
+  // expected: how many matches are likely, so that the index is not rebuilt as it grows.
+  explicit DuplicateFilter(uint64_t flags, size_t expected = 0) : flags_(flags) {
+    accepted_.reserve(expected);
+  }
   // Fed every match in order.
   Verdict admit(const Copy& copy);
 

@@ -106,11 +106,13 @@ bool candidateWins(const DuplicateFilter::Weighed& plugIn,
 DuplicateFilter::Verdict DuplicateFilter::admit(const Copy& copy) {
   const uint64_t flags = flags_;
   const std::string* version = copy.version ? copy.version->string() : nullptr;
-  const Weighed plugIn{std::string(formVersion(copy.version).value_or(std::string_view())),
-                       copy.system, copy.modified};
+  Weighed plugIn{std::string(formVersion(copy.version).value_or(std::string_view())), copy.system,
+                 copy.modified};
   Verdict verdict;
   bool dropped = false;
-  auto sameIdentifier = accepted_.find(copy.identifier.value_or(""));
+  // Without an identifier a match is weighed against those named "", without a copy of either.
+  static const std::string kNoIdentifier;
+  auto sameIdentifier = accepted_.find(copy.identifier ? *copy.identifier : kNoIdentifier);
   if (sameIdentifier != accepted_.end()) {
     auto& positions = sameIdentifier->second;
     for (auto position = positions.begin(); position != positions.end(); ++position) {
@@ -144,7 +146,12 @@ DuplicateFilter::Verdict DuplicateFilter::admit(const Copy& copy) {
   }
   if (dropped) return verdict;
   verdict.kept = true;
-  if (copy.identifier) accepted_[*copy.identifier].emplace_back(next_, plugIn);
+  if (copy.identifier) {
+    if (sameIdentifier == accepted_.end()) {
+      sameIdentifier = accepted_.try_emplace(*copy.identifier).first;
+    }
+    sameIdentifier->second.emplace_back(next_, std::move(plugIn));
+  }
   ++next_;
   return verdict;
 }
@@ -200,7 +207,7 @@ Reply matchPlugIns(const Request& request, EkDServer& daemon) {
   // so that the positions recorded per identifier stay valid.
   using MatchRef = std::shared_ptr<Match>;
   std::vector<MatchRef> results;
-  DuplicateFilter duplicates(flags);
+  DuplicateFilter duplicates(flags, candidates.size());
   std::unordered_map<std::string, MatchRef> overrides;
   const Dictionary* matchRules = rules ? &*rules : nullptr;
   EkDFormCache& forms = database.formCache();
