@@ -43,8 +43,6 @@ class DuplicateFilter {
     std::string version;
     bool system = false;
     int32_t modified = 0;
-    bool onSystemVolume() const { return system; }
-    int32_t lastModified() const { return modified; }
   };
 
  private:

@@ -164,7 +164,7 @@ void EkDWyreClient::handleEvent(const wyre::Event& event) {
     std::string text = message.body.description();
     EK_PROBE2(request_input, pid_, text.c_str());
   }
-  submit(Transaction::initWithWrittenRequest(message, shared_from_this()));
+  submit(Transaction::initWithRequest(message, shared_from_this()));
 }
 
 void EkDWyreClient::submit(std::shared_ptr<Transaction> transaction) {

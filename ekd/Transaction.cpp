@@ -12,23 +12,13 @@
 
 namespace ek {
 
-std::shared_ptr<Transaction> Transaction::initWithRequest(
-    wyre::Message request, std::shared_ptr<EkDWyreClient> client,
-    std::shared_ptr<const EkDClientProcess> sender) {
-  if (!sender) sender = client->process();
-  return std::shared_ptr<Transaction>(
-      new Transaction(std::move(request), std::move(client), std::move(sender)));
+std::shared_ptr<Transaction> Transaction::initWithRequest(wyre::Message request,
+                                                          std::shared_ptr<EkDWyreClient> client) {
+  return std::shared_ptr<Transaction>(new Transaction(std::move(request), std::move(client)));
 }
 
-std::shared_ptr<Transaction> Transaction::initWithWrittenRequest(
-    wyre::Message request, std::shared_ptr<EkDWyreClient> client) {
-  return std::shared_ptr<Transaction>(
-      new Transaction(std::move(request), std::move(client), nullptr));
-}
-
-Transaction::Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client,
-                         std::shared_ptr<const EkDClientProcess> sender)
-    : client_(std::move(client)), sender_(std::move(sender)), request_(std::move(request)) {}
+Transaction::Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client)
+    : client_(std::move(client)), request_(std::move(request)) {}
 
 const EkDClientProcess& Transaction::sender() const {
   if (!sender_) sender_ = client_->writerOf(request_);

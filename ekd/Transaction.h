@@ -24,14 +24,10 @@ class EkDWyreClient;
 // termination, on its termination waiter).
 class Transaction : public std::enable_shared_from_this<Transaction> {
  public:
-  // sender is the process that wrote the request; nullptr means the one that connected.
-  static std::shared_ptr<Transaction> initWithRequest(
-      wyre::Message request, std::shared_ptr<EkDWyreClient> client,
-      std::shared_ptr<const EkDClientProcess> sender = nullptr);
-  // The same, with the writer's record looked up (EkDWyreClient::writerOf) only when the
-  // request first asks about its sender.
-  static std::shared_ptr<Transaction> initWithWrittenRequest(wyre::Message request,
-                                                             std::shared_ptr<EkDWyreClient> client);
+  // The writer's record is looked up (EkDWyreClient::writerOf) only when the request first
+  // asks about its sender.
+  static std::shared_ptr<Transaction> initWithRequest(wyre::Message request,
+                                                      std::shared_ptr<EkDWyreClient> client);
 
   // Checks version and type and runs the request's handler; its reply is sent exactly once.
   void dispatch();
@@ -46,8 +42,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   std::shared_ptr<wyre::Connection> connection() const;
 
  private:
-  Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client,
-              std::shared_ptr<const EkDClientProcess> sender);
+  Transaction(wyre::Message request, std::shared_ptr<EkDWyreClient> client);
 
   // Sends reply on the client's connection (a no-op when it has gone).
   void send(Reply reply);
@@ -56,8 +51,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   void sendFrame(std::vector<uint8_t> frame);
 
   std::shared_ptr<EkDWyreClient> client_;
-  // Null until asked for when the writer's record is looked up on first use; then set on the
-  // work queue.
+  // Null until a handler first asks for the writer; then set on the work queue.
   mutable std::shared_ptr<const EkDClientProcess> sender_;
   wyre::Message request_;
   std::atomic<uint64_t> version_{0};

@@ -4,7 +4,6 @@
 #include <unordered_map>
 
 #include "Ekora/EkBundle.h"
-#include "Ekora/EkCollections.h"
 #include "Ekora/EkDaemonClient.h"
 #include "Ekora/EkPlugInKeys.h"
 #include "Ekora/EkProtocol.h"
@@ -27,14 +26,6 @@ namespace {
 
 namespace form = plugin::form;
 using Candidates = std::vector<std::shared_ptr<EkDPlugIn>>;
-
-// The version text of the plug-in's form: its version when that is a string, the no-version
-// text when it has none, nothing for a version of another type.
-std::optional<std::string_view> formVersion(const Value* version) {
-  if (version == nullptr) return plugin::kNoVersion;
-  if (const std::string* text = version->string()) return *text;
-  return std::nullopt;
-}
 
 // One plug-in of the reply: its kept form, and what this reply adds to it.
 struct Match {
@@ -92,69 +83,7 @@ struct CandidateList {
   }
 };
 
-// Whether candidate P wins over an earlier match X of the same identifier and version.
-bool candidateWins(const DuplicateFilter::Weighed& plugIn,
-                   const DuplicateFilter::Weighed& earlier) {
-  bool earlierSystem = earlier.onSystemVolume();
-  if (!plugIn.onSystemVolume() && earlierSystem) return false;
-  if (plugIn.onSystemVolume() && !earlierSystem) return true;
-  return plugIn.lastModified() > earlier.lastModified();
-}
-
 }  // namespace
-
-DuplicateFilter::Verdict DuplicateFilter::admit(const Copy& copy) {
-  const uint64_t flags = flags_;
-  const std::string* version = copy.version ? copy.version->string() : nullptr;
-  Weighed plugIn{std::string(formVersion(copy.version).value_or(std::string_view())), copy.system,
-                 copy.modified};
-  Verdict verdict;
-  bool dropped = false;
-  // Without an identifier a match is weighed against those named "", without a copy of either.
-  static const std::string kNoIdentifier;
-  auto sameIdentifier = accepted_.find(copy.identifier ? *copy.identifier : kNoIdentifier);
-  if (sameIdentifier != accepted_.end()) {
-    auto& positions = sameIdentifier->second;
-    for (auto position = positions.begin(); position != positions.end(); ++position) {
-      const Weighed& earlier = position->second;
-      auto order = compareVersionString(version, earlier.version);
-      bool removeEarlier = false;
-      bool stop = true;
-      if (!(flags & protocol::kDiscoverKeepVersions)) {
-        if (order > 0) {
-          removeEarlier = true;
-        } else if (order < 0) {
-          dropped = true;
-        } else if (candidateWins(plugIn, earlier)) {
-          removeEarlier = true;
-        } else {
-          dropped = true;
-        }
-      } else if (order != 0 || (flags & protocol::kDiscoverKeepDuplicates)) {
-        stop = false;
-      } else if (candidateWins(plugIn, earlier)) {
-        removeEarlier = true;
-      } else {
-        dropped = true;
-      }
-      if (removeEarlier) {
-        verdict.replaces = position->first;
-        positions.erase(position);
-      }
-      if (stop) break;
-    }
-  }
-  if (dropped) return verdict;
-  verdict.kept = true;
-  if (copy.identifier) {
-    if (sameIdentifier == accepted_.end()) {
-      sameIdentifier = accepted_.try_emplace(*copy.identifier).first;
-    }
-    sameIdentifier->second.emplace_back(next_, std::move(plugIn));
-  }
-  ++next_;
-  return verdict;
-}
 
 namespace handlers {
 
